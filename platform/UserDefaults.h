@@ -1,0 +1,40 @@
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/Dictionary.h"
+#include "platform/Runtime.h"
+
+namespace sable::platform {
+
+/// Typed settings by key. Precedence: profile, then user, then what the daemon wrote, then the
+/// registered default. A value of another type than asked for counts as absent and is reported
+/// once at error level. Any thread; reads do not block on the disk.
+class UserDefaults {
+ public:
+  virtual ~UserDefaults() = default;
+
+  /// Adds defaults of lowest precedence; `object` maps keys to values. Nothing is written.
+  virtual void registerDefaults(const Dictionary& object) = 0;
+
+  virtual std::optional<bool> boolean(std::string_view key) const = 0;
+  virtual std::optional<std::int64_t> integer(std::string_view key) const = 0;
+  virtual std::optional<double> number(std::string_view key) const = 0;  ///< integers count too
+  virtual std::optional<std::string> string(std::string_view key) const = 0;
+  virtual std::optional<WallTime> date(std::string_view key) const = 0;
+  virtual std::optional<Dictionary> array(std::string_view key) const = 0;
+  virtual std::optional<Dictionary> dictionary(std::string_view key) const = 0;
+
+  /// Writes a value of the daemon's own (below profile and user). Null removes it. Becomes durable
+  /// at the latest with synchronize().
+  virtual void set(std::string_view key, const Dictionary& value) = 0;
+  virtual void setDate(std::string_view key, WallTime value) = 0;
+
+  /// Writes pending values to disk now; may block. Failure is logged once and leaves the old file.
+  virtual void synchronize() = 0;
+};
+
+}  // namespace sable::platform
