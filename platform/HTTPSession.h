@@ -27,6 +27,9 @@ class HTTPHeaders {
 
   const std::vector<std::pair<std::string, std::string>>& fields() const { return fields_; }
 
+  /// "{name: value, ...}", for log lines.
+  std::string description() const;
+
  private:
   std::vector<std::pair<std::string, std::string>> fields_;
 };
@@ -51,6 +54,9 @@ struct HTTPResponse {
   int status = 0;
   HTTPHeaders headers;
   bool fromCache = false;
+
+  /// "status url {headers}", for log lines.
+  std::string description() const;
 };
 
 /// Where the time of a task went; offsets from its start (RFC 9110 has no such thing: the fields

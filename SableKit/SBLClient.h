@@ -1,0 +1,77 @@
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "SableKit/SBLReply.h"
+#include "SableKit/SBLRequest.h"
+#include "SableKit/SBLSessionConfiguration.h"
+#include "platform/Relay.h"
+#include "platform/Runtime.h"
+
+namespace sable {
+
+/// What an application links to search: one connection to the daemon, opened and configured at the
+/// first call and again at the first call after it was lost (the daemon closes idle connections
+/// after 60 s). A call that was under way when the connection broke fails; it is not sent again,
+/// for a search of a moment ago may no longer be wanted.
+///
+/// All operations: any thread, never wait for the daemon. Handlers run on the connection's queue,
+/// exactly once each.
+class SBLClient : public std::enable_shared_from_this<SBLClient> {
+ public:
+  /// The raw bag, as JSON text, and the user agent it was read for; called whenever the daemon
+  /// pushes one.
+  using BagHandler = std::function<void(const std::string& rawBag, const std::string& userAgent,
+                                        const std::optional<Error>& error)>;
+  using ResultHandler = platform::Function<void(Expected<platform::RelayArguments>)>;
+
+  static std::shared_ptr<SBLClient> create(platform::Runtime& runtime, platform::Relay& relay,
+                                           platform::RelayEndpoint daemon,
+                                           SBLSessionConfiguration configuration);
+
+  void setBagHandler(BagHandler handler);
+  /// How long a call may wait for its answer; 20 s unless set. Before the first call.
+  void setTimeout(platform::Duration timeout) { timeout_ = timeout; }
+
+  /// Opens and configures the connection, if there is none; the result is the endpoint's address.
+  void connect(platform::Function<void(Expected<platform::RelayEndpoint>)> handler);
+  void request(SBLAnyRequest request, SBLReplyHandler handler);
+  void bag(platform::Function<void(std::string rawBag, std::string userAgent, std::optional<Error>)> handler);
+
+  /// Any method of SBLDaemonRelay, with its arguments and results as they travel.
+  void call(std::size_t method, platform::RelayArguments arguments, ResultHandler handler);
+
+  /// Ends the connection.
+  void disconnect();
+
+ private:
+  struct Key {};
+
+ public:
+  SBLClient(Key, platform::Runtime& runtime, platform::Relay& relay, platform::RelayEndpoint daemon,
+            SBLSessionConfiguration configuration);
+
+ private:
+  Expected<std::shared_ptr<platform::RelayConnection>> ensureConnection();
+  void handleCall(platform::RelayCall call);
+  void configured(Expected<platform::RelayArguments> result);
+  void connectionLost(const platform::RelayConnection* connection);
+
+  platform::Relay& relay_;
+  const platform::RelayEndpoint daemon_;
+  const SBLSessionConfiguration configuration_;
+  const std::shared_ptr<platform::SerialQueue> queue_;
+  platform::Duration timeout_ = std::chrono::seconds(20);
+
+  // On queue_.
+  std::shared_ptr<platform::RelayConnection> connection_;
+  std::optional<Expected<platform::RelayEndpoint>> endpoint_;
+  std::vector<platform::Function<void(Expected<platform::RelayEndpoint>)>> awaitingEndpoint_;
+  BagHandler bagHandler_;
+};
+
+}  // namespace sable

@@ -1,0 +1,31 @@
+#pragma once
+
+#include <string_view>
+
+/// Names and values that the daemon, its clients and the service share. All leave the process.
+namespace sable {
+
+inline constexpr std::string_view kSBLErrorDomain = "SBLErrorDomain";
+inline constexpr std::string_view kSBLSabledNameVersion = "Sabled/1.0";
+inline constexpr std::string_view kSBLSubsystem = "com.kestrel.sabled";
+/// The name under which clients find the daemon.
+inline constexpr std::string_view kSBLServiceName = kSBLSubsystem;
+/// Counts every search sent to the service, by any client.
+inline constexpr std::string_view kSBLSearchCounterKey = "com.kestrel.sabled.searches";
+
+inline constexpr std::string_view kSBLLookupHintsWeekly = "lookup_hints_weekly";
+inline constexpr std::string_view kSBLLookupHintsMonthly = "lookup_hints_monthly";
+inline constexpr std::string_view kSBLInstalledAppWhitelist = "installed_app_whitelist";
+
+inline constexpr std::string_view kSBLNotifyEnabled = "com.kestrel.sable.enabled";
+inline constexpr std::string_view kSBLNotifyDisabled = "com.kestrel.sable.disabled";
+/// Key of the bag in the user info of "SBLBagChangeNotification": std::shared_ptr<const SBLBag>.
+inline constexpr std::string_view kSBLNotificationBagKey = "bag";
+
+// User settings with registered defaults.
+inline constexpr std::string_view kSBLSharedSession = "SBLSharedSession";
+inline constexpr std::string_view kSBLSessionSizeLimit = "SBLSessionSizeLimit";
+inline constexpr std::string_view kSBLSessionMaxAge = "SBLSessionMaxAge";
+inline constexpr std::string_view kSBLUseBramble = "SBLUseBramble";
+
+}  // namespace sable

@@ -1,0 +1,17 @@
+#include "SableKit/SBLError.h"
+
+#include <nlohmann/json.hpp>
+
+#include "SableKit/SBLConstants.h"
+
+namespace sable {
+
+Error makeSBLError(SBLErrorCode code, std::string reason) {
+  return {std::string(kSBLErrorDomain), static_cast<std::int64_t>(code), std::move(reason)};
+}
+
+Dictionary encodeErrorForJSON(const Error& error) {
+  return {{"code", error.code}, {"domain", error.domain}, {"reason", error.reason}};
+}
+
+}  // namespace sable

@@ -1,0 +1,40 @@
+#include "SableKit/SBLRelayInterfaces.h"
+
+#include <array>
+
+namespace sable {
+namespace {
+
+using platform::RelayMethod;
+
+constexpr std::array kDaemonMethods{
+    RelayMethod{"Configure", "a{sv}", "s"},
+    RelayMethod{"Bag", "", "ssa{sv}"},
+    RelayMethod{"Request", "sa{sv}", "ta{sv}a{sv}"},
+    RelayMethod{"ReportEvent", "txsay", ""},
+    RelayMethod{"ReportEventData", "txay", ""},
+    RelayMethod{"Feedback", "", "asa{sv}"},
+    RelayMethod{"ListenToFlusher", "", "s"},
+    RelayMethod{"ListSessions", "", "aa{sv}"},
+    RelayMethod{"FileHandleAndAttributesForResource", "s", "aha{sv}a{sv}"},
+};
+
+constexpr std::array kClientMethods{
+    RelayMethod{"BagDidLoad", "ssa{sv}", ""},
+};
+
+constexpr std::array kEndpointMethods{
+    RelayMethod{"Request", "sa{sv}a{sv}", "ta{sv}a{sv}"},
+    RelayMethod{"LoadImages", "aa{sv}t", "a{say}"},
+};
+
+}  // namespace
+
+const platform::RelayInterface kSBLDaemonRelay{"com.kestrel.SBLDaemonRelay", "/com/kestrel/sabled",
+                                               kDaemonMethods};
+const platform::RelayInterface kSBLClientRelay{"com.kestrel.SBLClientRelay", "/com/kestrel/client",
+                                               kClientMethods};
+const platform::RelayInterface kSBLEndpointRelay{"com.kestrel.SBLEndpointRelay", "/com/kestrel/endpoint",
+                                                 kEndpointMethods};
+
+}  // namespace sable

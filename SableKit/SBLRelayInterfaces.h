@@ -1,0 +1,44 @@
+#pragma once
+
+#include <cstddef>
+
+#include "platform/Relay.h"
+
+/// The interfaces spoken between the daemon and its clients. The order of methods is part of the
+/// contract; the enumerations give each its place.
+namespace sable {
+
+/// Exported by the daemon on every client connection.
+extern const platform::RelayInterface kSBLDaemonRelay;
+struct SBLDaemonRelay {
+  enum Method : std::size_t {
+    configure,                           ///< a{sv} configuration -> s endpoint address
+    bag,                                 ///< -> s raw bag JSON, s user agent, a{sv} error
+    request,                             ///< s class, a{sv} record -> t query id, a{sv} reply, a{sv} error
+    reportEvent,                         ///< t event, x query id, s class, ay message
+    reportEventData,                     ///< t event, x query id, ay payload message
+    feedback,                            ///< -> as feedback JSON, a{sv} error
+    listenToFlusher,                     ///< -> s endpoint address
+    listSessions,                        ///< -> aa{sv}
+    fileHandleAndAttributesForResource,  ///< s identifier -> ah file, a{sv} attributes, a{sv} error
+  };
+};
+
+/// Implemented by clients: the daemon pushes bags.
+extern const platform::RelayInterface kSBLClientRelay;
+struct SBLClientRelay {
+  enum Method : std::size_t {
+    bagDidLoad,  ///< s raw bag JSON, s user agent, a{sv} error
+  };
+};
+
+/// Exported by the daemon on the endpoint that `configure` answers with.
+extern const platform::RelayInterface kSBLEndpointRelay;
+struct SBLEndpointRelay {
+  enum Method : std::size_t {
+    request,     ///< s class, a{sv} record, a{sv} configuration -> as SBLDaemonRelay::request
+    loadImages,  ///< aa{sv} descriptions, t deadline -> a{say} images
+  };
+};
+
+}  // namespace sable

@@ -1,0 +1,60 @@
+#pragma once
+
+#include <memory>
+#include <mutex>
+
+#include "platform/Platform.h"
+
+namespace sable::platform {
+class HTTPSession;
+}
+
+namespace sable {
+
+class ClientSessionManager;
+class ClientStateManager;
+class SBLNetworkRequestFactory;
+class SableBagController;
+class SableUserGUIDController;
+
+/// Holds every long-lived service and setting of the daemon. Services are made in the order of
+/// start-up, reach each other only through here, and live as long as the process. A service that
+/// this build or device does not have is null; its users go on without it.
+class Assembly {
+ public:
+  explicit Assembly(platform::Platform& platform);
+  ~Assembly();
+  Assembly(const Assembly&) = delete;
+  Assembly& operator=(const Assembly&) = delete;
+
+  platform::Platform& platform;
+  platform::Runtime& runtime;
+  platform::UserDefaults& userDefaults;
+  platform::FileManager& fileManager;
+  platform::NotificationCenter& notificationCenter;
+  platform::Tally& tally;
+
+  bool sharedSession = false;  ///< one feedback session for all clients instead of one per client
+
+  // Destroyed in reverse order: what is built on others goes first.
+  std::unique_ptr<SBLNetworkRequestFactory> requestFactory;
+  std::unique_ptr<SableUserGUIDController> guidController;
+  ClientSessionManager* clientSessionManager = nullptr;  ///< null: sessions are not recorded
+  std::unique_ptr<SableBagController> bagController;
+  std::unique_ptr<ClientStateManager> clientStateManager;
+
+  /// Whether the bag is mirrored to disk. Deliberately no setting.
+  bool diskBagCacheEnabled() const { return true; }
+  /// The setting "SBLUseBramble", read anew at each call.
+  bool useBramble() const;
+
+  // HTTP sessions, each made at its first use, once. Any thread.
+  platform::HTTPSession& urlSession();  ///< searches, warm-up, images; with a response cache
+  platform::HTTPSession& bagSession();  ///< bag fetches; without a cache
+
+ private:
+  std::once_flag urlSessionOnce_, bagSessionOnce_;
+  std::unique_ptr<platform::HTTPSession> urlSession_, bagSession_;
+};
+
+}  // namespace sable

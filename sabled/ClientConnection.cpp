@@ -1,0 +1,287 @@
+#include "sabled/ClientConnection.h"
+
+#include <nlohmann/json.hpp>
+#include <utility>
+
+#include "SableKit/SBLBag.h"
+#include "SableKit/SBLConstants.h"
+#include "SableKit/SBLError.h"
+#include "SableKit/SBLRelayCoding.h"
+#include "SableKit/SBLRelayInterfaces.h"
+#include "SableKit/SBLTracing.h"
+#include "platform/DeviceInfo.h"
+#include "sabled/Assembly.h"
+#include "sabled/ClientState.h"
+#include "sabled/ClientStateManager.h"
+#include "sabled/KeyboardLocale.h"
+#include "sabled/RequestReply.h"
+#include "sabled/SableBagController.h"
+#include "sabled/SableLogging.h"
+#include "sabled/UserAgent.h"
+
+namespace sable {
+namespace {
+
+using platform::QualityOfService;
+using platform::RelayRecord;
+
+// Points of a query's way that a trace shows; the numbers are known to the tools that read it.
+constexpr std::uint32_t kTraceSearchStart = 0x2b000004;
+constexpr std::uint32_t kTraceSearchEnd = 0x2b000008;
+constexpr std::uint32_t kTraceCard = 0x2b00000c;
+constexpr std::uint32_t kTraceFeedback = 0x2b000024;
+
+const platform::LogHandle& log() {
+  return SableLogForCategory(SableLoggingCategoryConnection);
+}
+
+}  // namespace
+
+ClientConnection::ClientConnection(Assembly& assembly, std::shared_ptr<platform::RelayConnection> connection)
+    : assembly_(assembly),
+      connection_(std::move(connection)),
+      transaction_(assembly.platform.transactions().open("clientConnection")),
+      lastCall_(assembly.runtime.ticks()) {}
+
+ClientConnection::~ClientConnection() = default;
+
+void ClientConnection::start() {
+  connection_->exportObject(kSBLDaemonRelay, [weak = weak_from_this()](platform::RelayCall call) {
+    if (const auto self = weak.lock()) self->handleInvocation(std::move(call));
+  });
+  armIdleTimer(kClientIdleTimeout);
+  connection_->resume();
+}
+
+void ClientConnection::armIdleTimer(platform::Duration delay) {
+  timer_ =
+      assembly_.runtime.globalQueue(QualityOfService::background).after(delay, [weak = weak_from_this()] {
+        if (const auto self = weak.lock()) self->idleTimerFired();
+      });
+}
+
+void ClientConnection::idleTimerFired() {
+  // A call only notes its time: the timer that was set before it finds out and waits for the rest.
+  const platform::Duration silence = assembly_.runtime.ticks() - lastCall_.load();
+  if (silence < kClientIdleTimeout) return armIdleTimer(kClientIdleTimeout - silence);
+  log().debug("timing out idle relay connection");
+  connection_->invalidate();
+}
+
+void ClientConnection::handleInvocation(platform::RelayCall call) {
+  lastCall_ = assembly_.runtime.ticks();
+  auto& arguments = call.arguments;
+  switch (call.method) {
+    case SBLDaemonRelay::configure:
+      return configure(decodeConfiguration(std::get<RelayRecord>(arguments[0])), std::move(call.reply));
+    case SBLDaemonRelay::bag:
+      return bag(std::move(call.reply));
+    case SBLDaemonRelay::request:
+      return request(call);
+    case SBLDaemonRelay::reportEvent:
+    case SBLDaemonRelay::reportEventData:
+      return reportEvent(call);
+    case SBLDaemonRelay::feedback:
+      return feedback(std::move(call.reply));
+    case SBLDaemonRelay::listenToFlusher:
+      _ensureState();
+      return call.reply.fail("org.freedesktop.DBus.Error.NotSupported", "this daemon uploads no sessions");
+    case SBLDaemonRelay::listSessions:
+      return listSessions(std::move(call.reply));
+    case SBLDaemonRelay::fileHandleAndAttributesForResource:
+      return fileHandleAndAttributesForResource(std::get<std::string>(arguments[0]), std::move(call.reply));
+    default:
+      return;
+  }
+}
+
+bool ClientConnection::_ensureState() {
+  if (!configuration_) {
+    log().fault("configuration must not be nil");
+    return false;
+  }
+  const std::string agent =
+      composeUserAgent(configuration_->userAgent.value_or(""), assembly_.platform.deviceInfo());
+  if (!configuration_->identifier || agent.empty()) {
+    log().fault("configuration requires identifier and agent");
+    return false;
+  }
+  userAgent_ = agent;
+  if (state_ != nullptr) {
+    if (state_->identifier() != *configuration_->identifier) log().fault("session identifier must match");
+    return true;
+  }
+  state_ = assembly_.clientStateManager->stateForClientIdentifier(*configuration_->identifier);
+  if (state_ != nullptr) state_->setConfiguration(*configuration_);
+  return state_ != nullptr;
+}
+
+void ClientConnection::configure(SBLSessionConfiguration configuration, platform::RelayReply reply) {
+  log().standard("client configuration {}", configuration.description());
+  configuration_ = std::move(configuration);
+  if (!_ensureState()) {
+    reply.forget();
+    return failConfiguration();
+  }
+  // Answered first: the client need not wait for the bag.
+  reply(assembly_.clientStateManager->endpoint());
+  state_->bag(userAgent_,
+              [weak = weak_from_this()](std::shared_ptr<const SBLBag> bag, std::optional<Error> error) {
+                if (const auto self = weak.lock()) self->startServing(bag, error);
+              });
+}
+
+void ClientConnection::failConfiguration() {
+  log().fault("invalid configuration, closing connection");
+  connection_->invalidate();
+}
+
+void ClientConnection::startServing(const std::shared_ptr<const SBLBag>& bag,
+                                    const std::optional<Error>& error) {
+  if (bag == nullptr || !bag->feedbackEnabled()) {
+    log().standard("feedback collection disabled in bag for user agent {}", userAgent_);
+  }
+  log().standard("sending bag with version: {} to client: {} error: {}",
+                 bag == nullptr ? "(null)" : bag->version(), configuration_->identifier.value_or("(null)"),
+                 error ? error->description() : "(null)");
+  pushBag(bag.get(), error);
+  if (!bagObservation_) {
+    bagObservation_ = assembly_.notificationCenter.observe(
+        std::string(kSBLBagChangeNotification),
+        [weak = weak_from_this()](const platform::Notification& notification) {
+          if (const auto self = weak.lock()) self->bagChangeNotification(notification);
+        });
+  }
+  assembly_.clientStateManager->saveState();
+}
+
+void ClientConnection::bagChangeNotification(const platform::Notification& notification) {
+  const auto bag = bagFromNotification(notification);
+  log().standard("bag change notification: {}", bag == nullptr ? "(null)" : bag->version());
+  if (bag == nullptr) return;
+  connection_->queue().async([weak = weak_from_this(), bag] {
+    const auto self = weak.lock();
+    if (self == nullptr) return;
+    const SBLBag seen(bag->rawBag(), self->userAgent_);
+    self->pushBag(&seen, std::nullopt);
+  });
+}
+
+void ClientConnection::pushBag(const SBLBag* bag, const std::optional<Error>& error) {
+  connection_->send(kSBLClientRelay, SBLClientRelay::bagDidLoad,
+                    {bag == nullptr ? std::string() : compactJSON(*bag->rawBag()),
+                     bag == nullptr ? userAgent_ : bag->userAgent(), encodeError(error)});
+}
+
+void ClientConnection::bag(platform::RelayReply reply) {
+  if (!_ensureState()) return reply.forget();
+  state_->bag(userAgent_, [reply = std::move(reply)](std::shared_ptr<const SBLBag> bag,
+                                                     std::optional<Error> error) mutable {
+    reply(bag == nullptr ? std::string() : compactJSON(*bag->rawBag()),
+          bag == nullptr ? std::string() : bag->userAgent(), encodeError(error));
+  });
+}
+
+void ClientConnection::fillDefaults(SBLRequest& request) const {
+  if (!request.keyboardInputMode) {
+    request.keyboardInputMode = currentKeyboardInputMode(assembly_.platform.inputModes());
+    log().info("keyboardInputMode property not set, using {}", *request.keyboardInputMode);
+  }
+  if (request.scale == 0.0) {
+    request.scale = assembly_.platform.deviceInfo().mainScreenScale();
+    log().info("request scale property not set, using {:f}", request.scale);
+  }
+}
+
+void ClientConnection::request(platform::RelayCall& call) {
+  const bool hasState = _ensureState();
+  auto decoded =
+      decodeRequest(std::get<std::string>(call.arguments[0]), std::get<RelayRecord>(call.arguments[1]));
+  // A record of another class, or one before any configuration, never gets an answer.
+  if (!decoded || !hasState) return call.reply.forget();
+  std::visit([this](auto& request) { fillDefaults(request); }, *decoded);
+  SBLReplyHandler reply = replyHandler(std::move(call.reply));
+
+  struct Router {
+    ClientConnection& self;
+    SBLReplyHandler& reply;
+    void operator()(SBLSearchRequest& request) { self.search(std::move(request), std::move(reply)); }
+    void operator()(SBLMoreResultsRequest& request) {
+      self.state_->moreResults(std::move(request), std::move(reply));
+    }
+    void operator()(SBLCardRequest& request) {
+      SBLTracePoint(kTraceCard);
+      self.state_->card(std::move(request), std::move(reply));
+    }
+    void operator()(SBLZeroKeywordRequest& request) {
+      self.state_->zeroKeyword(std::move(request), std::move(reply));
+    }
+    void operator()(SBLLookupRequest& request) { self.state_->lookup(std::move(request), std::move(reply)); }
+    void operator()(SBLFlightLookupRequest& request) { self.state_->flightLookup(request, std::move(reply)); }
+    void operator()(SBLFlightSearchRequest& request) { self.state_->flightSearch(request, std::move(reply)); }
+  };
+  std::visit(Router{*this, reply}, *decoded);
+}
+
+void ClientConnection::search(SBLSearchRequest request, SBLReplyHandler reply) {
+  SBLTracePoint(kTraceSearchStart);
+  const std::uint64_t queryId = request.queryId;
+  std::uint64_t current = currentQueryId_.load();
+  if (queryId <= current || !currentQueryId_.compare_exchange_strong(current, queryId)) {
+    reply(queryId, std::nullopt, std::nullopt);
+    SBLTracePoint(kTraceSearchEnd);
+    return;
+  }
+  state_->search(std::move(request),
+                 [self = shared_from_this(), reply = std::move(reply)](
+                     std::uint64_t id, std::optional<SBLReply> answer, std::optional<Error> error) mutable {
+                   if (self->currentQueryId_.load() > id) {
+                     // A newer search has superseded this one: its client no longer shows what was found.
+                     answer.reset();
+                     error.reset();
+                   }
+                   reply(id, std::move(answer), std::move(error));
+                   SBLTracePoint(kTraceSearchEnd);
+                 });
+}
+
+void ClientConnection::reportEvent(platform::RelayCall& call) {
+  if (!_ensureState()) {
+    log().error("state must not be nil");
+  } else if (state_->sessionManager() == nullptr) {
+    log().error("session manager nil");
+  }
+  call.reply.send({});
+}
+
+void ClientConnection::feedback(platform::RelayReply reply) {
+  SBLTracePoint(kTraceFeedback);
+  _ensureState();
+  reply(platform::RelayStrings{}, RelayRecord{});
+}
+
+void ClientConnection::listSessions(platform::RelayReply reply) {
+  _ensureState();
+  platform::RelayRecords records;
+  for (const auto& session : assembly_.clientStateManager->sessions()) {
+    RelayRecord& record = records.emplace_back();
+    record.add("identifier", session.identifier);
+    record.add("agent", session.agent);
+  }
+  reply(std::move(records));
+}
+
+void ClientConnection::fileHandleAndAttributesForResource(const std::string& identifier,
+                                                          platform::RelayReply reply) {
+  _ensureState();
+  reply(platform::RelayFile{}, RelayRecord{},
+        encodeError(makeSBLError(SBLErrorCode::daemonSide,
+                                 "identifier: " + identifier + " exception: no download manager")));
+}
+
+void ClientConnection::flushSessionInvalidation(platform::Function<void(bool)> callback) {
+  // Without a session manager there is nothing to flush.
+  callback(false);
+}
+
+}  // namespace sable

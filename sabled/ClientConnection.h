@@ -1,0 +1,86 @@
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "SableKit/SBLReply.h"
+#include "SableKit/SBLRequest.h"
+#include "SableKit/SBLSessionConfiguration.h"
+#include "platform/NotificationCenter.h"
+#include "platform/Relay.h"
+#include "platform/Runtime.h"
+#include "platform/Transaction.h"
+
+namespace sable {
+
+class Assembly;
+class ClientState;
+class SBLBag;
+
+/// How long a connection may be silent before the daemon closes it.
+inline constexpr platform::Duration kClientIdleTimeout = std::chrono::seconds(60);
+
+/// What a client calls: SBLDaemonRelay on one connection.
+///
+///     accepted --configure--> bound to its client's state --+
+///        |                                                  |-- 60 s without a call, or the
+///        +-- configure that names no identifier or agent ---+   client's end --> invalidated
+///
+/// Calls arrive on the connection's queue, one at a time. Kept alive by the service's list and by
+/// whatever the client still waits for.
+class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
+ public:
+  ClientConnection(Assembly& assembly, std::shared_ptr<platform::RelayConnection> connection);
+  ~ClientConnection();
+
+  /// Begins to serve. Once, after construction.
+  void start();
+
+  const platform::RelayConnection& connection() const { return *connection_; }
+  const std::shared_ptr<ClientState>& state() const { return state_; }
+
+  /// Ends the client's session, where it has one of its own; tells whether it did. Called when the
+  /// connection has ended.
+  void flushSessionInvalidation(platform::Function<void(bool)> callback);
+
+ private:
+  void handleInvocation(platform::RelayCall call);
+  void idleTimerFired();
+  void armIdleTimer(platform::Duration delay);
+
+  bool _ensureState();
+  void configure(SBLSessionConfiguration configuration, platform::RelayReply reply);
+  void failConfiguration();
+  void startServing(const std::shared_ptr<const SBLBag>& bag, const std::optional<Error>& error);
+  void bag(platform::RelayReply reply);
+  void bagChangeNotification(const platform::Notification& notification);
+  void pushBag(const SBLBag* bag, const std::optional<Error>& error);
+
+  void request(platform::RelayCall& call);
+  void fillDefaults(SBLRequest& request) const;
+  void search(SBLSearchRequest request, SBLReplyHandler reply);
+  void reportEvent(platform::RelayCall& call);
+  void feedback(platform::RelayReply reply);
+  void listSessions(platform::RelayReply reply);
+  void fileHandleAndAttributesForResource(const std::string& identifier, platform::RelayReply reply);
+
+  Assembly& assembly_;
+  const std::shared_ptr<platform::RelayConnection> connection_;
+  const std::shared_ptr<platform::Transaction> transaction_;
+
+  std::atomic<std::uint64_t> currentQueryId_{0};  ///< of the newest search; only grows
+  std::atomic<platform::MonotonicTime> lastCall_;
+
+  // On the connection's queue.
+  std::optional<SBLSessionConfiguration> configuration_;
+  std::string userAgent_;
+  std::shared_ptr<ClientState> state_;
+  platform::NotificationCenter::Token bagObservation_;
+
+  platform::Timer timer_;  ///< on the background queue
+};
+
+}  // namespace sable

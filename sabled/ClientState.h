@@ -1,0 +1,102 @@
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "SableKit/SBLReply.h"
+#include "SableKit/SBLRequest.h"
+#include "SableKit/SBLSessionConfiguration.h"
+#include "platform/HTTPSession.h"
+#include "platform/NotificationCenter.h"
+#include "platform/Runtime.h"
+
+namespace sable {
+
+class Assembly;
+class ClientSessionManager;
+class SBLBag;
+class SableUserGUIDController;
+
+/// Why a query was not sent to the service. The values leave the device in feedback: never
+/// renumber.
+enum class SkipSearchTrigger { queryTooShort = 1, bagDisabled = 2, bagFetchFailed = 3, cacheHit = 4 };
+
+/// Everything the daemon keeps for one client session identifier, shared by all connections that
+/// present it, for the life of the process; and the road of each kind of query. Operations run on
+/// the caller's queue and block it for at most the second that the first bag may take. Replies
+/// arrive there or on the HTTP session's callback queue.
+class ClientState : public std::enable_shared_from_this<ClientState> {
+ public:
+  ClientState(std::string identifier, Assembly& assembly);
+  ~ClientState();
+
+  const std::string& identifier() const { return identifier_; }
+  /// The first known product that the identifier names ("rover"), for counters; or none.
+  const std::optional<std::string>& clientShortName() const { return clientShortName_; }
+  /// Null when the daemon records no sessions.
+  ClientSessionManager* sessionManager() const { return sessionManager_; }
+
+  std::optional<std::string> userAgent() const;
+  void setUserAgent(std::string userAgent);
+  void setConfiguration(SBLSessionConfiguration configuration);
+
+  using BagReply = platform::Function<void(std::shared_ptr<const SBLBag>, std::optional<Error>)>;
+  /// The bag as `userAgent` sees it; a new agent rebuilds it. Waits up to 1 s for the first bag,
+  /// then answers with an error.
+  void bag(const std::string& userAgent, BagReply reply);
+
+  /// Opens a connection to the service ahead of a search, unless one was used within 30 s.
+  void warm();
+
+  // Each replies exactly once. Its gates, in order: a bag, a bag that enables the service for this
+  // agent, and for searches enough text; a refused query is answered with neither reply nor error.
+  void search(SBLSearchRequest request, SBLReplyHandler reply);
+  void zeroKeyword(SBLZeroKeywordRequest request, SBLReplyHandler reply);
+  void lookup(SBLLookupRequest request, SBLReplyHandler reply);
+  void moreResults(SBLMoreResultsRequest request, SBLReplyHandler reply);
+  void card(SBLCardRequest request, SBLReplyHandler reply);
+  /// Accepted, and answered at once with nothing.
+  void flightSearch(const SBLFlightSearchRequest& request, SBLReplyHandler reply);
+  void flightLookup(const SBLFlightLookupRequest& request, SBLReplyHandler reply);
+
+ private:
+  struct QueryKind;
+  struct Query;
+  static const QueryKind kSearch, kZeroKeyword, kLookup, kMoreResults, kCard;
+
+  bool _ensureBag();
+  void bagChangeNotification(const platform::Notification& notification);
+  void _markNetworkRequest();
+  std::shared_ptr<const SBLBag> heldBag() const;
+
+  std::shared_ptr<Query> begin(const QueryKind& kind, const SBLRequest& request, const std::string& input,
+                               SBLReplyHandler reply);
+  bool passesGates(Query& query);
+  void dispatch(const std::shared_ptr<Query>& query, std::optional<platform::HTTPRequest> request);
+  void didComplete(Query& query, platform::HTTPResult result);
+  void processAnswer(const Query& query, const std::string& body, std::optional<Error>& parseError);
+  bool routesThroughProxy(const Query& query) const;
+  void enableProxy(platform::HTTPDataTask& task) const;
+  void recordSearchResult(int status);
+  void forceFetch(const platform::HTTPRequest& request);
+  void count(std::string_view event);
+
+  Assembly& assembly_;
+  const std::string identifier_;
+  const std::optional<std::string> clientShortName_;
+  const std::shared_ptr<platform::SerialQueue> queue_;
+  const std::unique_ptr<platform::Semaphore> bagFetchSemaphore_;
+  std::unique_ptr<SableUserGUIDController> ownGUIDController_;
+  SableUserGUIDController* guidController_;
+  ClientSessionManager* sessionManager_;
+
+  // On queue_, which never runs anything that waits.
+  SBLSessionConfiguration configuration_;
+  std::optional<std::string> userAgent_;
+  std::shared_ptr<const SBLBag> bag_;
+  std::optional<platform::MonotonicTime> lastNetworkRequest_;
+  platform::NotificationCenter::Token bagObservation_;
+};
+
+}  // namespace sable

@@ -1,0 +1,169 @@
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "SableKit/SBLRequest.h"
+#include "platform/HTTPSession.h"
+#include "platform/MapsService.h"
+#include "platform/NotificationCenter.h"
+#include "platform/Runtime.h"
+#include "platform/URL.h"
+#include "platform/UUID.h"
+
+namespace sable {
+
+class Assembly;
+class SBLBag;
+class SableBagController;
+class SableURLRequestBuilder;
+
+/// Posted (object: the factory) when the locale, region or country changed, on which the bag's URL
+/// depends.
+inline constexpr std::string_view kSBLBagRefreshRequired = "SBLBagRefreshRequired";
+
+/// Bit 0 of a field mask: nothing that tells where the device is, and no privacy proxy.
+inline constexpr unsigned kSBLFieldMaskNoLocation = 1;
+
+/// Builds every request that the daemon sends, from what the client asked, the bag and the context
+/// of the device (locale, country, time zone, restrictions), which it keeps current. Any thread:
+/// each entry point builds synchronously on the context queue, so that one request sees one
+/// context. docs/service.md lists every item and header.
+class SBLNetworkRequestFactory {
+ public:
+  explicit SBLNetworkRequestFactory(Assembly& assembly);
+  ~SBLNetworkRequestFactory();
+
+  platform::HTTPRequest warmRequest(std::string_view url);
+  platform::HTTPRequest bagFetchRequest(const SableBagController& bagController, std::string_view userAgent,
+                                        std::string_view version);
+  /// Never sent: its URL changes exactly when the locale, languages, country, agent or debug items
+  /// do, which is how an outdated bag is recognised.
+  platform::HTTPRequest bagCacheRequest(const SableBagController& bagController, std::string_view userAgent,
+                                        std::string_view version);
+
+  // nullopt when the bag has no search URL.
+  std::optional<platform::HTTPRequest> searchRequest(const SBLSearchRequest& input, const SBLBag& bag,
+                                                     const UUID& userGuid, unsigned fieldMask = 0);
+  std::optional<platform::HTTPRequest> zeroKeywordRequest(const SBLZeroKeywordRequest& input,
+                                                          const SBLBag& bag, const UUID& userGuid,
+                                                          unsigned fieldMask = 0);
+  std::optional<platform::HTTPRequest> lookupRequest(const SBLLookupRequest& input, const SBLBag& bag,
+                                                     const UUID& userGuid);
+
+  platform::HTTPRequest moreResultsRequest(const SBLMoreResultsRequest& input, const SBLBag& bag,
+                                           const UUID& userGuid, unsigned fieldMask = 0);
+  platform::HTTPRequest cardRequest(const SBLCardRequest& input, const SBLBag& bag, const UUID& userGuid);
+
+  platform::HTTPRequest fileDownloadRequest(std::string_view url, std::string_view version,
+                                            bool includeLatLong);
+  /// `timeout` in seconds; `digest` identifies the body that the caller will add.
+  platform::HTTPRequest flusherUploadRequest(std::string_view url, double timeout, std::string_view digest);
+
+  /// A product token such as "Beacon/1" as a full user agent; "" for an empty token.
+  std::string createUserAgentString(std::string_view product) const;
+
+  /// The map session that searches and later map requests share.
+  std::optional<platform::MapsService::SessionEntity> getMapsUserSessionEntityAndReset(bool reset);
+
+ private:
+  using Builder = SableURLRequestBuilder;
+
+  /// What the locale's conventions make of numbers and dates. Working them out loads locale data,
+  /// so that waits for the first request that carries them.
+  struct LocaleConventions {
+    std::string localeCalendarIdentifier;
+    std::string localeMeasurementSystem;
+    std::string tempUnits;
+    std::string is24hDateFormat;
+  };
+
+  /// Everything a request says about the device; empty: not known.
+  struct Context {
+    std::string localeIdentifier;
+    std::string effectiveSystemLanguage;
+    std::string preferredLanguages;  ///< JSON array of up to three
+    std::optional<LocaleConventions> conventions;
+    std::string geoDeviceCountryCode;
+    std::string localTimeZoneName;
+    std::string geoLocationLatLng;  ///< "latitude,longitude"
+    std::string lookupGeoLocationLatLng;
+    std::string geoLocationSource;
+    std::string storeFrontIdentifier;
+    std::optional<std::string> subscriptionInfo;
+    std::optional<std::string> appWhitelistSignature;
+    bool isManagedAccount = false;
+    bool deviceRestricted = false;
+    std::vector<platform::URLQueryItem> debuggingQueryItems;
+  };
+
+  template <class Steps>
+  platform::HTTPRequest build(std::string_view url, Steps steps);
+  platform::HTTPRequest proxiedIfEnabled(platform::HTTPRequest request) const;
+
+  // Steps of a request, on the context queue; each adds one item or header as its name says.
+  void _addSecretKeyQueryItem(Builder& builder) const;
+  void _addLocaleQueryItem(Builder& builder) const;
+  void _addDiagnosticsAndUsageQueryItem(Builder& builder) const;
+  void _addKeyboardInputModeQueryItem(Builder& builder, const SBLRequest& input) const;
+  void _addTempUnitPreferenceQueryItem(Builder& builder);
+  void _addQueryLanguageQueryItem(Builder& builder, const SBLLookupRequest& input) const;
+  void _addLookupContextLanguageQueryItem(Builder& builder, const SBLLookupRequest& input) const;
+  void _addLookupHintDomainQueryItem(Builder& builder, const SBLLookupRequest& input) const;
+  void _addClientContextQueryItem(Builder& builder, const SBLLookupRequest& input) const;
+  void _addLookupSelectionType(Builder& builder, const SBLLookupRequest& input) const;
+  void _addManagedAccountQueryItem(Builder& builder) const;
+  void _addVersionQueryItem(Builder& builder, std::string_view version) const;
+  void _addCardQueryItem(Builder& builder) const;
+  void _addLocationQueryItem(Builder& builder) const;
+  void _addLocationSourceQueryItem(Builder& builder) const;
+  void _addAgentQueryItem(Builder& builder, std::string_view userAgent) const;
+  void _addStoreFrontQueryItem(Builder& builder) const;
+  void _addDeviceCountryCodeQueryItem(Builder& builder) const;
+  void _addTemperatureUnitsQueryItem(Builder& builder);
+  void _add24hDateFormatQueryItem(Builder& builder);
+  void _addTimeZoneQueryItem(Builder& builder) const;
+  void _addCalendarQueryItem(Builder& builder);
+  void _addEffectiveSystemLanguageQueryItem(Builder& builder) const;
+  void _addDebugQueryItems(Builder& builder) const;
+  void _addBrambleQueryItem(Builder& builder) const;
+
+  void _addHttpRequestUserGuid(Builder& builder, const UUID& userGuid) const;
+  void _addHttpRequestUserAgent(Builder& builder, std::string_view userAgent) const;
+  void _addHttpRequestUIScale(Builder& builder, double scale) const;
+  void _addHttpRequestPreferredLanguages(Builder& builder) const;
+  void _addHttpRequestMapsSessionId(Builder& builder);
+  void _addHttpMapsEnvironmentName(Builder& builder, const SBLBag& bag) const;
+  void _addHttpRequestSubscriptionInfo(Builder& builder) const;
+  void _addHttpAppWhitelistSignature(Builder& builder) const;
+  void _addHttpRequestTopTopics(Builder& builder, const SBLSearchRequest& input) const;
+  void _addHttpFuzzedLocation(Builder& builder) const;
+  void _addHttpIfNoneMatch(Builder& builder, std::string_view version) const;
+  void _addHttpGeoClientMetadata(Builder& builder) const;
+
+  std::string _languageForString(std::string_view text, const std::optional<std::string>& keyboard) const;
+
+  // The context half.
+  void observeContextChanges();
+  void _updateLocaleContexts(bool notifyBagRefreshRequired);
+  void _updateDeviceCountryCode(bool notifyBagRefreshRequired);
+  void _updateTimeZoneName();
+  void _updateDeviceRestrictions();
+  void _updateAccount();
+  void _setupDebuggingQueryItems();
+  void _notifyBagRefreshRequired();
+  void _didGetBag(const SBLBag& bag);
+  const LocaleConventions& conventions();
+
+  Assembly& assembly_;
+  const std::shared_ptr<platform::SerialQueue> contextAccessQueue_;
+  const std::string sabledUserAgent_;
+
+  Context context_;  ///< on contextAccessQueue_
+  std::vector<platform::NotificationCenter::Token> observations_;
+};
+
+}  // namespace sable

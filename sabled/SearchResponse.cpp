@@ -1,0 +1,78 @@
+#include "sabled/SearchResponse.h"
+
+#include <simdjson.h>
+
+#include "platform/Dictionary.h"
+
+namespace sable {
+namespace {
+
+using simdjson::dom::element;
+using simdjson::dom::element_type;
+using simdjson::dom::object;
+
+constexpr int kMaximumImageDepth = 64;
+
+std::optional<std::string> string(const object& parent, std::string_view key) {
+  std::string_view text;
+  if (parent[key].get(text) != simdjson::SUCCESS) return std::nullopt;
+  return std::string(text);
+}
+
+double number(const object& parent, std::string_view key) {
+  double value = 0;
+  return parent[key].get(value) == simdjson::SUCCESS ? value : 0;
+}
+
+void addImage(const element& description, std::vector<ImageDescription>& images) {
+  object members;
+  if (description.get(members) != simdjson::SUCCESS) return;
+  ImageDescription image{string(members, "url"), string(members, "id")};
+  if (image.url || image.id) images.push_back(std::move(image));
+}
+
+void collectImages(const element& value, int depth, std::vector<ImageDescription>& images) {
+  if (depth > kMaximumImageDepth) return;
+  if (value.type() == element_type::ARRAY) {
+    for (const element item : value.get_array()) collectImages(item, depth + 1, images);
+  } else if (value.type() == element_type::OBJECT) {
+    for (const auto [key, member] : value.get_object()) {
+      if (key == "image") {
+        addImage(member, images);
+      } else if (key == "images" && member.type() == element_type::ARRAY) {
+        for (const element item : member.get_array()) addImage(item, images);
+      } else {
+        collectImages(member, depth + 1, images);
+      }
+    }
+  }
+}
+
+SearchResponse::ResultSet readResultSet(const object& members) {
+  return {string(members, "query").value_or(""), number(members, "completion_score"),
+          number(members, "max_age"), string(members, "status").value_or("")};
+}
+
+}  // namespace
+
+Expected<SearchResponse> SearchResponse::parse(const std::string& text) {
+  simdjson::dom::parser parser;
+  element root;
+  auto failure = parser.allocate(std::max<std::size_t>(text.size(), 64), kMaximumJSONDepth);
+  if (failure == simdjson::SUCCESS) failure = parser.parse(text).get(root);
+  if (failure != simdjson::SUCCESS) {
+    return tl::unexpected(Error{std::string(kJSONErrorDomain), failure, simdjson::error_message(failure)});
+  }
+  SearchResponse response;
+  response.isObject = root.type() == element_type::OBJECT;
+  if (root.type() == element_type::ARRAY) {
+    for (const element item : root.get_array()) {
+      object members;
+      if (item.get(members) == simdjson::SUCCESS) response.resultSets.push_back(readResultSet(members));
+    }
+  }
+  collectImages(root, 0, response.images);
+  return response;
+}
+
+}  // namespace sable

@@ -1,0 +1,36 @@
+#pragma once
+
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/Data.h"
+#include "platform/Error.h"
+
+namespace sable {
+
+/// Where an image is: at a URL, or under an identifier of the bag, or both.
+struct ImageDescription {
+  std::optional<std::string> url;
+  std::optional<std::string> id;
+};
+
+/// What the daemon itself reads in an answer of the service. Clients get the raw bytes.
+struct SearchResponse {
+  struct ResultSet {
+    std::string query;  ///< the completed query
+    double completionScore = 0;
+    double maxAge = 0;  ///< seconds; 0: does not expire by time
+    std::string status;
+  };
+
+  bool isObject = false;
+  std::vector<ResultSet> resultSets;  ///< empty unless the answer is an array
+  /// Found under "image" and "images" at up to 64 levels.
+  std::vector<ImageDescription> images;
+
+  /// Reads RFC 8259 text nested at most kMaximumJSONDepth deep; the error's reason is the parser's.
+  static Expected<SearchResponse> parse(const std::string& text);
+};
+
+}  // namespace sable
