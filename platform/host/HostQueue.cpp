@@ -1,0 +1,117 @@
+#include "platform/host/HostQueue.h"
+
+#include <fmt/core.h>
+
+#include "platform/ProgrammingError.h"
+#include "platform/host/RunningQueue.h"
+
+namespace sable::platform::host {
+
+namespace {
+
+constexpr int kItemsInARow = 32;  // then other queues have a turn
+
+}  // namespace
+
+HostQueue::HostQueue(HostReactor& reactor, std::string label, QualityOfService quality)
+    : reactor_(reactor), label_(std::move(label)), quality_(quality) {}
+
+bool HostQueue::isCurrent() const {
+  return RunningQueue::onThisThread(this);
+}
+
+void HostQueue::async(Function<void()> work) {
+  Lock lock(mutex_);
+  items_.push_back({std::move(work), nullptr});
+  if (state_ == State::idle) schedule(lock);
+}
+
+Timer HostQueue::after(Duration delay, Function<void()> work) {
+  return reactor_.timers().add(delay, shared_from_this(), std::move(work));
+}
+
+bool HostQueue::tryRunInline(Function<void()>& work) {
+  Lock lock(mutex_);
+  if (state_ != State::idle) return false;
+  state_ = State::running;
+  lock.unlock();
+  {
+    const RunningQueue running(this);
+    work();
+    work = nullptr;
+  }
+  lock.lock();
+  release(lock);
+  return true;
+}
+
+void HostQueue::runSync(Function<void()> work) {
+  if (isCurrent()) programmingError(fmt::format("sync onto queue {} from its own work", label_));
+  Lock lock(mutex_);
+  const RunningQueue running(this);
+  if (state_ == State::running || !items_.empty()) {
+    Waiter waiter;
+    items_.push_back({nullptr, &waiter});
+    if (state_ == State::running) {
+      waiters_.push_back(&waiter);
+      lock.unlock();
+      const HostReactor::Blocking blocking(reactor_);
+      lock.lock();
+      waiter.handedOver.wait(lock, [&] { return waiter.hasQueue; });
+    }
+    state_ = State::running;
+    while (items_.front().waiter != &waiter) runFirst(lock);
+    items_.pop_front();
+  }
+  state_ = State::running;
+  lock.unlock();
+  work();
+  lock.lock();
+  release(lock);
+}
+
+void HostQueue::runFirst(Lock& lock) {
+  Function<void()> work = std::move(items_.front().work);
+  items_.pop_front();
+  lock.unlock();
+  work();
+  work = nullptr;
+  lock.lock();
+}
+
+void HostQueue::drain() {
+  Lock lock(mutex_);
+  drainPosted_ = false;
+  if (state_ != State::scheduled) return;  // a sync caller was faster
+  state_ = State::running;
+  {
+    const RunningQueue running(this);
+    for (int i = 0; i < kItemsInARow && !items_.empty() && items_.front().waiter == nullptr; ++i)
+      runFirst(lock);
+  }
+  release(lock);
+}
+
+void HostQueue::release(Lock& lock) {
+  if (items_.empty()) {
+    state_ = State::idle;
+  } else if (waiters_.empty()) {
+    schedule(lock);
+  } else {
+    // The first waiter runs what stands before it, so that it needs no pool thread. Told under the
+    // lock, for it may be gone right after.
+    waiters_.front()->hasQueue = true;
+    waiters_.front()->handedOver.notify_one();
+    waiters_.pop_front();
+  }
+}
+
+void HostQueue::schedule(Lock& lock) {
+  state_ = State::scheduled;
+  if (std::exchange(drainPosted_, true)) return;
+  auto self = shared_from_this();
+  lock.unlock();
+  reactor_.post(quality_, [self = std::move(self)] { self->drain(); });
+}
+
+}  // namespace sable::platform::host
