@@ -16,17 +16,21 @@ WallTime wallTimeFromSecondsSince1970(double seconds) {
   return WallTime(fromSeconds(seconds));
 }
 
+// Seconds and their fraction go separately: times of day have more nanoseconds than a double has
+// digits, and a date must survive the way there and back.
 double toSeconds(Duration duration) {
-  return std::chrono::duration<double>(duration).count();
+  const auto whole = std::chrono::floor<std::chrono::seconds>(duration);
+  return static_cast<double>(whole.count()) + static_cast<double>((duration - whole).count()) / 1e9;
 }
 
 Duration fromSeconds(double seconds) {
-  // The ends of the range stand for "forever", and what is no number lasts no time.
-  const double nanoseconds = std::nearbyint(seconds * 1e9);
-  if (std::isnan(nanoseconds)) return Duration::zero();
-  if (nanoseconds >= 0x1p63) return Duration::max();
-  if (nanoseconds <= -0x1p63) return Duration::min();
-  return Duration(static_cast<Duration::rep>(nanoseconds));
+  constexpr double kMost = 9.2e9;  // as far as nanoseconds in 64 bits reach; beyond is "for ever"
+  if (std::isnan(seconds)) return Duration::zero();
+  if (seconds > kMost) return Duration::max();
+  if (seconds < -kMost) return Duration::min();
+  const double whole = std::floor(seconds);
+  return std::chrono::seconds(static_cast<std::int64_t>(whole)) +
+         Duration(std::llround((seconds - whole) * 1e9));
 }
 
 Timer& Timer::operator=(Timer&& other) noexcept {

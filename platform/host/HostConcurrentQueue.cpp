@@ -74,9 +74,8 @@ void HostConcurrentQueue::admit(bool writes) {
 void HostConcurrentQueue::proceed(Lock& lock) {
   admitWaiters();
   if (!barrierIsNext() || std::exchange(drainPosted_, true)) return;
-  auto self = shared_from_this();
   lock.unlock();
-  reactor_.post(QualityOfService::standard, [self = std::move(self)] { self->drain(); });
+  reactor_.post(QualityOfService::standard, QueueTurn(shared_from_this()));
 }
 
 void HostConcurrentQueue::admitWaiters() {
@@ -113,6 +112,14 @@ void HostConcurrentQueue::drain() {
   drainPosted_ = false;
   if (barrierIsNext()) runNextBarrier(lock);
   proceed(lock);
+}
+
+void HostConcurrentQueue::discard() {
+  Lock lock(mutex_);
+  drainPosted_ = false;
+  if (!barrierIsNext()) return;
+  const auto dropped = std::exchange(items_, {});
+  lock.unlock();
 }
 
 }  // namespace sable::platform::host

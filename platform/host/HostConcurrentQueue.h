@@ -6,6 +6,7 @@
 #include <mutex>
 #include <string>
 
+#include "platform/QueueTurn.h"
 #include "platform/host/HostReactor.h"
 
 namespace sable::platform::host {
@@ -25,6 +26,7 @@ class HostConcurrentQueue final : public ConcurrentQueue,
   void runRead(Function<void()> read) override;
 
  private:
+  friend QueueTurn<HostConcurrentQueue>;
   struct Waiter {
     bool writes;
     bool admitted = false;
@@ -43,6 +45,7 @@ class HostConcurrentQueue final : public ConcurrentQueue,
   bool barrierIsNext() const;
   void runNextBarrier(Lock& lock);
   void drain();
+  void discard();
 
   HostReactor& reactor_;
   const std::string label_;

@@ -109,9 +109,17 @@ void HostQueue::release(Lock& lock) {
 void HostQueue::schedule(Lock& lock) {
   state_ = State::scheduled;
   if (std::exchange(drainPosted_, true)) return;
-  auto self = shared_from_this();
   lock.unlock();
-  reactor_.post(quality_, [self = std::move(self)] { self->drain(); });
+  reactor_.post(quality_, QueueTurn(shared_from_this()));
+}
+
+void HostQueue::discard() {
+  Lock lock(mutex_);
+  drainPosted_ = false;
+  if (state_ != State::scheduled) return;
+  state_ = State::idle;
+  const auto dropped = std::exchange(items_, {});
+  lock.unlock();
 }
 
 }  // namespace sable::platform::host

@@ -6,6 +6,7 @@
 #include <mutex>
 #include <string>
 
+#include "platform/QueueTurn.h"
 #include "platform/host/HostReactor.h"
 
 namespace sable::platform::host {
@@ -33,6 +34,7 @@ class HostQueue final : public SerialQueue, public std::enable_shared_from_this<
   void runSync(Function<void()> work) override;
 
  private:
+  friend QueueTurn<HostQueue>;
   enum class State { idle, scheduled, running };
   struct Waiter {
     std::condition_variable handedOver;
@@ -48,6 +50,7 @@ class HostQueue final : public SerialQueue, public std::enable_shared_from_this<
   void drain();
   void release(Lock& lock);
   void schedule(Lock& lock);
+  void discard();
 
   HostReactor& reactor_;
   const std::string label_;

@@ -207,7 +207,7 @@ void HostReactor::post(QualityOfService quality, Function<void()> work) {
   ++postedCount_;
   if (waitingThreads_ == 0) return;
   if (!onPoolThread() || postedCount_ > 1) return wakeOne(lock);
-  if (!std::exchange(backstopSet_, true)) timers_.wakeBy(deadlineAfter(kBackstop));
+  if (!std::exchange(backstopSet_, true)) timers_.wakeBy(monotonicNow() + kBackstop);
 }
 
 void HostReactor::wakeOne(std::unique_lock<std::mutex>& lock) {

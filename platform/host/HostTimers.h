@@ -1,22 +1,18 @@
 #pragma once
 
-#include <map>
 #include <memory>
 #include <mutex>
-#include <utility>
 
-#include "platform/Runtime.h"
+#include "platform/TimerSet.h"
 
 namespace sable::platform::host {
 
 /// The clock of timers: CLOCK_MONOTONIC.
 MonotonicTime monotonicNow();
-/// `delay` from now, at the end of time when that is past it.
-MonotonicTime deadlineAfter(Duration delay);
 
-/// Every pending timer of a runtime, behind one timer descriptor. The descriptor is set only when
-/// a deadline comes before the one it is set to; a cancelled timer costs no system call, at most
-/// one wake-up for nothing. Any thread.
+/// Every timer of a runtime, behind one timer descriptor. The descriptor is set only when a
+/// deadline comes before the one it is set to; a cancelled timer costs no system call, at most one
+/// wake-up for nothing. Any thread.
 class HostTimers {
  public:
   HostTimers();
@@ -24,7 +20,7 @@ class HostTimers {
   HostTimers(const HostTimers&) = delete;
   HostTimers& operator=(const HostTimers&) = delete;
 
-  /// Readable once for each setting that has come due.
+  /// Becomes readable each time something has come due.
   int descriptor() const { return descriptor_; }
 
   /// Appends `work` to `queue` after `delay`.
@@ -33,29 +29,17 @@ class HostTimers {
   /// Makes the descriptor readable at `time` at the latest.
   void wakeBy(MonotonicTime time);
 
-  /// Appends the work of every due timer to its queue, in order of deadline.
+  /// Appends the work of every due timer to its queue.
   void fire();
 
-  /// Drops every pending timer.
-  void clear();
+  /// Drops all timers.
+  void clear() { timers_.clear(); }
 
  private:
-  class Entry;
-  using Key = std::pair<MonotonicTime, std::uint64_t>;
-  struct Pending {
-    std::shared_ptr<Queue> queue;
-    std::shared_ptr<Entry> entry;
-  };
-
-  void remove(const Key& key);
-  void setDescriptor(MonotonicTime time);
-  std::map<Key, Pending> takeDue();
-
   const int descriptor_;
+  TimerSet timers_;
 
-  std::mutex mutex_;
-  std::map<Key, Pending> pending_;
-  std::uint64_t lastSequence_ = 0;
+  std::mutex mutex_;  // guards what follows
   MonotonicTime setFor_ = MonotonicTime::max();
   bool firing_ = false;
   bool fireAgain_ = false;
