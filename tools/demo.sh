@@ -29,11 +29,12 @@ sablectl() { "$bin/sablectl" "$@"; }
 
 export SABLED_RUNTIME_DIR=$world/run SABLED_CACHES_DIR=$world/caches SABLED_STATE_DIR=$world/state
 export SABLED_CONFIG_DIR=$world/config SABLED_PROFILE=$world/profile.toml
-mkdir -m 700 "$world"/{run,caches,state,config,service}
+mkdir -m 700 "$world"/{run,caches,state,config}
 
 start_service() {
   local line
-  exec {answers}< <(exec "$bin/sable-service" --data "$world/service" 2>"$world/service.log")
+  # The index takes some seconds to build, so it stays beside the programs for the next time.
+  exec {answers}< <(exec "$bin/sable-service" --data "$bin/../demo-index" 2>"$world/service.log")
   programs+=("$!")
   IFS= read -r -t 120 line <&"$answers" || die "sable-service did not say where it listens"
   [[ $line =~ http://[^[:space:]/]+ ]] || die "sable-service said: $line"
