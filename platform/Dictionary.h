@@ -21,8 +21,13 @@ inline constexpr std::string_view kJSONErrorDomain = "JSONErrorDomain";
 /// JSON is refused beyond this nesting (RFC 8259 section 9 leaves such limits to the reader).
 inline constexpr int kMaximumJSONDepth = 512;
 
+inline constexpr std::string_view kJSONErrorDomain = "JSONErrorDomain";
+enum class JSONErrorCode : std::int64_t { malformed = 1, tooLong = 2, tooDeep = 3 };
+
 /// Parses RFC 8259 text: UTF-8 only, at most `maximumBytes` long, nested at most
-/// kMaximumJSONDepth deep. The error's reason says what is wrong and at which byte.
+/// kMaximumJSONDepth deep. Of members with one name the last value counts. The error (of
+/// kJSONErrorDomain) says what is wrong and at which byte, counted from 0. Takes time linear in
+/// the length, whatever the text.
 Expected<Dictionary> parseJSON(std::string_view text, std::size_t maximumBytes);
 
 /// Compact UTF-8 JSON. Strings that are not UTF-8 have their bad bytes replaced by U+FFFD.

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstdint>
 #include <string>
 #include <string_view>
 
@@ -7,10 +8,33 @@
 
 namespace sable::platform {
 
+inline constexpr std::string_view kPropertyListErrorDomain = "PropertyListErrorDomain";
+enum class PropertyListErrorCode : std::int64_t { notEncodable = 1, malformed = 2, tooLarge = 3 };
+
+/// Property lists of more bytes are refused, and such as unfold to more than eight times as much
+/// (one string may stand in many places).
+inline constexpr std::size_t kMaximumPropertyListBytes = 8u << 20;
+
 /// Binary property lists ("bplist00"). JSON null has no counterpart there: such members are left
-/// out of objects and arrays. 64-bit integers, doubles, booleans, strings, arrays and objects make
-/// the round trip exactly; dates and data read as numbers (seconds since 1970) and base64 strings.
+/// out of objects and arrays, and null alone is not encodable. Integers from INT64_MIN to
+/// INT64_MAX, doubles, booleans, strings, arrays and objects make the round trip exactly; an
+/// integer above INT64_MAX is written as the nearest double. A string that holds a NUL or is not
+/// UTF-8 is not encodable, nor is nesting beyond kMaximumJSONDepth.
 Expected<std::string> encodePropertyList(const Dictionary& value);
+
+/// Reads any bytes safely. Dates read as numbers (seconds since 1970), data as base64 strings
+/// (RFC 4648 section 4), UIDs as integers; integers above INT64_MAX from other writers are exact.
+///
+///     offset        bytes  content
+///     0             8      "bplist00"
+///     8             ...    objects: marker byte (kind << 4 | size), then the payload
+///     table         n * o  offset of each object, big endian
+///     end - 32      6      unused, sort version
+///     end - 26      1      o, bytes per offset
+///     end - 25      1      r, bytes per object reference
+///     end - 24      8      n, number of objects
+///     end - 16      8      index of the root object
+///     end - 8       8      offset of the table
 Expected<Dictionary> decodePropertyList(std::string_view bytes);
 
 }  // namespace sable::platform

@@ -1,0 +1,39 @@
+#pragma once
+
+#include <filesystem>
+#include <functional>
+#include <optional>
+#include <string>
+
+namespace sable::platform::host {
+
+/// Looks an environment variable up; nullopt when it is not set, or empty.
+using Environment = std::function<std::optional<std::string>(const char* name)>;
+
+/// The variables of this process.
+std::optional<std::string> processEnvironment(const char* name);
+
+/// Where the daemon and its tools find their files. Paths are absolute; nothing is created here.
+struct Folders {
+  std::filesystem::path runtime;     ///< sockets (0700); gone after a reboot
+  std::filesystem::path userCaches;  ///< of all programs
+  std::filesystem::path caches;      ///< ours below it (0700)
+  std::filesystem::path state;       ///< what must survive (0700)
+  std::filesystem::path config;      ///< what the user writes
+
+  std::filesystem::path profileSettings;  ///< a file, as are all below
+  std::filesystem::path systemFacts;
+
+  std::filesystem::path socket() const { return runtime / "relay.sock"; }
+  std::filesystem::path userSettings() const { return config / "defaults.toml"; }
+  std::filesystem::path ownSettings() const { return state / "defaults.toml"; }
+  std::filesystem::path userFacts() const { return config / "facts.toml"; }
+  std::filesystem::path counters() const { return state / "counters.tally"; }
+
+  /// Each folder is the first that is set of: its own variable (SABLED_RUNTIME_DIR, SABLED_CACHES_DIR,
+  /// SABLED_STATE_DIR, SABLED_CONFIG_DIR; SABLED_PROFILE for the profile's file), the XDG variable
+  /// (where absolute: XDG Base Directory Specification), the usual place below the home folder.
+  static Folders fromEnvironment(const Environment& environment = processEnvironment);
+};
+
+}  // namespace sable::platform::host

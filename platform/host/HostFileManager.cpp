@@ -1,0 +1,121 @@
+#include "platform/host/HostFileManager.h"
+
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <cstdio>
+
+#include "platform/host/TrustedPath.h"
+
+namespace sable::platform::host {
+
+namespace {
+
+using Path = std::filesystem::path;
+
+tl::unexpected<Error> failed(int number, const Path& path) {
+  return tl::unexpected(posixError(number, path.native()));
+}
+
+/// 0, or an errno value.
+int lockExclusively(int file) {
+  while (flock(file, LOCK_EX) != 0) {
+    if (errno != EINTR) return errno;
+  }
+  return 0;
+}
+
+/// Opens the replacement file and waits for its lock. Who held the lock before may have renamed
+/// the file away: then it is no longer the one of this name, and the next one is tried.
+Expected<Descriptor> openReplacement(int folder, const std::string& name, const Path& path) {
+  for (;;) {
+    Descriptor file(openat(folder, name.c_str(), O_WRONLY | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC,
+                           S_IRUSR | S_IWUSR));
+    if (!file) return failed(errno, path);
+    if (const int number = lockExclusively(file.number()); number != 0) return failed(number, path);
+    struct stat opened {
+    }, named{};
+    if (fstat(file.number(), &opened) != 0) return failed(errno, path);
+    if (fstatat(folder, name.c_str(), &named, AT_SYMLINK_NOFOLLOW) != 0) {
+      if (errno == ENOENT) continue;
+      return failed(errno, path);
+    }
+    if (opened.st_ino != named.st_ino || opened.st_dev != named.st_dev) continue;
+    if (!S_ISREG(opened.st_mode) || opened.st_uid != geteuid() || opened.st_nlink != 1) {
+      return failed(EPERM, path);
+    }
+    if (fchmod(file.number(), S_IRUSR | S_IWUSR) != 0) return failed(errno, path);
+    return file;
+  }
+}
+
+/// 0, or an errno value.
+int writeWhole(int file, std::string_view bytes) {
+  if (ftruncate(file, 0) != 0) return errno;
+  while (!bytes.empty()) {
+    const ssize_t count = ::write(file, bytes.data(), bytes.size());
+    if (count < 0 && errno == EINTR) continue;
+    if (count < 0) return errno;
+    bytes.remove_prefix(static_cast<std::size_t>(count));
+  }
+  return fsync(file) == 0 ? 0 : errno;
+}
+
+int synchronizeFolder(int folder) {
+  const Descriptor readable(openat(folder, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  return readable && fsync(readable.number()) == 0 ? 0 : errno;
+}
+
+}  // namespace
+
+Expected<Path> HostFileManager::cachesDirectory() {
+  if (auto created = createDirectory(folders_.userCaches); !created) {
+    return tl::unexpected(std::move(created.error()));
+  }
+  return folders_.userCaches;
+}
+
+Expected<void> HostFileManager::createDirectory(const Path& path) {
+  if (auto folder = openTrustedFolder(path, MissingFolders::create); !folder) {
+    return tl::unexpected(std::move(folder.error()));
+  }
+  return {};
+}
+
+Expected<std::string> HostFileManager::read(const Path& path, std::size_t maximumBytes) {
+  const auto file = openTrustedFile(path, LastLink::refuse);
+  if (!file) return tl::unexpected(file.error());
+  return readWhole(*file, path, maximumBytes);
+}
+
+Expected<void> HostFileManager::writeAtomically(const Path& path, std::string_view bytes) {
+  const auto folder = openTrustedFolder(path.parent_path(), MissingFolders::fail);
+  if (!folder) return tl::unexpected(folder.error());
+  const std::string name = path.filename();
+  const std::string newName = "." + name + ".new";
+  const auto file = openReplacement(folder->number(), newName, path);
+  if (!file) return tl::unexpected(file.error());
+
+  int number = writeWhole(file->number(), bytes);
+  if (number == 0 && renameat(folder->number(), newName.c_str(), folder->number(), name.c_str()) != 0) {
+    number = errno;
+  }
+  if (number != 0) {
+    unlinkat(folder->number(), newName.c_str(), 0);
+    return failed(number, path);
+  }
+  if (number = synchronizeFolder(folder->number()); number != 0) return failed(number, path);
+  return {};
+}
+
+Expected<void> HostFileManager::remove(const Path& path) {
+  const auto folder = openTrustedFolder(path.parent_path(), MissingFolders::fail);
+  if (!folder) return tl::unexpected(folder.error());
+  const std::string name = path.filename();
+  if (unlinkat(folder->number(), name.c_str(), 0) != 0) return failed(errno, path);
+  return {};
+}
+
+}  // namespace sable::platform::host

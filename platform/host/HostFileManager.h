@@ -1,0 +1,25 @@
+#pragma once
+
+#include "platform/FileManager.h"
+#include "platform/host/Folders.h"
+
+namespace sable::platform::host {
+
+/// Files on disk, reached through TrustedPath. A replacement is written to ".NAME.new" beside its
+/// target, synchronised, renamed over it, and the folder synchronised. Writers of one target take
+/// turns by a lock on that file, also between processes; what a killed writer left is used again.
+class HostFileManager final : public FileManager {
+ public:
+  explicit HostFileManager(Folders folders) : folders_(std::move(folders)) {}
+
+  Expected<std::filesystem::path> cachesDirectory() override;
+  Expected<void> createDirectory(const std::filesystem::path& path) override;
+  Expected<std::string> read(const std::filesystem::path& path, std::size_t maximumBytes) override;
+  Expected<void> writeAtomically(const std::filesystem::path& path, std::string_view bytes) override;
+  Expected<void> remove(const std::filesystem::path& path) override;
+
+ private:
+  const Folders folders_;
+};
+
+}  // namespace sable::platform::host
