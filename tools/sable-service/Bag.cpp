@@ -1,0 +1,85 @@
+#include "Bag.h"
+
+#include <fmt/format.h>
+
+#include <array>
+#include <map>
+
+namespace service {
+
+namespace {
+
+constexpr std::array kSections = {"noun", "verb", "adjective", "adverb", "package"};
+
+Json builtIn(const std::string& base) {
+  Json bag = {
+      {"version", "1"},
+      {"enabled", true},
+      {"feedback_enabled", true},
+      {"search_url", base + "/search"},
+      {"warm_url", base + "/warm"},
+      {"feedback_url", base + "/feedback"},
+      {"crowdsourcing_url", base + "/crowdsourcing"},
+      {"minimum_query_length", 1},
+      {"request_timeout", 15},
+      {"search_render_timeout", 2},
+      {"send_geo_environment_header", true},
+      {"geo_location_sources", {"gps", "wifi", "cell"}},
+      {"bramble", {{"proxy", base}, {"enabled", false}}},
+      {"image_urls", Json::object()},
+      {"subscription_provider_domains", {"video.example"}},
+      {"subscription_provider_bundle_identifiers", {"com.example.video"}},
+      {"subscription_ttl", 86400},
+      {"download_resources_list", Json::array()},
+  };
+  for (const auto* section : kSections) {
+    bag["image_urls"][fmt::format("section.{}", section)] =
+        fmt::format("{}/images/section-{}.png", base, section);
+  }
+  return bag;
+}
+
+// Each names the parts of speech or the packages it gives hints for; the clients only hand them on.
+const std::map<std::string, std::string> kResources = {
+    {"lookup_hints_weekly", "noun\nverb\n"},
+    {"lookup_hints_monthly", "adjective\nadverb\n"},
+    {"installed_app_whitelist", "[\"org.debian.Example\",\"org.kestrel.Reader\"]\n"},
+};
+
+}  // namespace
+
+Bag::Bag(std::string base) : keys_(builtIn(base)), resources_(kResources) {
+  for (const auto& [identifier, content] : resources_) {
+    keys_["download_resources_list"].push_back(identifier);
+    keys_[identifier] = base + "/resources/" + identifier;
+  }
+}
+
+void Bag::merge(const Json& keys) {
+  const std::lock_guard lock(mutex_);
+  keys_.merge_patch(keys);
+}
+
+void Bag::setResource(const std::string& identifier, std::string content) {
+  const std::lock_guard lock(mutex_);
+  resources_[identifier] = std::move(content);
+}
+
+Answer Bag::answer(const Request& request, const std::optional<std::string>& version) {
+  Json keys;
+  {
+    const std::lock_guard lock(mutex_);
+    keys = keys_;
+  }
+  if (version) keys["version"] = *version;
+  return Answer::tagged(request, "application/json", toText(keys), "private, no-cache");
+}
+
+Answer Bag::resourceAnswer(const Request& request) {
+  const std::lock_guard lock(mutex_);
+  const auto found = resources_.find(request.path.substr(std::string_view("/resources/").size()));
+  if (found == resources_.end()) return Answer::error(404, "there is no such resource");
+  return Answer::tagged(request, "application/octet-stream", found->second, "private, no-cache");
+}
+
+}  // namespace service

@@ -1,0 +1,143 @@
+#include "Faults.h"
+
+#include <fmt/format.h>
+
+#include <algorithm>
+#include <array>
+#include <charconv>
+#include <limits>
+#include <regex>
+#include <string_view>
+
+namespace service {
+
+namespace {
+
+enum class Value { none, number, text };
+
+struct Kind {
+  std::string_view name;
+  Value value;
+  size_t least = 0;
+  size_t most = std::numeric_limits<size_t>::max();
+};
+
+constexpr size_t kHourInMilliseconds = 3'600'000;
+
+constexpr std::array kKinds = {
+    Kind{"latency", Value::number, 0, kHourInMilliseconds},
+    Kind{"status", Value::number, 200, 599},
+    Kind{"reset", Value::none},
+    Kind{"truncate", Value::number},
+    Kind{"slow", Value::number, 1},
+    Kind{"redirect", Value::text},
+    Kind{"body", Value::text},
+    Kind{"retry-after", Value::text},
+    Kind{"version", Value::text},
+};
+
+std::optional<size_t> number(std::string_view text) {
+  size_t value = 0;
+  const auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), value);
+  return error == std::errc() && end == text.data() + text.size() ? std::optional(value) : std::nullopt;
+}
+
+/// Why the value does not suit the kind.
+std::optional<std::string> objection(const Kind& kind, bool given, const std::string& value) {
+  if (kind.value == Value::none) {
+    return given ? std::optional(fmt::format("\"{}\" takes no value", kind.name)) : std::nullopt;
+  }
+  if (!given) return fmt::format("\"{}\" needs a value", kind.name);
+  if (value.find_first_of("\r\n") != value.npos) return "a value is one line";
+  if (kind.value == Value::text) return std::nullopt;
+  const auto parsed = number(value);
+  if (!parsed || *parsed < kind.least || *parsed > kind.most) {
+    return fmt::format("\"{}\" is no value for \"{}\"", value, kind.name);
+  }
+  return std::nullopt;
+}
+
+bool covers(const std::string& rule, const std::string& path) {
+  if (!path.starts_with(rule)) return false;
+  return path.size() == rule.size() || rule.ends_with('/') || path[rule.size()] == '/';
+}
+
+}  // namespace
+
+std::optional<std::string> Faults::add(const std::string& text) {
+  static const std::regex form("(/[^:]*):([a-z-]+)(=([^]*?))?(\\*([0-9]+))?(@([0-9]+))?");
+  std::smatch match;
+  if (!std::regex_match(text, match, form)) {
+    return fmt::format("fault \"{}\" is not PATH:KIND[=VALUE][*COUNT][@SKIP]", text);
+  }
+  const auto kind = std::ranges::find(kKinds, std::string_view(match[2].str()), &Kind::name);
+  if (kind == kKinds.end()) return fmt::format("fault \"{}\": there is no kind \"{}\"", text, match[2].str());
+  if (auto reason = objection(*kind, match[3].matched, match[4]))
+    return fmt::format("fault \"{}\": {}", text, *reason);
+  Rule rule{text, match[1], match[2], match[4], 0, std::nullopt};
+  if (match[5].matched) rule.count = number(match[6].str());
+  if (match[7].matched) rule.skip = number(match[8].str()).value_or(0);
+  const std::lock_guard lock(mutex_);
+  rules_.push_back(std::move(rule));
+  return std::nullopt;
+}
+
+void Faults::clear() {
+  const std::lock_guard lock(mutex_);
+  rules_.clear();
+}
+
+FaultPlan Faults::plan(const std::string& path) {
+  FaultPlan plan;
+  const std::lock_guard lock(mutex_);
+  for (auto& rule : rules_) {
+    if (!covers(rule.path, path)) continue;
+    if (rule.skip > 0) {
+      --rule.skip;
+      continue;
+    }
+    if (rule.count && (*rule.count)-- == 0) {
+      rule.count = 0;
+      continue;
+    }
+    note(rule, plan);
+  }
+  return plan;
+}
+
+void Faults::note(const Rule& rule, FaultPlan& plan) {
+  plan.rules.push_back(rule.text);
+  const size_t value = number(rule.value).value_or(0);
+  if (rule.kind == "latency")
+    plan.latency = std::chrono::milliseconds(value);
+  else if (rule.kind == "status")
+    plan.status = static_cast<int>(value);
+  else if (rule.kind == "truncate")
+    plan.truncateAfter = value;
+  else if (rule.kind == "slow")
+    plan.bytesPerSecond = value;
+  else if (rule.kind == "redirect")
+    plan.redirect = rule.value;
+  else if (rule.kind == "body")
+    plan.body = rule.value;
+  else if (rule.kind == "retry-after")
+    plan.retryAfter = rule.value;
+  else if (rule.kind == "version")
+    plan.bagVersion = rule.value;
+  else
+    plan.reset = true;
+}
+
+void FaultPlan::apply(Answer& answer) const {
+  if (refuses()) {
+    const int code = status.value_or(redirect ? 302 : 503);
+    Json record = std::move(answer.record);
+    answer = Answer::error(code, "a fault was asked for");
+    answer.record = std::move(record);
+  }
+  if (redirect) answer.headers.emplace_back("Location", *redirect);
+  if (retryAfter) answer.headers.emplace_back("Retry-After", *retryAfter);
+  if (body) answer.body = *body;
+}
+
+}  // namespace service
