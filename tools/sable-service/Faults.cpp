@@ -65,7 +65,7 @@ bool covers(const std::string& rule, const std::string& path) {
 }  // namespace
 
 std::optional<std::string> Faults::add(const std::string& text) {
-  static const std::regex form("(/[^:]*):([a-z-]+)(=([^]*?))?(\\*([0-9]+))?(@([0-9]+))?");
+  static const std::regex form("(/[^:]*):([a-z-]+)(=([^]*?))?(\\*([0-9]{1,9}))?(@([0-9]{1,9}))?");
   std::smatch match;
   if (!std::regex_match(text, match, form)) {
     return fmt::format("fault \"{}\" is not PATH:KIND[=VALUE][*COUNT][@SKIP]", text);
@@ -74,6 +74,8 @@ std::optional<std::string> Faults::add(const std::string& text) {
   if (kind == kKinds.end()) return fmt::format("fault \"{}\": there is no kind \"{}\"", text, match[2].str());
   if (auto reason = objection(*kind, match[3].matched, match[4]))
     return fmt::format("fault \"{}\": {}", text, *reason);
+  if (kind->name == "version" && !covers(match[1], "/bag"))
+    return fmt::format("fault \"{}\": only /bag has a version", text);
   Rule rule{text, match[1], match[2], match[4], 0, std::nullopt};
   if (match[5].matched) rule.count = number(match[6].str());
   if (match[7].matched) rule.skip = number(match[8].str()).value_or(0);

@@ -60,9 +60,10 @@ std::string expression(std::string_view column, const std::string& words) {
   return column.empty() ? terms : fmt::format("{{{}}} : ({})", column, terms);
 }
 
-bool isNamed(const Entry& entry, const std::string& name) {
-  const std::string names = ", " + lowercase(entry.names) + ", ";
-  return names.find(", " + name + ", ") != names.npos;
+/// The entry's own spelling of that name, "" when it has no such name.
+std::string spelling(const Entry& entry, const std::string& name) {
+  const auto at = (", " + lowercase(entry.names) + ", ").find(", " + name + ", ");
+  return at == std::string::npos ? "" : entry.names.substr(at, name.size());
 }
 
 constexpr const char* kColumns = "reference, section, title, names, text, detail, url, weight";
@@ -229,11 +230,14 @@ std::vector<Hit> Index::find(Corpus corpus, const std::string& words) const {
     statement.bind(0, match).bind(1, static_cast<int64_t>(kMostHits));
     while (statement.step()) {
       Entry found = readEntry(statement);
-      if (seen.insert(found.reference).second) hits.push_back({std::move(found), named});
+      if (!seen.insert(found.reference).second) continue;
+      const std::string exact = spelling(found, words);
+      if (!exact.empty()) found.title = exact;
+      hits.push_back({std::move(found), named, !exact.empty()});
     }
   };
   collect(inNames, true);
-  std::ranges::stable_partition(hits, [&](const Hit& hit) { return isNamed(hit.entry, words); });
+  std::ranges::stable_partition(hits, &Hit::exact);
   if (hits.size() < kMostHits) collect(inText, false);
   hits.resize(std::min(hits.size(), kMostHits));
   return hits;
@@ -241,7 +245,7 @@ std::vector<Hit> Index::find(Corpus corpus, const std::string& words) const {
 
 std::vector<Hit> Index::lookUp(const std::string& name) const {
   auto hits = find(Corpus::dictionary, name);
-  std::erase_if(hits, [&](const Hit& hit) { return !isNamed(hit.entry, name); });
+  std::erase_if(hits, [](const Hit& hit) { return !hit.exact; });
   return hits;
 }
 

@@ -26,10 +26,11 @@ struct Completion {
   double score = 0;
 };
 
-/// An entry found, with what makes it rank.
+/// An entry found, with what makes it rank. Where one of its names is the text looked for, that is its title.
 struct Hit {
   Entry entry;
   bool inNames = false;
+  bool exact = false;
 };
 
 /// The searchable data: an SQLite file with a full-text index, built once and read by any number of threads.

@@ -3,6 +3,7 @@
 #include <fmt/format.h>
 
 #include <algorithm>
+#include <array>
 #include <charconv>
 #include <cmath>
 
@@ -41,6 +42,24 @@ Json emptySet(const std::string& query) {
           {"max_age", kMaxAge},
           {"status", "OK"},
           {"results", Json::array()}};
+}
+
+/// The word itself, then what it may be a form of (WordNet's own endings, most likely first).
+std::vector<std::string> baseForms(const std::string& word) {
+  static constexpr std::array<std::pair<std::string_view, std::string_view>, 8> kEndings = {{{"ies", "y"},
+                                                                                             {"es", ""},
+                                                                                             {"s", ""},
+                                                                                             {"ed", "e"},
+                                                                                             {"ed", ""},
+                                                                                             {"ing", "e"},
+                                                                                             {"ing", ""},
+                                                                                             {"men", "man"}}};
+  std::vector<std::string> forms = {word};
+  for (const auto& [ending, base] : kEndings) {
+    if (word.ends_with(ending))
+      forms.push_back(word.substr(0, word.size() - ending.size()) + std::string(base));
+  }
+  return forms;
 }
 
 Json section(const std::string& type, const std::string& title, const std::string& text) {
@@ -84,7 +103,7 @@ Json Search::suggestions(Corpus corpus, const std::string& title) const {
   set["name"] = nameOf(corpus);
   set["title"] = title;
   for (auto& entry : index_.best(corpus, kPage))
-    set["results"].push_back(result(corpus, {std::move(entry), true}));
+    set["results"].push_back(result(corpus, {std::move(entry), true, true}));
   return set;
 }
 
@@ -132,7 +151,10 @@ std::string Search::moreUrl(Corpus corpus, const std::string& query, size_t offs
 Answer Search::lookUp(const Request& request) const {
   const std::string typed = request.item("q").value_or("");
   const std::string query = trimmed(normalised(typed));
-  auto hits = index_.lookUp(query);
+  std::vector<Hit> hits;
+  for (const auto& form : baseForms(query)) {
+    if (hits.empty()) hits = index_.lookUp(form);
+  }
   if (hits.empty()) {
     if (const auto completion = index_.complete(Corpus::dictionary, query)) {
       hits = index_.find(Corpus::dictionary, completion->text);

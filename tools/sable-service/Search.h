@@ -19,7 +19,8 @@ class Search {
   /// of q; with qtype=zkw suggestions for no text at all; where nothing is found one set with no results.
   /// With an item "ltype" the same as lookUp.
   Answer search(const Request& request) const;
-  /// {"query", "results": [...]}: the meanings of the word q, else what begins with it.
+  /// {"query", "results": [...]}: the meanings of the word q or of what it is a form of, else what begins
+  /// with it.
   Answer lookUp(const Request& request) const;
   /// GET /more?q=&set=&offset=: {"query", "set", "offset", "results", "more_results_url" where there is
   /// more}.

@@ -17,11 +17,6 @@ constexpr int kAcceptQueue = 1024;
 // Only announced, in the Keep-Alive header: connections end when they were idle that long.
 constexpr size_t kRequestsPerConnection = 1'000'000;
 
-// An upload is to be checked as it left the client, but the library decodes any body whose coding it knows,
-// and takes "deflate" for the zlib format at that. It looks the coding up in its own header list, so hide it
-// there.
-constexpr const char* kContentEncoding = "Content-Encoding";
-
 Pairs parseHeaders(std::string_view head) {
   Pairs headers;
   head.remove_prefix(std::min(head.size(), head.find("\r\n") + 2));
@@ -72,9 +67,12 @@ Server::Server(Handler handler) : handler_(std::move(handler)) {
   };
   Get(".*", answer);
   Post(".*", answer);
-  set_error_handler([](const httplib::Request&, httplib::Response& response) {
-    if (!response.body.empty() || response.content_length_ > 0) return;
-    response.set_content(Answer::error(response.status, "the request was refused").body, "application/json");
+  // Called for every status from 400 on; those the handler gave have its Date already. The others are the
+  // library's own, for requests it could not read to their end.
+  set_error_handler([this](const httplib::Request& request, httplib::Response& response) {
+    if (response.has_header("Date")) return;
+    Connection::current().closeAfterAnswer();
+    handle(request, response);
   });
 }
 
@@ -82,13 +80,17 @@ Server::~Server() {
   stop();
 }
 
+// An upload is to be checked as it left the client, but the library decodes any body whose coding it knows
+// (and takes "deflate" for the zlib format at that), and refuses forms of more than 8 KiB. It goes by its own
+// list of headers, so hide them there; the handler reads them from the connection.
 Server::HandlerResponse Server::prepare(httplib::Request& request, httplib::Response& response) {
   if (request.method != "GET" && request.method != "HEAD" && request.method != "POST") {
     if (hasBody(request)) Connection::current().closeAfterAnswer();
     handle(request, response);
     return HandlerResponse::Handled;
   }
-  request.headers.erase(kContentEncoding);
+  request.headers.erase("Content-Encoding");
+  request.headers.erase("Content-Type");
   // The library reads a POST without a length until the connection closes; RFC 9112 (6.3) says it has no
   // body.
   if (request.method == "POST" && !hasBody(request)) request.headers.emplace("Content-Length", "0");

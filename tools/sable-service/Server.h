@@ -19,7 +19,8 @@ class Connection;
 /// and no lost SYN.
 class Server : private httplib::Server {
  public:
-  /// Called on the connection's thread for every request that parses; what it returns is sent.
+  /// Called on the connection's thread for every request, to fill in the response. A request that was refused
+  /// as no proper HTTP, or too large, comes with that status set, and its connection is closed afterwards.
   using Handler = std::function<void(const Request&, httplib::Response&)>;
 
   explicit Server(Handler handler);

@@ -59,11 +59,14 @@ Service::Service(std::string base, const Index& index, Faults& faults, Recorder&
 
 void Service::handle(const Request& request, httplib::Response& response) {
   const double arrival = secondsNow();
+  const bool refused = response.status >= 400;
   // Control is how a test takes faults away again.
-  const FaultPlan plan = request.path == "/control" ? FaultPlan() : faults_.plan(request.path);
+  const FaultPlan plan = refused || request.path == "/control" ? FaultPlan() : faults_.plan(request.path);
   Answer answer;
   try {
-    answer = route(request, plan);
+    answer = refused ? Answer::error(response.status, "the request was refused") : route(request, plan);
+  } catch (const Json::exception& error) {
+    answer = Answer::error(400, error.what());
   } catch (const std::exception& error) {
     answer = Answer::error(500, error.what());
   }
@@ -107,9 +110,12 @@ Answer Service::control(const Request& request) {
   for (const auto& rule : rules) {
     if (auto reason = faults_.add(rule.get<std::string>())) return Answer::error(400, *reason);
   }
+  if (!order.value("bag", Json::object()).is_object())
+    return Answer::error(400, "the bag's keys are no JSON object");
   if (order.contains("bag")) bag_.merge(order["bag"]);
   if (order.contains("bag_version")) bag_.merge({{"version", order["bag_version"]}});
-  for (const auto& [identifier, content] : order.value("resource", Json::object()).items()) {
+  const Json resources = order.value("resource", Json::object());
+  for (const auto& [identifier, content] : resources.items()) {
     bag_.setResource(identifier, content.get<std::string>());
   }
   return Answer::json({{"status", "OK"}});

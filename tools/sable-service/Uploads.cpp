@@ -68,6 +68,20 @@ std::string base64(const std::string& bytes) {
   return text;
 }
 
+/// Discarded when it is no JSON or nested so deep that writing it down could exhaust the stack.
+Json parse(const std::string& text) {
+  constexpr int kDepthLimit = 512;
+  bool tooDeep = false;
+  Json document = Json::parse(
+      text,
+      [&](int depth, Json::parse_event_t, const Json&) {
+        tooDeep = tooDeep || depth > kDepthLimit;
+        return !tooDeep;
+      },
+      false);
+  return tooDeep ? Json(Json::value_t::discarded) : document;
+}
+
 Answer refuse(Answer answer, int status, const std::string& reason) {
   Json record = std::move(answer.record);
   answer = Answer::error(status, reason);
@@ -93,13 +107,14 @@ Answer Uploads::receive(const Request& request, bool accepted) {
   const auto claimed = request.header("X-Kestrel-Digest");
   const bool matches = claimed && (equalsIgnoringCase(*claimed, hex(digest)) || *claimed == base64(digest));
   answer.record["digest_ok"] = matches;
-  Json document = Json::parse(inflated.bytes, nullptr, false);
+  Json document = parse(inflated.bytes);
   const bool isJson = !document.is_discarded();
   if (isJson) answer.record["json"] = std::move(document);
   if (!claimed) return refuse(std::move(answer), 400, "X-Kestrel-Digest is missing");
   if (!matches)
     return refuse(std::move(answer), 400, "X-Kestrel-Digest is not the SHA-512 of the inflated body");
-  if (!isJson) return refuse(std::move(answer), 400, "the inflated body is no JSON document");
+  if (!isJson)
+    return refuse(std::move(answer), 400, "the inflated body is no JSON document of at most 512 levels");
 
   const std::lock_guard lock(mutex_);
   const std::pair key(request.path, digest);

@@ -14,7 +14,7 @@ namespace service {
 ///   MiB
 ///                                  inflated, with nothing behind its end; another coding is answered 415
 ///   X-Kestrel-Digest               the SHA-512 of the inflated bytes, in hex of either case or in base64
-///   the inflated bytes             one JSON document
+///   the inflated bytes             one JSON document of at most 512 levels
 ///
 /// Anything else is answered 400, with the reason in the body and the record. A digest that was accepted
 /// before on the same path is recognised as a repetition and answered 200 all the same.
