@@ -15,12 +15,10 @@ namespace sable {
 /// facts. Its definition is heavy: include <nlohmann/json.hpp> in sources only.
 using Dictionary = nlohmann::ordered_json;
 
-/// Errors of reading JSON; the reason says what is wrong, the code is the parser's.
-inline constexpr std::string_view kJSONErrorDomain = "JSONErrorDomain";
-
 /// JSON is refused beyond this nesting (RFC 8259 section 9 leaves such limits to the reader).
 inline constexpr int kMaximumJSONDepth = 512;
 
+/// Errors of reading JSON.
 inline constexpr std::string_view kJSONErrorDomain = "JSONErrorDomain";
 enum class JSONErrorCode : std::int64_t { malformed = 1, tooLong = 2, tooDeep = 3 };
 
@@ -32,9 +30,6 @@ Expected<Dictionary> parseJSON(std::string_view text, std::size_t maximumBytes);
 
 /// Compact UTF-8 JSON. Strings that are not UTF-8 have their bad bytes replaced by U+FFFD.
 std::string compactJSON(const Dictionary& value);
-
-/// Whether a value is a JSON object.
-bool isJSONObject(const Dictionary& value);
 
 // Typed members of an object: absent, or of another type, is nullopt. `object` may be any value.
 std::optional<std::string> stringMember(const Dictionary& object, std::string_view key);

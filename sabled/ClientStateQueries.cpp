@@ -298,7 +298,7 @@ void ClientState::forceFetch(const HTTPRequest& request) {
   if (header == nullptr || header->empty()) return;
   constexpr std::size_t kMaximumBytes = 64u << 10;
   const auto announcement = parseJSON(*header, kMaximumBytes);
-  if (!announcement || !isJSONObject(*announcement)) {
+  if (!announcement || !announcement->is_object()) {
     SableLogForCategory(SableLoggingCategorySearch)
         .error("Failed to deserialize X-Kestrel-ForceFetch header data into a dictionary: {}",
                announcement ? "(null)" : announcement.error().description());

@@ -106,7 +106,7 @@ const SBLNetworkRequestFactory::LocaleConventions& SBLNetworkRequestFactory::con
     made.localeCalendarIdentifier = locale.calendarIdentifier();
     made.localeMeasurementSystem = unitsName(locale.measurementSystem());
     made.tempUnits = locale.temperatureUnit().value_or("").substr(0, 1);
-    made.is24hDateFormat = locale.hourPattern().find("HH") == std::string::npos ? "" : "1";
+    made.is24hDateFormat = locale.hourPattern().find("HH") != std::string::npos;
   }
   return *context_.conventions;
 }

@@ -78,7 +78,7 @@ class SBLNetworkRequestFactory {
     std::string localeCalendarIdentifier;
     std::string localeMeasurementSystem;
     std::string tempUnits;
-    std::string is24hDateFormat;
+    bool is24hDateFormat = false;
   };
 
   /// Everything a request says about the device; empty: not known.

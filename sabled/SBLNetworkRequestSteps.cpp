@@ -136,7 +136,7 @@ void SBLNetworkRequestFactory::_addTemperatureUnitsQueryItem(Builder& builder) {
 
 void SBLNetworkRequestFactory::_add24hDateFormatQueryItem(Builder& builder) {
   contextAccessQueue_->assertIsCurrent();
-  addIfPresent(builder, "24h", conventions().is24hDateFormat);
+  if (conventions().is24hDateFormat) builder.defaultQueryItemWithName("24h", "1");
 }
 
 void SBLNetworkRequestFactory::_addTimeZoneQueryItem(Builder& builder) const {
