@@ -1,0 +1,189 @@
+#include <gtest/gtest.h>
+
+#include <algorithm>
+
+#include "tests/support/World.h"
+
+// What the service receives from the real daemon, item by item and header by header.
+namespace sable::test {
+namespace {
+
+using nlohmann::json;
+using Pairs = std::vector<std::pair<std::string, std::string>>;
+
+constexpr const char* kFacts = R"(
+product_type = "SableBook1,1"
+product_name = "Debian"
+build_version = "12.5"
+screen_scale = 2.0
+keyboard_input_mode = "en_GB@sw=QWERTY"
+locale = "en_GB"
+preferred_languages = ["en-GB", "de", "fr", "it"]
+system_language = "en-GB"
+time_zone = "Europe/London"
+country_code = "GB"
+storefront = "143444"
+managed_account = true
+geo_environment = "prod"
+geo_session_id = "session-1"
+geo_metadata = "meta-1"
+)";
+
+constexpr const char* kAgent = "Sabled/1.0 (SableBook1,1; Debian 12.5) sablectl/1.0";
+
+Pairs items(const json& request) {
+  return request["items"].get<Pairs>();
+}
+
+/// The headers that the daemon sets, sorted by name; the transport's own are left out.
+Pairs headers(const json& request) {
+  Pairs result;
+  for (const auto& [name, value] : request["headers"].get<Pairs>()) {
+    if (name == "User-Agent" || name == "If-None-Match" || name.starts_with("X-Kestrel-")) {
+      result.emplace_back(name, name == "X-Kestrel-UserGuid" ? "GUID" : value);
+    }
+  }
+  std::ranges::sort(result);
+  return result;
+}
+
+class Requests : public testing::Test {
+ protected:
+  Requests() : world_({.settings = "SBLUseBramble = false", .facts = kFacts}) {}
+
+  json only(std::string_view path, std::initializer_list<std::string> command) {
+    EXPECT_EQ(world_.sablectl(command).exitCode, 0);
+    return world_.requests(path, 1).at(0);
+  }
+
+  World world_;
+};
+
+const Pairs kSearchHeaders{{"User-Agent", kAgent},
+                           {"X-Kestrel-GeoEnvironment", "prod"},
+                           {"X-Kestrel-GeoMetadata", "meta-1"},
+                           {"X-Kestrel-GeoSession", "session-1"},
+                           {"X-Kestrel-Languages", R"(["en-GB","de","fr"])"},
+                           {"X-Kestrel-UI-Scale", "2.0"},
+                           {"X-Kestrel-UserGuid", "GUID"}};
+
+TEST_F(Requests, TheBagIsAskedForWithWhatItsUrlDependsOn) {
+  const json request = only("/bag", {"bag"});
+  EXPECT_EQ(
+      items(request),
+      (Pairs{{"bramble", "0"}, {"cc", "GB"}, {"esl", "en-GB"}, {"key", "tandem4371"}, {"locale", "en_GB"}}));
+  EXPECT_EQ(headers(request), (Pairs{{"User-Agent", "Sabled/1.0 (SableBook1,1; Debian 12.5) Sabled/1.0"},
+                                     {"X-Kestrel-Languages", R"(["en-GB","de","fr"])"}}));
+}
+
+TEST_F(Requests, ASearchCarriesTheWholeContext) {
+  const json request = only("/search", {"search", "weather; now", "--trigger", "8"});
+  EXPECT_EQ(items(request), (Pairs{{"24h", "1"},
+                                   {"calendar", "gregorian"},
+                                   {"card", "1"},
+                                   {"cc", "GB"},
+                                   {"esl", "en-GB"},
+                                   {"kb_ime", "en_GB@sw=QWERTY"},
+                                   {"key", "tandem4371"},
+                                   {"locale", "en_GB"},
+                                   {"mode", "managed"},
+                                   {"q", "weather; now"},
+                                   {"qtype", "suggested"},
+                                   {"storefront", "143444"},
+                                   {"temp", "C"},
+                                   {"time_zone", "Europe/London"},
+                                   {"units", "UK"}}));
+  EXPECT_NE(request["query"].get<std::string>().find("q=weather%3B%20now"), std::string::npos);
+  EXPECT_EQ(headers(request), kSearchHeaders);
+}
+
+TEST_F(Requests, ZeroKeywordIsASearchWithoutAQuery) {
+  const json request = only("/search", {"zkw"});
+  EXPECT_EQ(items(request), (Pairs{{"24h", "1"},
+                                   {"calendar", "gregorian"},
+                                   {"cc", "GB"},
+                                   {"esl", "en-GB"},
+                                   {"kb_ime", "en_GB@sw=QWERTY"},
+                                   {"key", "tandem4371"},
+                                   {"locale", "en_GB"},
+                                   {"mode", "managed"},
+                                   {"qtype", "zkw"},
+                                   {"storefront", "143444"},
+                                   {"temp", "C"},
+                                   {"time_zone", "Europe/London"},
+                                   {"units", "UK"}}));
+  EXPECT_EQ(headers(request), kSearchHeaders);
+}
+
+TEST_F(Requests, ALookupTellsWhereItComesFrom) {
+  const json request =
+      only("/search", {"lookup", "Schmetterling", "--context",
+                       "Der Schmetterling flog über die Wiese und den Garten hinweg", "--app",
+                       "org.example.Reader", "--domain", "nature", "--selection", "2"});
+  EXPECT_EQ(items(request), (Pairs{{"cc", "GB"},
+                                   {"context", "org.example.Reader"},
+                                   {"esl", "en-GB"},
+                                   {"kb_ime", "en_GB@sw=QWERTY"},
+                                   {"key", "tandem4371"},
+                                   {"lctxlang", "de"},
+                                   {"ldomain", "nature"},
+                                   {"locale", "en_GB"},
+                                   {"ltype", "hint"},
+                                   {"mode", "managed"},
+                                   {"q", "Schmetterling"},
+                                   {"qlang", "de"},
+                                   {"storefront", "143444"}}));
+  EXPECT_EQ(headers(request), (Pairs{{"User-Agent", kAgent},
+                                     {"X-Kestrel-GeoMetadata", "meta-1"},
+                                     {"X-Kestrel-GeoSession", "session-1"},
+                                     {"X-Kestrel-Languages", R"(["en-GB","de","fr"])"},
+                                     {"X-Kestrel-UI-Scale", "2.0"},
+                                     {"X-Kestrel-UserGuid", "GUID"}}));
+}
+
+TEST_F(Requests, MoreResultsAndCardsKeepTheItemsOfTheirUrl) {
+  const json more = only("/more", {"more", world_.serviceURL() + "/more?q=weather&offset=10&locale=de"});
+  EXPECT_EQ(items(more), (Pairs{{"esl", "en-GB"},
+                                {"key", "tandem4371"},
+                                {"locale", "de"},
+                                {"mode", "managed"},
+                                {"offset", "10"},
+                                {"q", "weather"},
+                                {"storefront", "143444"}}));
+  EXPECT_EQ(headers(more), (Pairs{{"User-Agent", kAgent},
+                                  {"X-Kestrel-Languages", R"(["en-GB","de","fr"])"},
+                                  {"X-Kestrel-UI-Scale", "2.0"},
+                                  {"X-Kestrel-UserGuid", "GUID"}}));
+
+  const json card = only("/card", {"card", world_.serviceURL() + "/card?id=1"});
+  EXPECT_EQ(items(card), (Pairs{{"cc", "GB"},
+                                {"esl", "en-GB"},
+                                {"id", "1"},
+                                {"key", "tandem4371"},
+                                {"locale", "en_GB"},
+                                {"storefront", "143444"}}));
+  EXPECT_EQ(headers(card), kSearchHeaders);
+}
+
+TEST_F(Requests, AClientsItemsReplaceTheQuery) {
+  const json forced = only("/search", {"search", "weather", "--item", "q=other", "--item", "extra=a+b c"});
+  const Pairs sent = items(forced);
+  EXPECT_TRUE(std::ranges::find(sent, std::pair<std::string, std::string>("q", "other")) != sent.end());
+  EXPECT_TRUE(std::ranges::find(sent, std::pair<std::string, std::string>("extra", "a+b c")) != sent.end());
+  EXPECT_NE(forced["query"].get<std::string>().find("extra=a%2Bb%20c"), std::string::npos);
+}
+
+TEST(DebugParameters, ReplaceWhatARequestWouldHaveSaid) {
+  World world({.settings = "SBLUseBramble = false\nSBLDebugParameters = \"key=abc&b&c=2=3&locale=xx\"",
+               .facts = kFacts});
+  EXPECT_EQ(world.sablectl({"card", world.serviceURL() + "/card?id=1"}).exitCode, 0);
+  EXPECT_EQ(items(world.requests("/card", 1)[0]), (Pairs{{"cc", "GB"},
+                                                         {"esl", "en-GB"},
+                                                         {"id", "1"},
+                                                         {"key", "abc"},
+                                                         {"locale", "xx"},
+                                                         {"storefront", "143444"}}));
+}
+
+}  // namespace
+}  // namespace sable::test
