@@ -224,8 +224,13 @@ TEST_P(AnyRuntime, BarriersRunAloneAndInOrder) {
 TEST_P(AnyRuntime, ReadersRunSideBySide) {
   const auto queue = runtime_->concurrentQueue("readers");
   const auto inside = runtime_->semaphore(0);
-  runtime_->globalQueue(QualityOfService::standard).async([&] { queue->sync([&] { inside->signal(); }); });
+  const auto outside = runtime_->semaphore(0);
+  runtime_->globalQueue(QualityOfService::standard).async([&, queue] {
+    queue->sync([&] { inside->signal(); });
+    outside->signal();
+  });
   queue->sync([&] { EXPECT_TRUE(inside->wait(soon())); });
+  EXPECT_TRUE(outside->wait(soon()));
 }
 
 TEST_P(AnyRuntime, UUIDsAreVersionFourAndDiffer) {
