@@ -76,7 +76,8 @@ class TOMLUserDefaults::Store : public std::enable_shared_from_this<Store> {
       if (found != own_.end() && same(found->second, value)) return;
       own_.insert_or_assign(std::string(key), std::move(value));
     }
-    if (!std::exchange(pending_, true)) {
+    pending_ = true;
+    if (!std::exchange(scheduled_, true)) {
       timer_ = queue_->after(kWriteDelay, [weak = weak_from_this()] {
         if (const auto store = weak.lock()) store->write();
       });
@@ -88,22 +89,29 @@ class TOMLUserDefaults::Store : public std::enable_shared_from_this<Store> {
     std::string text;
     {
       const std::unique_lock lock(mutex_);
-      if (!std::exchange(pending_, false)) return;
       timer_.cancel();
+      scheduled_ = false;
+      if (!std::exchange(pending_, false)) return;
       text = formatTOML(own_);
     }
     auto written = fileManager_.createDirectory(ownPath_.parent_path());
     if (written) written = fileManager_.writeAtomically(ownPath_, text);
-    if (!written && !failed_) {
-      platformLog().error("settings cannot be written: {}", written.error().description());
+    if (!written) {
+      if (!failed_) platformLog().error("settings cannot be written: {}", written.error().description());
+      const std::unique_lock lock(mutex_);
+      pending_ = true;  // for the next set() or synchronize()
     }
     failed_ = !written;
   }
 
  private:
   void reload() {
+    // Only here are the files replaced, one call at a time; readers do not wait for the disk.
+    TOMLFile profile = profile_, user = user_;
+    const bool changed = profile.reload() | user.reload();
     const std::unique_lock lock(mutex_);
-    const bool changed = profile_.reload() | user_.reload();
+    profile_ = std::move(profile);
+    user_ = std::move(user);
     if (changed) reported_.clear();
   }
 
@@ -134,7 +142,8 @@ class TOMLUserDefaults::Store : public std::enable_shared_from_this<Store> {
   TOMLFile profile_, user_;
   const std::filesystem::path ownPath_;
   TOMLContent own_, registered_;
-  bool pending_ = false;
+  bool pending_ = false;    ///< something is to be written
+  bool scheduled_ = false;  ///< and the timer will see to it
   Timer timer_;
 
   mutable std::mutex reporting_;

@@ -1,0 +1,149 @@
+#include "platform/host/HostFacts.h"
+
+#include <array>
+#include <nlohmann/json.hpp>
+
+#include "platform/AccountStore.h"
+#include "platform/CountryConfiguration.h"
+#include "platform/LocaleInfo.h"
+#include "platform/Log.h"
+#include "platform/ManagedConfiguration.h"
+#include "platform/host/ConfigurationSchema.h"
+#include "platform/host/LocaleNames.h"
+
+namespace sable::platform::host {
+
+namespace {
+
+using Answer = std::string (HostFacts::*)() const;
+
+/// A notification, and what makes up the answers it stands for: facts by key, and one that the
+/// host may answer.
+struct Subject {
+  std::string_view notification;
+  std::vector<std::string_view> keys;
+  Answer answer = nullptr;
+};
+
+const std::array<Subject, 5>& subjects() {
+  static const std::array<Subject, 5> all{
+      Subject{kCurrentLocaleDidChangeNotification,
+              {"calendar", "measurement_system", "temperature_unit", "preferred_languages", "system_language",
+               "hour_cycle_24"},
+              &HostFacts::localeIdentifier},
+      Subject{kSystemTimeZoneDidChangeNotification, {}, &HostFacts::timeZoneName},
+      Subject{kCountryCodeDidChangeNotification, {}, &HostFacts::countryCode},
+      Subject{
+          kEffectiveSettingsDidChangeNotification,
+          {"diagnostics_allowed", "bookstore_allowed", "media_store_allowed", "app_installation_allowed"}},
+      Subject{kAccountStoreDidChangeNotification,
+              {"managed_account", "music_subscription_status", "storefront"}},
+  };
+  return all;
+}
+
+}  // namespace
+
+void HostFacts::Layer::reload() {
+  if (!file.reload()) return;
+  TOMLContent good = file.content();
+  for (const auto& [name, value] : file.content()) {
+    const KnownKey* key = findKey(knownFacts(), name);
+    if (key == nullptr || hasType(value, key->type)) continue;
+    platformLog().error("{}:{}:{}: {} is not {}; its last good value stays", file.path().native(), value.line,
+                        value.column, name, typeName(key->type));
+    const auto before = facts.find(name);
+    if (before == facts.end()) {
+      good.erase(name);
+    } else {
+      good.insert_or_assign(name, before->second);
+    }
+  }
+  facts = std::move(good);
+}
+
+HostFacts::HostFacts(const Folders& folders, HostSources sources, Reactor& reactor,
+                     NotificationCenter& notificationCenter)
+    : sources_(std::move(sources)),
+      notificationCenter_(notificationCenter),
+      system_{TOMLFile(folders.systemFacts), {}},
+      user_{TOMLFile(folders.userFacts()), {}} {
+  reload();
+  watcher_ = std::make_unique<FileWatcher>(
+      reactor,
+      std::vector<std::filesystem::path>{folders.systemFacts, folders.userFacts(),
+                                         sources_.root / "etc/localtime", sources_.root / "etc/timezone"},
+      [this] { reload(); });
+}
+
+HostFacts::~HostFacts() = default;
+
+void HostFacts::reload() {
+  system_.reload();
+  user_.reload();
+  Dictionary merged = Dictionary::object();
+  for (const Layer* layer : {&system_, &user_}) {
+    for (const auto& [name, value] : layer->facts) merged[name] = *value.value;
+  }
+  {
+    const std::lock_guard lock(mutex_);
+    facts_ = std::make_shared<const Dictionary>(std::move(merged));
+  }
+  const auto before = std::exchange(answers_, answers());
+  for (std::size_t i = 0; i < before.size(); ++i) {
+    if (before[i] != answers_[i]) notificationCenter_.post({subjects()[i].notification, this, {}});
+  }
+}
+
+std::vector<std::string> HostFacts::answers() const {
+  const auto current = facts();
+  std::vector<std::string> all;
+  for (const Subject& subject : subjects()) {
+    Dictionary answer = Dictionary::array();
+    if (subject.answer != nullptr) answer.push_back((this->*subject.answer)());
+    for (const std::string_view key : subject.keys) {
+      const auto found = current->find(std::string(key));
+      answer.push_back(found == current->end() ? Dictionary() : *found);
+    }
+    all.push_back(compactJSON(answer));
+  }
+  return all;
+}
+
+std::shared_ptr<const Dictionary> HostFacts::facts() const {
+  const std::lock_guard lock(mutex_);
+  return facts_;
+}
+
+std::optional<std::string> HostFacts::string(std::string_view key) const {
+  return stringMember(*facts(), key);
+}
+std::optional<bool> HostFacts::boolean(std::string_view key) const {
+  return booleanMember(*facts(), key);
+}
+std::optional<std::int64_t> HostFacts::integer(std::string_view key) const {
+  return integerMember(*facts(), key);
+}
+std::optional<double> HostFacts::number(std::string_view key) const {
+  return numberMember(*facts(), key);
+}
+std::optional<std::vector<std::string>> HostFacts::strings(std::string_view key) const {
+  return stringsMember(*facts(), key);
+}
+
+std::string HostFacts::localeIdentifier() const {
+  if (auto fact = string("locale")) return *fact;
+  return localeIdentifierOfHost(sources_.environment);
+}
+
+std::string HostFacts::countryCode() const {
+  if (auto fact = string("country_code")) return *fact;
+  return regionOf(localeIdentifier());
+}
+
+std::string HostFacts::timeZoneName() const {
+  if (auto fact = string("time_zone")) return *fact;
+  return timeZoneOfHost(sources_.environment, sources_.root);
+}
+
+}  // namespace sable::platform::host
