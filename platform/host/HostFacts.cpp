@@ -68,17 +68,18 @@ HostFacts::HostFacts(const Folders& folders, HostSources sources, Reactor& react
       notificationCenter_(notificationCenter),
       system_{TOMLFile(folders.systemFacts), {}},
       user_{TOMLFile(folders.userFacts()), {}} {
-  reload();
   watcher_ = std::make_unique<FileWatcher>(
       reactor,
       std::vector<std::filesystem::path>{folders.systemFacts, folders.userFacts(),
                                          sources_.root / "etc/localtime", sources_.root / "etc/timezone"},
       [this] { reload(); });
+  reload();
 }
 
 HostFacts::~HostFacts() = default;
 
 void HostFacts::reload() {
+  const std::lock_guard turn(reloading_);
   system_.reload();
   user_.reload();
   Dictionary merged = Dictionary::object();

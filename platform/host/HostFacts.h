@@ -9,6 +9,7 @@
 
 #include "platform/NotificationCenter.h"
 #include "platform/host/FileWatcher.h"
+#include "platform/host/Folders.h"
 #include "platform/host/TOMLFile.h"
 
 namespace sable::platform::host {
@@ -57,11 +58,12 @@ class HostFacts {
   const HostSources sources_;
   NotificationCenter& notificationCenter_;
 
-  Layer system_, user_;  ///< touched by reload() only, which never runs twice at a time
+  std::mutex reloading_;
+  Layer system_, user_;
   std::vector<std::string> answers_;
 
   mutable std::mutex mutex_;
-  std::shared_ptr<const Dictionary> facts_;
+  std::shared_ptr<const Dictionary> facts_;  ///< null until the first reading is done
 
   std::unique_ptr<FileWatcher> watcher_;
 };

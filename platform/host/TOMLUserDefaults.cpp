@@ -36,12 +36,12 @@ class TOMLUserDefaults::Store : public std::enable_shared_from_this<Store> {
     own.reload();
     own_ = own.content();
     if (own.isDamaged()) keepDamaged();
-    reload();
   }
 
   void watch(Reactor& reactor) {
     watcher_ = std::make_unique<FileWatcher>(reactor, std::vector{profile_.path(), user_.path()},
                                              [this] { reload(); });
+    reload();
   }
 
   void registerDefaults(const Dictionary& object) {
@@ -106,7 +106,8 @@ class TOMLUserDefaults::Store : public std::enable_shared_from_this<Store> {
 
  private:
   void reload() {
-    // Only here are the files replaced, one call at a time; readers do not wait for the disk.
+    // The files are replaced only here, so that they can be read without making readers wait.
+    const std::lock_guard turn(reloading_);
     TOMLFile profile = profile_, user = user_;
     const bool changed = profile.reload() | user.reload();
     const std::unique_lock lock(mutex_);
@@ -137,6 +138,8 @@ class TOMLUserDefaults::Store : public std::enable_shared_from_this<Store> {
 
   FileManager& fileManager_;
   const std::shared_ptr<SerialQueue> queue_;
+
+  std::mutex reloading_;
 
   mutable std::shared_mutex mutex_;
   TOMLFile profile_, user_;

@@ -1,0 +1,34 @@
+#pragma once
+
+#include <mutex>
+#include <string>
+#include <utility>
+
+#include "platform/LocaleInfo.h"
+#include "platform/host/HostFacts.h"
+
+namespace sable::platform::host {
+
+/// Facts first, then the environment; what follows from the locale comes from ICU, whose data are
+/// loaded by the first question that needs them (calendar, measurement, temperature, hours).
+class HostLocaleInfo final : public LocaleInfo {
+ public:
+  explicit HostLocaleInfo(const HostFacts& facts) : facts_(facts) {}
+
+  std::string localeIdentifier() const override;
+  std::string calendarIdentifier() const override;
+  std::string measurementSystem() const override;
+  std::optional<std::string> temperatureUnit() const override;
+  std::vector<std::string> preferredLanguages() const override;
+  std::string systemLanguage() const override;
+  std::string hourPattern() const override;
+  std::string timeZoneName() const override;
+
+ private:
+  const HostFacts& facts_;
+
+  mutable std::mutex mutex_;
+  mutable std::pair<std::string, std::string> hourPattern_;  ///< of a locale; costs up to 8 ms to find out
+};
+
+}  // namespace sable::platform::host
