@@ -16,8 +16,8 @@ struct URLQueryItem {
   friend bool operator==(const URLQueryItem&, const URLQueryItem&) = default;
 };
 
-/// An absolute URL taken apart (RFC 3986), read and written by libcurl's URL interface; only the
-/// list of query items is ours.
+/// An absolute URL with a host, taken apart (RFC 3986) by libcurl's URL interface; only the list of
+/// query items is ours.
 class URL {
  public:
   /// Reads an absolute URL; nullopt when it is none.
