@@ -1,0 +1,214 @@
+#include "platform/host/CurlTransfer.h"
+
+#include <algorithm>
+#include <string_view>
+
+#include "platform/URL.h"
+#include "platform/host/CurlOutcome.h"
+
+namespace sable::platform::host {
+namespace {
+
+// RFC 9110 section 5.6.2.
+bool isToken(std::string_view text) {
+  static constexpr std::string_view kTokenCharacters =
+      "!#$%&'*+-.^_`|~0123456789abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ";
+  return !text.empty() && text.find_first_not_of(kTokenCharacters) == std::string_view::npos;
+}
+
+bool isBlank(std::string_view text) {
+  return text.find_first_not_of(" \t") == std::string_view::npos;
+}
+
+}  // namespace
+
+Error httpError(HTTPErrorCode code, std::string reason) {
+  return {std::string(kHTTPErrorDomain), static_cast<std::int64_t>(code), std::move(reason)};
+}
+
+std::optional<Error> CurlTransfer::invalidity(const HTTPRequest& request) {
+  using namespace std::string_view_literals;
+  const auto url = URL::parse(request.url);
+  if (!url) return httpError(HTTPErrorCode::badURL, "not an absolute URL");
+  const std::string scheme = url->scheme();
+  if (scheme != "http" && scheme != "https") {
+    return httpError(HTTPErrorCode::notAllowed, "scheme " + scheme + " is not http or https");
+  }
+  if (!isToken(request.method)) return httpError(HTTPErrorCode::other, "method is not a token");
+  for (const auto& [name, value] : request.headers.fields()) {
+    if (!isToken(name)) return httpError(HTTPErrorCode::other, "header name is not a token");
+    if (value.find_first_of("\r\n\0"sv) != std::string::npos) {
+      return httpError(HTTPErrorCode::other, "header " + name + " has a line break or NUL in its value");
+    }
+  }
+  return std::nullopt;
+}
+
+CurlTransfer::CurlTransfer(const Runtime& runtime, const HTTPSessionConfiguration& configuration,
+                           HTTPRequest request, std::string proxyURL)
+    : runtime_(runtime),
+      configuration_(configuration),
+      request_(std::move(request)),
+      proxyURL_(std::move(proxyURL)),
+      timeout_(fromSeconds(request_.timeout)) {}
+
+void CurlTransfer::prepare(CurlEasy easy) {
+  easy_ = std::move(easy);
+  startTime_ = runtime_.now();
+  noteProgress();
+  setTransport();
+  setRequest();
+  setHeaders();
+}
+
+void CurlTransfer::setTransport() {
+  CURL* easy = easy_.get();
+  curl_easy_setopt(easy, CURLOPT_PRIVATE, this);
+  curl_easy_setopt(easy, CURLOPT_ERRORBUFFER, errorText_);
+  curl_easy_setopt(easy, CURLOPT_NOSIGNAL, 1L);
+  curl_easy_setopt(easy, CURLOPT_PROTOCOLS_STR, "http,https");
+  curl_easy_setopt(easy, CURLOPT_REDIR_PROTOCOLS_STR, "http,https");
+  curl_easy_setopt(easy, CURLOPT_FOLLOWLOCATION, 1L);
+  curl_easy_setopt(easy, CURLOPT_MAXREDIRS, static_cast<long>(configuration_.maximumRedirects));
+  curl_easy_setopt(easy, CURLOPT_HTTP_VERSION, CURL_HTTP_VERSION_2TLS);
+  curl_easy_setopt(easy, CURLOPT_SSLVERSION, CURL_SSLVERSION_TLSv1_2);
+  curl_easy_setopt(easy, CURLOPT_SSL_SESSIONID_CACHE, configuration_.tlsSessionTickets ? 1L : 0L);
+  curl_easy_setopt(easy, CURLOPT_TCP_FASTOPEN, configuration_.tcpFastOpen ? 1L : 0L);
+  curl_easy_setopt(easy, CURLOPT_PIPEWAIT, configuration_.pipelining ? 1L : 0L);
+  const auto idle = std::chrono::ceil<std::chrono::seconds>(configuration_.idleConnectionTimeout);
+  curl_easy_setopt(easy, CURLOPT_MAXAGE_CONN, std::max(1L, static_cast<long>(idle.count())));
+  curl_easy_setopt(easy, CURLOPT_PROXY, proxyURL_.c_str());
+  curl_easy_setopt(easy, CURLOPT_SUPPRESS_CONNECT_HEADERS, 1L);
+  curl_easy_setopt(
+      easy, CURLOPT_PREREQFUNCTION, +[](void* self, char*, char*, int, int) {
+        static_cast<CurlTransfer*>(self)->noteProgress();
+        return CURL_PREREQFUNC_OK;
+      });
+  curl_easy_setopt(easy, CURLOPT_PREREQDATA, this);
+}
+
+void CurlTransfer::setRequest() {
+  CURL* easy = easy_.get();
+  curl_easy_setopt(easy, CURLOPT_URL, request_.url.c_str());
+  curl_easy_setopt(easy, CURLOPT_PATH_AS_IS, 1L);
+  curl_easy_setopt(easy, CURLOPT_ACCEPT_ENCODING, "");
+  const bool posts = request_.method == "POST";
+  if (request_.method == "HEAD") {
+    curl_easy_setopt(easy, CURLOPT_NOBODY, 1L);
+  } else if (posts || request_.body) {
+    curl_easy_setopt(easy, CURLOPT_POST, 1L);
+    curl_easy_setopt(easy, CURLOPT_POSTFIELDS, request_.body ? request_.body->data() : "");
+    curl_easy_setopt(easy, CURLOPT_POSTFIELDSIZE_LARGE,
+                     static_cast<curl_off_t>(request_.body ? request_.body->size() : 0));
+  }
+  if (!posts && request_.method != "HEAD" && (request_.body || request_.method != "GET")) {
+    curl_easy_setopt(easy, CURLOPT_CUSTOMREQUEST, request_.method.c_str());
+  }
+  curl_easy_setopt(
+      easy, CURLOPT_WRITEFUNCTION, +[](char* bytes, std::size_t, std::size_t count, void* self) {
+        return static_cast<CurlTransfer*>(self)->takeBody(bytes, count);
+      });
+  curl_easy_setopt(easy, CURLOPT_WRITEDATA, this);
+  curl_easy_setopt(
+      easy, CURLOPT_HEADERFUNCTION, +[](char* bytes, std::size_t, std::size_t count, void* self) {
+        return static_cast<CurlTransfer*>(self)->takeHeader({bytes, count});
+      });
+  curl_easy_setopt(easy, CURLOPT_HEADERDATA, this);
+  if (!request_.body) return;
+  curl_easy_setopt(easy, CURLOPT_NOPROGRESS, 0L);
+  curl_easy_setopt(
+      easy, CURLOPT_XFERINFOFUNCTION,
+      +[](void* context, curl_off_t, curl_off_t, curl_off_t, curl_off_t uploaded) {
+        auto* self = static_cast<CurlTransfer*>(context);
+        if (std::exchange(self->uploaded_, uploaded) != uploaded) self->noteProgress();
+        return 0;
+      });
+  curl_easy_setopt(easy, CURLOPT_XFERINFODATA, this);
+}
+
+void CurlTransfer::setHeaders() {
+  for (const auto& [name, value] : request_.headers.fields()) {
+    addHeaderLine(isBlank(value) ? name + ';' : name + ": " + value);
+  }
+  if (request_.body || request_.method == "POST") {
+    // A name without a value takes libcurl's own field out.
+    for (const char* unwanted : {"Expect", "Content-Type"}) {
+      if (request_.headers.find(unwanted) == nullptr) addHeaderLine(std::string(unwanted) + ':');
+    }
+  }
+  curl_easy_setopt(easy_.get(), CURLOPT_HTTPHEADER, headerLines_.get());
+}
+
+void CurlTransfer::addHeaderLine(const std::string& line) {
+  curl_slist* first = curl_slist_append(headerLines_.get(), line.c_str());
+  if (first == nullptr) return;
+  static_cast<void>(headerLines_.release());
+  headerLines_.reset(first);
+}
+
+std::size_t CurlTransfer::takeBody(const char* bytes, std::size_t count) {
+  noteProgress();
+  if (!bodyBegun_) {
+    bodyBegun_ = true;
+    curl_off_t announced = -1;
+    curl_easy_getinfo(easy_.get(), CURLINFO_CONTENT_LENGTH_DOWNLOAD_T, &announced);
+    const auto limit = static_cast<curl_off_t>(configuration_.maximumResponseBytes);
+    if (announced > 0) body_.reserve(static_cast<std::size_t>(std::min(announced, limit)));
+  }
+  const std::size_t room = configuration_.maximumResponseBytes - body_.size();
+  body_.append(bytes, std::min(count, room));
+  tooLarge_ = count > room;
+  return tooLarge_ ? 0 : count;
+}
+
+std::size_t CurlTransfer::takeHeader(std::string_view line) {
+  noteProgress();
+  if (line.starts_with("HTTP/")) {
+    // Interim responses (1xx) count with what follows them, or they could go on for ever.
+    if (!interim_) headerBytes_ = 0;
+    const auto status = line.substr(std::min(line.find(' '), line.size() - 1) + 1);
+    interim_ = status.starts_with('1');
+  }
+  headerBytes_ += line.size();
+  headersEnded_ = line == "\r\n" || line == "\n";
+  tooLarge_ = headerBytes_ > configuration_.maximumHeaderBytes;
+  return tooLarge_ ? 0 : line.size();
+}
+
+Error CurlTransfer::error(CURLcode code) const {
+  // libcurl takes a single header line of at most 100 KiB, and calls a longer one lack of memory.
+  const bool hugeLine = code == CURLE_OUT_OF_MEMORY && headerBytes_ > 0 && !headersEnded_;
+  if (tooLarge_ || hugeLine) {
+    return httpError(HTTPErrorCode::responseTooLarge, headersEnded_ ? "body is larger than the session allows"
+                                                                    : "headers are larger than the session allows");
+  }
+  if (code == CURLE_OK) return httpError(HTTPErrorCode::badResponse, "connection closed within the headers");
+  std::string reason = errorText_[0] != '\0' ? errorText_ : curl_easy_strerror(code);
+  const auto meaning = httpErrorCode(easy_.get(), code, reason, !proxyURL_.empty());
+  return httpError(meaning, std::move(reason));
+}
+
+HTTPResult CurlTransfer::arrived() {
+  HTTPResult result;
+  result.response = response(easy_.get());
+  if (bodyBegun_) result.data = makeData(std::move(body_));
+  result.timing = timing(easy_.get(), request_.body ? request_.body->size() : 0);
+  result.timing.start = startTime_;
+  result.timing.proxied = !proxyURL_.empty();
+  return result;
+}
+
+HTTPResult CurlTransfer::result(CURLcode code) {
+  if (code != CURLE_OK || !headersEnded_) return result(error(code));
+  HTTPResult result = arrived();
+  if (!result.data) result.data = makeData({});
+  return result;
+}
+
+HTTPResult CurlTransfer::result(Error error) {
+  HTTPResult result = arrived();
+  result.error = std::move(error);
+  return result;
+}
+
+}  // namespace sable::platform::host

@@ -1,0 +1,88 @@
+#pragma once
+
+#include <curl/curl.h>
+
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "platform/HTTPSession.h"
+
+namespace sable::platform::host {
+
+struct CurlEasyDeleter {
+  void operator()(CURL* easy) const { curl_easy_cleanup(easy); }
+};
+using CurlEasy = std::unique_ptr<CURL, CurlEasyDeleter>;
+
+/// One request on libcurl: sets up an easy handle, gathers what arrives within the session's limits
+/// and tells the outcome in our terms. Lives on the session's queue; stays where it is while libcurl
+/// works on it.
+class CurlTransfer {
+ public:
+  /// `proxyURL` empty: a direct connection. The environment's proxies are never asked.
+  CurlTransfer(const Runtime& runtime, const HTTPSessionConfiguration& configuration, HTTPRequest request,
+               std::string proxyURL);
+  CurlTransfer(const CurlTransfer&) = delete;
+  CurlTransfer& operator=(const CurlTransfer&) = delete;
+
+  /// What is wrong with the request itself, before anything is sent.
+  static std::optional<Error> invalidity(const HTTPRequest& request);
+
+  /// Sets all options of `easy`, which may have served others, and keeps it until release().
+  void prepare(CurlEasy easy);
+  CURL* easy() const { return easy_.get(); }
+  CurlEasy release() { return std::move(easy_); }
+
+  const HTTPRequest& request() const { return request_; }
+
+  /// When the transfer has made no progress for too long; moves with every byte.
+  MonotonicTime deadline() const { return lastProgress_ + timeout_; }
+
+  /// What has come of it; `code` is libcurl's verdict. Takes the body along.
+  HTTPResult result(CURLcode code);
+  /// The same for an end that libcurl did not decide.
+  HTTPResult result(Error error);
+
+  WallTime startTime() const { return startTime_; }
+
+ private:
+  struct ListDeleter {
+    void operator()(curl_slist* list) const { curl_slist_free_all(list); }
+  };
+
+  void setTransport();
+  void setRequest();
+  void setHeaders();
+  void addHeaderLine(const std::string& line);
+  void noteProgress() { lastProgress_ = runtime_.ticks(); }
+  Error error(CURLcode code) const;
+  HTTPResult arrived();
+
+  std::size_t takeBody(const char* bytes, std::size_t count);
+  std::size_t takeHeader(std::string_view line);
+
+  const Runtime& runtime_;
+  const HTTPSessionConfiguration& configuration_;
+  const HTTPRequest request_;
+  const std::string proxyURL_;
+  const Duration timeout_;
+
+  CurlEasy easy_;
+  std::unique_ptr<curl_slist, ListDeleter> headerLines_;
+  WallTime startTime_{};
+  MonotonicTime lastProgress_{};
+  curl_off_t uploaded_ = 0;
+  std::string body_;
+  bool bodyBegun_ = false;
+  bool tooLarge_ = false;
+  std::size_t headerBytes_ = 0;  // of the current header section and the interim ones before it
+  bool interim_ = false;
+  bool headersEnded_ = false;
+  char errorText_[CURL_ERROR_SIZE] = "";
+};
+
+/// The error of HTTPErrorDomain.
+Error httpError(HTTPErrorCode code, std::string reason);
+
+}  // namespace sable::platform::host
