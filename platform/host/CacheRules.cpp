@@ -16,6 +16,14 @@ using std::chrono::seconds;
 // Ages beyond this mean "for ever" (section 1.2.2).
 constexpr std::int64_t kMaximumDeltaSeconds = 2147483648;
 
+constexpr std::array<std::string_view, 6> kConditions{"If-None-Match",       "If-Modified-Since", "If-Match",
+                                                      "If-Unmodified-Since", "If-Range",          "Range"};
+
+// Fields of a 304 that describe that message, not the stored one.
+constexpr std::array<std::string_view, 10> kOfTheMessage{
+    "Content-Length", "Content-Encoding", "Content-Range",    "Content-Type", "Transfer-Encoding",
+    "Connection",     "Keep-Alive",       "Proxy-Connection", "Trailer",      "Upgrade"};
+
 bool sameName(std::string_view a, std::string_view b) {
   return a.size() == b.size() && strncasecmp(a.data(), b.data(), a.size()) == 0;
 }
@@ -84,7 +92,8 @@ Directives directives(const HTTPHeaders& headers) {
     };
     if (sameName(name, "no-store")) result.noStore = true;
     if (sameName(name, "no-cache")) result.noCache = true;
-    if (sameName(name, "max-age")) result.maximumAge = std::min(result.maximumAge.value_or(number()), number());
+    if (sameName(name, "max-age"))
+      result.maximumAge = std::min(result.maximumAge.value_or(number()), number());
     if (sameName(name, "min-fresh")) result.minimumFreshness = number();
   });
   if (control.empty() && sameName(combined(headers, "Pragma"), "no-cache")) result.noCache = true;
@@ -119,16 +128,13 @@ bool variesByEverything(const HTTPHeaders& headers) {
 }
 
 bool matches(const HTTPHeaders& varied, const HTTPHeaders& request) {
-  return std::all_of(varied.fields().begin(), varied.fields().end(), [&](const auto& field) {
-    return combined(request, field.first) == field.second;
-  });
+  return std::all_of(varied.fields().begin(), varied.fields().end(),
+                     [&](const auto& field) { return combined(request, field.first) == field.second; });
 }
 
 }  // namespace
 
 bool isCacheable(const HTTPRequest& request) {
-  static constexpr std::array<std::string_view, 6> kConditions{
-      "If-None-Match", "If-Modified-Since", "If-Match", "If-Unmodified-Since", "If-Range", "Range"};
   const auto& fields = request.headers.fields();
   return request.method == "GET" && !request.body &&
          std::none_of(fields.begin(), fields.end(),
@@ -178,14 +184,12 @@ HTTPHeaders variedFields(const HTTPHeaders& request, const HTTPHeaders& response
 
 void addConditions(const StoredResponse& stored, HTTPHeaders& request) {
   if (const auto* tag = stored.headers.find("ETag")) request.set("If-None-Match", *tag);
-  if (const auto* modified = stored.headers.find("Last-Modified")) request.set("If-Modified-Since", *modified);
+  if (const auto* modified = stored.headers.find("Last-Modified"))
+    request.set("If-Modified-Since", *modified);
 }
 
 StoredResponse validated(const StoredResponse& stored, const HTTPHeaders& notModified, WallTime requestTime,
                          WallTime responseTime) {
-  static constexpr std::array<std::string_view, 10> kOfTheMessage{
-      "Content-Length", "Content-Encoding",  "Content-Range",      "Content-Type", "Transfer-Encoding",
-      "Connection",     "Keep-Alive", "Proxy-Connection", "Trailer", "Upgrade"};
   StoredResponse result = stored;
   result.requestTime = requestTime;
   result.responseTime = responseTime;

@@ -9,6 +9,10 @@
 namespace sable::platform::host {
 namespace {
 
+constexpr const char* kHeadersTooLarge = "headers are larger than the session allows";
+
+constexpr double kLongestTimeout = 7 * 86400;
+
 // RFC 9110 section 5.6.2.
 bool isToken(std::string_view text) {
   static constexpr std::string_view kTokenCharacters =
@@ -45,12 +49,13 @@ std::optional<Error> CurlTransfer::invalidity(const HTTPRequest& request) {
 }
 
 CurlTransfer::CurlTransfer(const Runtime& runtime, const HTTPSessionConfiguration& configuration,
-                           HTTPRequest request, std::string proxyURL)
+                           const HTTPRequest& request, HTTPHeaders conditions, std::string proxyURL)
     : runtime_(runtime),
       configuration_(configuration),
-      request_(std::move(request)),
+      request_(request),
+      conditions_(std::move(conditions)),
       proxyURL_(std::move(proxyURL)),
-      timeout_(fromSeconds(request_.timeout)) {}
+      timeout_(fromSeconds(std::clamp(request_.timeout, 0.001, kLongestTimeout))) {}
 
 void CurlTransfer::prepare(CurlEasy easy) {
   easy_ = std::move(easy);
@@ -63,9 +68,9 @@ void CurlTransfer::prepare(CurlEasy easy) {
 
 void CurlTransfer::setTransport() {
   CURL* easy = easy_.get();
-  curl_easy_setopt(easy, CURLOPT_PRIVATE, this);
   curl_easy_setopt(easy, CURLOPT_ERRORBUFFER, errorText_);
   curl_easy_setopt(easy, CURLOPT_NOSIGNAL, 1L);
+  curl_easy_setopt(easy, CURLOPT_QUICK_EXIT, 1L);  // cancelling does not wait for a name lookup
   curl_easy_setopt(easy, CURLOPT_PROTOCOLS_STR, "http,https");
   curl_easy_setopt(easy, CURLOPT_REDIR_PROTOCOLS_STR, "http,https");
   curl_easy_setopt(easy, CURLOPT_FOLLOWLOCATION, 1L);
@@ -118,7 +123,7 @@ void CurlTransfer::setRequest() {
   curl_easy_setopt(easy, CURLOPT_NOPROGRESS, 0L);
   curl_easy_setopt(
       easy, CURLOPT_XFERINFOFUNCTION,
-      +[](void* context, curl_off_t, curl_off_t, curl_off_t, curl_off_t uploaded) {
+      +[](void* context, curl_off_t, curl_off_t, curl_off_t, curl_off_t uploaded) -> int {
         auto* self = static_cast<CurlTransfer*>(context);
         if (std::exchange(self->uploaded_, uploaded) != uploaded) self->noteProgress();
         return 0;
@@ -127,9 +132,8 @@ void CurlTransfer::setRequest() {
 }
 
 void CurlTransfer::setHeaders() {
-  for (const auto& [name, value] : request_.headers.fields()) {
-    addHeaderLine(isBlank(value) ? name + ';' : name + ": " + value);
-  }
+  addHeaders(request_.headers);
+  addHeaders(conditions_);
   if (request_.body || request_.method == "POST") {
     // A name without a value takes libcurl's own field out.
     for (const char* unwanted : {"Expect", "Content-Type"}) {
@@ -137,6 +141,12 @@ void CurlTransfer::setHeaders() {
     }
   }
   curl_easy_setopt(easy_.get(), CURLOPT_HTTPHEADER, headerLines_.get());
+}
+
+void CurlTransfer::addHeaders(const HTTPHeaders& headers) {
+  for (const auto& [name, value] : headers.fields()) {
+    addHeaderLine(isBlank(value) ? name + ';' : name + ": " + value);
+  }
 }
 
 void CurlTransfer::addHeaderLine(const std::string& line) {
@@ -157,30 +167,32 @@ std::size_t CurlTransfer::takeBody(const char* bytes, std::size_t count) {
   }
   const std::size_t room = configuration_.maximumResponseBytes - body_.size();
   body_.append(bytes, std::min(count, room));
-  tooLarge_ = count > room;
-  return tooLarge_ ? 0 : count;
+  if (count <= room) return count;
+  refusal_ = "body is larger than the session allows";
+  return 0;
 }
 
 std::size_t CurlTransfer::takeHeader(std::string_view line) {
   noteProgress();
   if (line.starts_with("HTTP/")) {
     // Interim responses (1xx) count with what follows them, or they could go on for ever.
+    headersEnded_ = false;
     if (!interim_) headerBytes_ = 0;
     const auto status = line.substr(std::min(line.find(' '), line.size() - 1) + 1);
     interim_ = status.starts_with('1');
   }
   headerBytes_ += line.size();
-  headersEnded_ = line == "\r\n" || line == "\n";
-  tooLarge_ = headerBytes_ > configuration_.maximumHeaderBytes;
-  return tooLarge_ ? 0 : line.size();
+  if (line == "\r\n" || line == "\n") headersEnded_ = true;
+  if (headerBytes_ <= configuration_.maximumHeaderBytes) return line.size();
+  refusal_ = kHeadersTooLarge;
+  return 0;
 }
 
 Error CurlTransfer::error(CURLcode code) const {
   // libcurl takes a single header line of at most 100 KiB, and calls a longer one lack of memory.
   const bool hugeLine = code == CURLE_OUT_OF_MEMORY && headerBytes_ > 0 && !headersEnded_;
-  if (tooLarge_ || hugeLine) {
-    return httpError(HTTPErrorCode::responseTooLarge, headersEnded_ ? "body is larger than the session allows"
-                                                                    : "headers are larger than the session allows");
+  if (refusal_ != nullptr || hugeLine) {
+    return httpError(HTTPErrorCode::responseTooLarge, hugeLine ? kHeadersTooLarge : refusal_);
   }
   if (code == CURLE_OK) return httpError(HTTPErrorCode::badResponse, "connection closed within the headers");
   std::string reason = errorText_[0] != '\0' ? errorText_ : curl_easy_strerror(code);

@@ -20,9 +20,10 @@ using CurlEasy = std::unique_ptr<CURL, CurlEasyDeleter>;
 /// works on it.
 class CurlTransfer {
  public:
-  /// `proxyURL` empty: a direct connection. The environment's proxies are never asked.
-  CurlTransfer(const Runtime& runtime, const HTTPSessionConfiguration& configuration, HTTPRequest request,
-               std::string proxyURL);
+  /// `request` outlives the transfer; `conditions` are sent with its headers. `proxyURL` empty: a
+  /// direct connection, for the environment's proxies are never asked.
+  CurlTransfer(const Runtime& runtime, const HTTPSessionConfiguration& configuration,
+               const HTTPRequest& request, HTTPHeaders conditions, std::string proxyURL);
   CurlTransfer(const CurlTransfer&) = delete;
   CurlTransfer& operator=(const CurlTransfer&) = delete;
 
@@ -33,8 +34,6 @@ class CurlTransfer {
   void prepare(CurlEasy easy);
   CURL* easy() const { return easy_.get(); }
   CurlEasy release() { return std::move(easy_); }
-
-  const HTTPRequest& request() const { return request_; }
 
   /// When the transfer has made no progress for too long; moves with every byte.
   MonotonicTime deadline() const { return lastProgress_ + timeout_; }
@@ -54,6 +53,7 @@ class CurlTransfer {
   void setTransport();
   void setRequest();
   void setHeaders();
+  void addHeaders(const HTTPHeaders& headers);
   void addHeaderLine(const std::string& line);
   void noteProgress() { lastProgress_ = runtime_.ticks(); }
   Error error(CURLcode code) const;
@@ -64,7 +64,8 @@ class CurlTransfer {
 
   const Runtime& runtime_;
   const HTTPSessionConfiguration& configuration_;
-  const HTTPRequest request_;
+  const HTTPRequest& request_;
+  const HTTPHeaders conditions_;
   const std::string proxyURL_;
   const Duration timeout_;
 
@@ -75,10 +76,10 @@ class CurlTransfer {
   curl_off_t uploaded_ = 0;
   std::string body_;
   bool bodyBegun_ = false;
-  bool tooLarge_ = false;
   std::size_t headerBytes_ = 0;  // of the current header section and the interim ones before it
   bool interim_ = false;
   bool headersEnded_ = false;
+  const char* refusal_ = nullptr;  // why we stopped it ourselves
   char errorText_[CURL_ERROR_SIZE] = "";
 };
 
