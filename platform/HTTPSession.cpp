@@ -2,6 +2,8 @@
 
 #include <algorithm>
 
+#include "platform/URL.h"
+
 namespace sable::platform {
 namespace {
 
@@ -16,6 +18,13 @@ bool sameName(std::string_view a, std::string_view b) {
 
 auto isNamed(std::string_view name) {
   return [name](const auto& field) { return sameName(field.first, name); };
+}
+
+// RFC 9110 section 5.6.2.
+bool isToken(std::string_view text) {
+  static constexpr std::string_view kTokenCharacters =
+      "!#$%&'*+-.^_`|~0123456789abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ";
+  return !text.empty() && text.find_first_not_of(kTokenCharacters) == std::string_view::npos;
 }
 
 }  // namespace
@@ -34,6 +43,28 @@ void HTTPHeaders::set(std::string_view name, std::string value) {
 
 void HTTPHeaders::remove(std::string_view name) {
   std::erase_if(fields_, isNamed(name));
+}
+
+Error httpError(HTTPErrorCode code, std::string reason) {
+  return {std::string(kHTTPErrorDomain), static_cast<std::int64_t>(code), std::move(reason)};
+}
+
+std::optional<Error> invalidity(const HTTPRequest& request) {
+  using namespace std::string_view_literals;
+  const auto url = URL::parse(request.url);
+  if (!url) return httpError(HTTPErrorCode::badURL, "not an absolute URL");
+  const std::string scheme = url->scheme();
+  if (scheme != "http" && scheme != "https") {
+    return httpError(HTTPErrorCode::notAllowed, "scheme " + scheme + " is not http or https");
+  }
+  if (!isToken(request.method)) return httpError(HTTPErrorCode::other, "method is not a token");
+  for (const auto& [name, value] : request.headers.fields()) {
+    if (!isToken(name)) return httpError(HTTPErrorCode::other, "header name is not a token");
+    if (value.find_first_of("\r\n\0"sv) != std::string::npos) {
+      return httpError(HTTPErrorCode::other, "header " + name + " has a line break or NUL in its value");
+    }
+  }
+  return std::nullopt;
 }
 
 }  // namespace sable::platform

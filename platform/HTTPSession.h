@@ -91,6 +91,13 @@ enum class HTTPErrorCode : std::int64_t {
   other = 13,
 };
 
+/// An error of kHTTPErrorDomain.
+Error httpError(HTTPErrorCode code, std::string reason);
+
+/// What is wrong with a request before anything is sent: no absolute http or https URL, or a method
+/// or header that would not be one line of its own. Tasks end with it.
+std::optional<Error> invalidity(const HTTPRequest& request);
+
 /// What a data task ended with. Exactly one of two things holds: `error` is set and the rest is
 /// what had arrived until then, or `error` is empty and `response` is set.
 struct HTTPResult {

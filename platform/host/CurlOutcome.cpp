@@ -102,7 +102,9 @@ std::optional<HTTPResponse> response(CURL* easy) {
   result.url = text(easy, CURLINFO_EFFECTIVE_URL);
   for (curl_header* field = nullptr;
        (field = curl_easy_nextheader(easy, CURLH_HEADER, -1, field)) != nullptr;) {
-    result.headers.add(field->name, field->value);
+    const std::string_view value = field->value;
+    // libcurl leaves the line end in an empty value.
+    result.headers.add(field->name, std::string(value.substr(0, value.find_last_not_of(" \t\r\n") + 1)));
   }
   return result;
 }

@@ -3,7 +3,6 @@
 #include <algorithm>
 #include <string_view>
 
-#include "platform/URL.h"
 #include "platform/host/CurlOutcome.h"
 
 namespace sable::platform::host {
@@ -13,40 +12,11 @@ constexpr const char* kHeadersTooLarge = "headers are larger than the session al
 
 constexpr double kLongestTimeout = 7 * 86400;
 
-// RFC 9110 section 5.6.2.
-bool isToken(std::string_view text) {
-  static constexpr std::string_view kTokenCharacters =
-      "!#$%&'*+-.^_`|~0123456789abcdefghijklmnopqrstuvwxyzABCDEFGHIJKLMNOPQRSTUVWXYZ";
-  return !text.empty() && text.find_first_not_of(kTokenCharacters) == std::string_view::npos;
-}
-
 bool isBlank(std::string_view text) {
   return text.find_first_not_of(" \t") == std::string_view::npos;
 }
 
 }  // namespace
-
-Error httpError(HTTPErrorCode code, std::string reason) {
-  return {std::string(kHTTPErrorDomain), static_cast<std::int64_t>(code), std::move(reason)};
-}
-
-std::optional<Error> CurlTransfer::invalidity(const HTTPRequest& request) {
-  using namespace std::string_view_literals;
-  const auto url = URL::parse(request.url);
-  if (!url) return httpError(HTTPErrorCode::badURL, "not an absolute URL");
-  const std::string scheme = url->scheme();
-  if (scheme != "http" && scheme != "https") {
-    return httpError(HTTPErrorCode::notAllowed, "scheme " + scheme + " is not http or https");
-  }
-  if (!isToken(request.method)) return httpError(HTTPErrorCode::other, "method is not a token");
-  for (const auto& [name, value] : request.headers.fields()) {
-    if (!isToken(name)) return httpError(HTTPErrorCode::other, "header name is not a token");
-    if (value.find_first_of("\r\n\0"sv) != std::string::npos) {
-      return httpError(HTTPErrorCode::other, "header " + name + " has a line break or NUL in its value");
-    }
-  }
-  return std::nullopt;
-}
 
 CurlTransfer::CurlTransfer(const Runtime& runtime, const HTTPSessionConfiguration& configuration,
                            const HTTPRequest& request, HTTPHeaders conditions, std::string proxyURL)

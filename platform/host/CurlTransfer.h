@@ -27,9 +27,6 @@ class CurlTransfer {
   CurlTransfer(const CurlTransfer&) = delete;
   CurlTransfer& operator=(const CurlTransfer&) = delete;
 
-  /// What is wrong with the request itself, before anything is sent.
-  static std::optional<Error> invalidity(const HTTPRequest& request);
-
   /// Sets all options of `easy`, which may have served others, and keeps it until release().
   void prepare(CurlEasy easy);
   CURL* easy() const { return easy_.get(); }
@@ -82,8 +79,5 @@ class CurlTransfer {
   const char* refusal_ = nullptr;  // why we stopped it ourselves
   char errorText_[CURL_ERROR_SIZE] = "";
 };
-
-/// The error of HTTPErrorDomain.
-Error httpError(HTTPErrorCode code, std::string reason);
 
 }  // namespace sable::platform::host

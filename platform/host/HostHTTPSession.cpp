@@ -130,7 +130,7 @@ void HostHTTPSession::Task::cancel() {
 void HostHTTPSession::Core::start(const TaskPointer& task) {
   if (task->state_ != Task::State::created) return;
   if (closed_) return fail(*task, httpError(HTTPErrorCode::cancelled, "session is closed"));
-  if (auto error = CurlTransfer::invalidity(task->request_)) return fail(*task, std::move(*error));
+  if (auto error = invalidity(task->request_)) return fail(*task, std::move(*error));
   if (!isUsableProxy(task->proxyURL_)) {
     return fail(*task, httpError(HTTPErrorCode::proxyFailed, "not a URL of a proxy"));
   }
