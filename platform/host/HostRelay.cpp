@@ -26,6 +26,12 @@ HostRelayConfiguration completed(HostRelayConfiguration configuration) {
   return configuration;
 }
 
+std::string endpointFolder(const HostRelayConfiguration& configuration) {
+  if (!configuration.runtimeFolder.empty()) return configuration.runtimeFolder;
+  const std::size_t slash = configuration.socketPath.find_last_of('/');
+  return slash == std::string::npos ? "." : configuration.socketPath.substr(0, slash);
+}
+
 }  // namespace
 
 HostRelay::HostRelay(HostRuntime& runtime, HostRelayConfiguration configuration)
@@ -40,7 +46,7 @@ std::unique_ptr<RelayListener> HostRelay::namedListener(std::string_view) {
 std::unique_ptr<RelayListener> HostRelay::anonymousListener() {
   return std::make_unique<HostRelayListener>(
       runtime_, HostRelayListener::Kind::anonymous, configuration_.runtimeFolder,
-      fmt::format("{}/{}.sock", configuration_.runtimeFolder, runtime_.uuid().string()),
+      fmt::format("{}/{}.sock", endpointFolder(configuration_), runtime_.uuid().string()),
       RelayAdmission{configuration_.quotas, configuration_.admits});
 }
 

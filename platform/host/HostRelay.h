@@ -13,7 +13,7 @@
 namespace sable::platform::host {
 
 struct HostRelayConfiguration {
-  /// Where sockets stand; made at the first resume() of a listener, mode 0700.
+  /// Where sockets stand; made when a listener opens the first, mode 0700. Empty: beside the named one.
   std::string runtimeFolder;
   /// The named listener's socket; empty is `relay.sock` in the runtime folder.
   std::string socketPath;

@@ -61,7 +61,7 @@ Expected<void> HostRelayListener::resume() {
   if (kind_ == Kind::named) {
     if (const int activated = takeActivationSocket(); activated >= 0) return takeActivated(activated);
   }
-  if (path_.starts_with(folder_ + "/")) {
+  if (!folder_.empty() && path_.starts_with(folder_ + "/")) {
     if (const auto made = makePrivateFolder(folder_); !made) return made;
   }
   if (kind_ == Kind::named) {
