@@ -45,6 +45,19 @@ void HTTPHeaders::remove(std::string_view name) {
   std::erase_if(fields_, isNamed(name));
 }
 
+std::string HTTPHeaders::description() const {
+  std::string text = "{";
+  for (const auto& [name, value] : fields_) {
+    if (text.size() > 1) text += ", ";
+    text += name + ": " + value;
+  }
+  return text + '}';
+}
+
+std::string HTTPResponse::description() const {
+  return std::to_string(status) + ' ' + url + ' ' + headers.description();
+}
+
 Error httpError(HTTPErrorCode code, std::string reason) {
   return {std::string(kHTTPErrorDomain), static_cast<std::int64_t>(code), std::move(reason)};
 }
