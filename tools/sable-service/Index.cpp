@@ -10,6 +10,7 @@
 #include <numeric>
 #include <ranges>
 #include <set>
+#include <thread>
 
 #include "Database.h"
 #include "Message.h"
@@ -18,7 +19,6 @@ namespace service {
 
 namespace {
 
-constexpr size_t kMostHits = 60;
 /// Whoever has typed a whole term most likely means it, even where a longer one is more common.
 constexpr uint64_t kWholeTermFactor = 10;
 
@@ -107,21 +107,21 @@ struct Index::Reader {
   Statement byWeight;
 };
 
-/// A reader for the length of one call.
+/// A reader for the length of one call; waits while all are taken.
 class Index::Lease {
  public:
   explicit Lease(const Index& index) : index_(index) {
-    const std::lock_guard lock(index_.mutex_);
-    if (index_.idle_.empty()) {
-      reader_ = std::make_unique<Reader>(index_.path_);
-    } else {
-      reader_ = std::move(index_.idle_.back());
-      index_.idle_.pop_back();
-    }
+    std::unique_lock lock(index_.mutex_);
+    index_.returned_.wait(lock, [this] { return !index_.idle_.empty(); });
+    reader_ = std::move(index_.idle_.back());
+    index_.idle_.pop_back();
   }
   ~Lease() {
-    const std::lock_guard lock(index_.mutex_);
-    index_.idle_.push_back(std::move(reader_));
+    {
+      const std::lock_guard lock(index_.mutex_);
+      index_.idle_.push_back(std::move(reader_));
+    }
+    index_.returned_.notify_one();
   }
   Lease(const Lease&) = delete;
   Lease& operator=(const Lease&) = delete;
@@ -150,6 +150,8 @@ Index::Index(const std::filesystem::path& folder) : path_(folder / "index.db") {
     terms.texts.emplace_back(rows.text(1));
     terms.weights.push_back(static_cast<uint64_t>(rows.number(2)) + 1);
   }
+  const unsigned readers = std::max(2U, std::thread::hardware_concurrency());
+  while (idle_.size() < readers) idle_.push_back(std::make_unique<Reader>(path_));
   for (const auto corpus : kCorpora) {
     for (const auto& e : best(corpus, 1)) greatest_.at(numberOf(corpus)) = e.weight;
   }
@@ -198,7 +200,7 @@ std::optional<Completion> Index::completeLastWord(Corpus corpus, const std::stri
   const std::string head = space == typed.npos ? "" : typed.substr(0, space + 1);
   const std::string last = typed.substr(head.size());
   if (head.empty() || last.empty()) {
-    return find(corpus, typed).empty() ? std::nullopt : std::optional(Completion{typed, 1});
+    return find(corpus, typed, 1).empty() ? std::nullopt : std::optional(Completion{typed, 1});
   }
   const auto& terms = terms_.at(numberOf(corpus));
   const auto [first, end] = range(terms, last);
@@ -213,21 +215,22 @@ std::optional<Completion> Index::completeLastWord(Corpus corpus, const std::stri
                                                            begin + static_cast<ptrdiff_t>(end), uint64_t{0}));
   for (const size_t i : candidates | std::views::take(tries)) {
     const std::string text = head + terms.texts[i];
-    if (!find(corpus, text).empty()) return Completion{text, static_cast<double>(terms.weights[i]) / total};
+    if (!find(corpus, text, 1).empty())
+      return Completion{text, static_cast<double>(terms.weights[i]) / total};
   }
-  return find(corpus, typed).empty() ? std::nullopt : std::optional(Completion{typed, 1});
+  return find(corpus, typed, 1).empty() ? std::nullopt : std::optional(Completion{typed, 1});
 }
 
-std::vector<Hit> Index::find(Corpus corpus, const std::string& words) const {
+std::vector<Hit> Index::find(Corpus corpus, const std::string& words, size_t most) const {
   std::vector<Hit> hits;
   const std::string inNames = expression("names", words);
-  const std::string inText = expression("text", words);
+  const std::string anywhere = expression("", words);
   if (inNames.empty()) return hits;
   const Lease reader(*this);
   auto& statement = reader->matches.at(numberOf(corpus));
   std::set<std::string> seen;
   const auto collect = [&](const std::string& match, bool named) {
-    statement.bind(0, match).bind(1, static_cast<int64_t>(kMostHits));
+    statement.bind(0, match).bind(1, static_cast<int64_t>(most));
     while (statement.step()) {
       Entry found = readEntry(statement);
       if (!seen.insert(found.reference).second) continue;
@@ -238,8 +241,8 @@ std::vector<Hit> Index::find(Corpus corpus, const std::string& words) const {
   };
   collect(inNames, true);
   std::ranges::stable_partition(hits, &Hit::exact);
-  if (hits.size() < kMostHits) collect(inText, false);
-  hits.resize(std::min(hits.size(), kMostHits));
+  if (hits.size() < most) collect(anywhere, false);
+  hits.resize(std::min(hits.size(), most));
   return hits;
 }
 

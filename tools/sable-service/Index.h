@@ -1,6 +1,7 @@
 #pragma once
 
 #include <array>
+#include <condition_variable>
 #include <filesystem>
 #include <memory>
 #include <mutex>
@@ -53,8 +54,8 @@ class Index {
   /// last word completed so that something is found. None when nothing would be found.
   std::optional<Completion> complete(Corpus corpus, const std::string& typed) const;
   /// Entries that contain every word, those named exactly so first, then those with the words in their names,
-  /// then by weight; at most 60.
-  std::vector<Hit> find(Corpus corpus, const std::string& words) const;
+  /// then by weight.
+  std::vector<Hit> find(Corpus corpus, const std::string& words, size_t most = 60) const;
   /// Entries of one name exactly.
   std::vector<Hit> lookUp(const std::string& name) const;
   std::optional<Entry> entry(const std::string& reference) const;
@@ -80,6 +81,7 @@ class Index {
   std::array<Terms, 2> terms_;
   std::array<uint64_t, 2> greatest_{};
   mutable std::mutex mutex_;
+  mutable std::condition_variable returned_;
   mutable std::vector<std::unique_ptr<Reader>> idle_;
 };
 
