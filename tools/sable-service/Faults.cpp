@@ -6,7 +6,6 @@
 #include <array>
 #include <charconv>
 #include <limits>
-#include <regex>
 #include <string_view>
 
 namespace service {
@@ -42,6 +41,15 @@ std::optional<size_t> number(std::string_view text) {
   return error == std::errc() && end == text.data() + text.size() ? std::optional(value) : std::nullopt;
 }
 
+/// Takes a mark with a number behind it off the end.
+std::optional<size_t> takeSuffix(std::string& text, char mark) {
+  const auto at = text.rfind(mark);
+  if (at == text.npos) return std::nullopt;
+  const auto value = number(std::string_view(text).substr(at + 1));
+  if (value) text.resize(at);
+  return value;
+}
+
 /// Why the value does not suit the kind.
 std::optional<std::string> objection(const Kind& kind, bool given, const std::string& value) {
   if (kind.value == Value::none) {
@@ -65,20 +73,26 @@ bool covers(const std::string& rule, const std::string& path) {
 }  // namespace
 
 std::optional<std::string> Faults::add(const std::string& text) {
-  static const std::regex form("(/[^:]*):([a-z-]+)(=([^]*?))?(\\*([0-9]{1,9}))?(@([0-9]{1,9}))?");
-  std::smatch match;
-  if (!std::regex_match(text, match, form)) {
-    return fmt::format("fault \"{}\" is not PATH:KIND[=VALUE][*COUNT][@SKIP]", text);
-  }
-  const auto kind = std::ranges::find(kKinds, std::string_view(match[2].str()), &Kind::name);
-  if (kind == kKinds.end()) return fmt::format("fault \"{}\": there is no kind \"{}\"", text, match[2].str());
-  if (auto reason = objection(*kind, match[3].matched, match[4]))
-    return fmt::format("fault \"{}\": {}", text, *reason);
-  if (kind->name == "version" && !covers(match[1], "/bag"))
-    return fmt::format("fault \"{}\": only /bag has a version", text);
-  Rule rule{text, match[1], match[2], match[4], 0, std::nullopt};
-  if (match[5].matched) rule.count = number(match[6].str());
-  if (match[7].matched) rule.skip = number(match[8].str()).value_or(0);
+  const auto refuse = [&](const std::string& reason) {
+    return fmt::format("fault \"{}\": {}", text, reason);
+  };
+  Rule rule;
+  std::string rest = text;
+  rule.skip = takeSuffix(rest, '@').value_or(0);
+  rule.count = takeSuffix(rest, '*');
+  const auto colon = rest.find(':');
+  if (!rest.starts_with('/') || colon == rest.npos) return refuse("is not PATH:KIND[=VALUE][*COUNT][@SKIP]");
+  const auto equals = rest.find('=', colon);
+  const bool valueGiven = equals != rest.npos;
+  rule.text = text;
+  rule.path = rest.substr(0, colon);
+  rule.kind = rest.substr(colon + 1, valueGiven ? equals - colon - 1 : rest.npos);
+  if (valueGiven) rule.value = rest.substr(equals + 1);
+
+  const auto* const kind = std::ranges::find(kKinds, std::string_view(rule.kind), &Kind::name);
+  if (kind == kKinds.end()) return refuse(fmt::format("there is no kind \"{}\"", rule.kind));
+  if (const auto reason = objection(*kind, valueGiven, rule.value)) return refuse(*reason);
+  if (rule.kind == "version" && !covers(rule.path, "/bag")) return refuse("only /bag has a version");
   const std::lock_guard lock(mutex_);
   rules_.push_back(std::move(rule));
   return std::nullopt;
