@@ -16,7 +16,7 @@ class HostRuntime final : public Runtime {
   explicit HostRuntime(unsigned threads = 0);
 
   /// Where the facilities of the host watch their descriptors.
-  Reactor& reactor() { return reactor_; }
+  HostReactor& reactor() { return reactor_; }
 
   WallTime now() const override;
   MonotonicTime ticks() const override;
