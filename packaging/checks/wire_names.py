@@ -15,7 +15,9 @@ import re
 import sys
 
 PRODUCT = ("sabled", "SableKit", "platform", "tools/sablectl")
-LITERAL = re.compile(r'"((?:[^"\\]|\\.)*)"')
+LITERAL = re.compile(r'"((?:[^"\\]|\\.)*)"|//.*')
+# Of what the tables name, header fields of the HTTP standard are libcurl's to spell.
+CHECKED = re.compile(r"X-Kestrel-[\w-]+|com\.kestrel\.[\w.]+|[a-z]\w*")
 OURS = re.compile(r"X-Kestrel-|com\.kestrel\.")
 TABLE_ROW = re.compile(r"\s*\|\s*((?:`[^`|]+`[,\s]*(?:or|and)?\s*)+)\|")
 
@@ -28,10 +30,9 @@ def literals(root):
             if path.suffix not in (".h", ".cpp", ".proto"):
                 continue
             for number, line in enumerate(path.read_text().split("\n"), 1):
-                if re.match(r"\s*(#\s*include|//|\*)", line):
-                    continue
-                for literal in LITERAL.finditer(re.sub(r'\s//[^"]*$', "", line)):
-                    found[literal[1]].append(f"{path.relative_to(root)}:{number}")
+                if not re.match(r"\s*#\s*include", line):
+                    for text in {literal[1] for literal in LITERAL.finditer(line)} - {None}:
+                        found[text].append(f"{path.relative_to(root)}:{number}")
     return found
 
 
@@ -57,7 +58,7 @@ def faults(root):
         if text.startswith("X-Kestrel-") and table and text not in table:
             yield f'{places[0]}: "{text}" is in no table of docs/service.md'
     for name, place in table.items():
-        if re.fullmatch(r"[\w.-]+", name) and name not in literal:
+        if CHECKED.fullmatch(name) and name not in literal:
             yield f"{place}: the product does not know `{name}`"
 
 
