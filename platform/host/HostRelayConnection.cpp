@@ -8,7 +8,7 @@
 #include <cerrno>
 
 #include "platform/Log.h"
-#include "platform/RelaySignature.h"
+#include "platform/RelaySupport.h"
 
 namespace sable::platform::host {
 
@@ -19,15 +19,6 @@ constexpr int kMessagesPerWake = 64;
 
 std::string_view orEmpty(const char* text) {
   return text == nullptr ? std::string_view() : text;
-}
-
-tl::unexpected<Error> callError(RelayErrorCode code, std::string reason) {
-  return tl::unexpected(
-      Error{std::string(kRelayErrorDomain), static_cast<std::int64_t>(code), std::move(reason)});
-}
-
-tl::unexpected<Error> disconnected() {
-  return callError(RelayErrorCode::disconnected, "The connection has ended");
 }
 
 bool isHangup(int error) {
@@ -155,7 +146,7 @@ void HostRelayConnection::call(const RelayInterface& interface, std::size_t meth
   requireRelaySignature(arguments, description.in, description.name);
   const Turn turn(turn_);
   if (!bus_) {
-    queue_->async([handler = std::move(handler)]() mutable { handler(disconnected()); });
+    queue_->async([handler = std::move(handler)]() mutable { handler(relayDisconnected()); });
     return;
   }
   RelayOutgoing outgoing;
@@ -294,16 +285,16 @@ Function<void()> HostRelayConnection::takeReply(sd_bus_message* reply) {
 
   Expected<RelayArguments> result;
   if (const sd_bus_error* error = sd_bus_message_get_error(reply)) {
-    result = callError(RelayErrorCode::remoteError,
-                       fmt::format("{} {}", orEmpty(error->name), orEmpty(error->message)));
+    result = relayError(RelayErrorCode::remoteError,
+                        fmt::format("{} {}", orEmpty(error->name), orEmpty(error->message)));
   } else if (orEmpty(sd_bus_message_get_signature(reply, 1)) != pending.method->out) {
-    result = callError(RelayErrorCode::badReply,
-                       fmt::format("{} answered with \"{}\" in place of \"{}\"", pending.method->name,
-                                   orEmpty(sd_bus_message_get_signature(reply, 1)), pending.method->out));
+    result = relayError(RelayErrorCode::badReply,
+                        fmt::format("{} answered with \"{}\" in place of \"{}\"", pending.method->name,
+                                    orEmpty(sd_bus_message_get_signature(reply, 1)), pending.method->out));
   } else if (const int code = readArguments(reply, pending.method->out, quotas_.messageBytes, *result);
              code < 0) {
     result =
-        callError(RelayErrorCode::badReply, fmt::format("{}: {}", pending.method->name, reasonFor(code)));
+        relayError(RelayErrorCode::badReply, fmt::format("{}: {}", pending.method->name, reasonFor(code)));
   }
   return [handler = std::move(pending.handler), result = std::move(result)]() mutable {
     handler(std::move(result));
@@ -341,7 +332,7 @@ void HostRelayConnection::expire(std::uint64_t cookie) {
     handler = std::move(found->second.handler);
     pending_.erase(found);
   }
-  handler(callError(RelayErrorCode::timedOut, "No answer in time"));
+  handler(relayTimedOut());
 }
 
 void HostRelayConnection::checkHandshake() {
@@ -359,7 +350,7 @@ void HostRelayConnection::end(std::string_view reason) {
   handshake_.cancel();
   handlers_->ended = true;
   queue_->async([handlers = handlers_, pending = std::exchange(pending_, {})]() mutable {
-    for (auto& [cookie, call] : pending) call.handler(disconnected());
+    for (auto& [cookie, call] : pending) call.handler(relayDisconnected());
     if (handlers->invalidation) std::exchange(handlers->invalidation, nullptr)();
     handlers->calls.clear();
   });

@@ -7,7 +7,7 @@
 
 #include <cerrno>
 
-#include "platform/RelaySignature.h"
+#include "platform/RelaySupport.h"
 
 namespace sable::platform::host {
 

@@ -5,7 +5,7 @@
 #include <algorithm>
 #include <set>
 
-#include "platform/RelaySignature.h"
+#include "platform/RelaySupport.h"
 
 namespace sable::platform::host {
 

@@ -9,7 +9,7 @@
 #include <cerrno>
 #include <cstring>
 
-#include "platform/RelaySignature.h"
+#include "platform/RelaySupport.h"
 
 namespace sable::platform::host {
 

@@ -5,9 +5,9 @@
 #include <string>
 #include <string_view>
 
-#include "platform/RelayValue.h"
+#include "platform/Relay.h"
 
-/// What RelayValues look like on the wire: for the implementations of Relay.
+/// What the implementations of Relay have in common.
 namespace sable::platform {
 
 /// The alternative of RelayValue (its index) whose D-Bus type stands at the head of `signature`,
@@ -28,5 +28,10 @@ std::size_t relayWireSize(const RelayArguments& arguments);
 
 /// Whether a value is left out of its record: nothing, or data that is null.
 bool isAbsent(const RelayValue& value);
+
+tl::unexpected<Error> relayError(RelayErrorCode code, std::string reason);
+/// The error that calls of an ended connection get.
+tl::unexpected<Error> relayDisconnected();
+tl::unexpected<Error> relayTimedOut();
 
 }  // namespace sable::platform

@@ -1,4 +1,4 @@
-#include "platform/RelaySignature.h"
+#include "platform/RelaySupport.h"
 
 #include <fmt/core.h>
 
@@ -110,6 +110,19 @@ std::size_t relayWireSize(const RelayArguments& arguments) {
 bool isAbsent(const RelayValue& value) {
   const Data* data = std::get_if<Data>(&value);
   return std::holds_alternative<std::monostate>(value) || (data != nullptr && *data == nullptr);
+}
+
+tl::unexpected<Error> relayError(RelayErrorCode code, std::string reason) {
+  return tl::unexpected(
+      Error{std::string(kRelayErrorDomain), static_cast<std::int64_t>(code), std::move(reason)});
+}
+
+tl::unexpected<Error> relayDisconnected() {
+  return relayError(RelayErrorCode::disconnected, "The connection has ended");
+}
+
+tl::unexpected<Error> relayTimedOut() {
+  return relayError(RelayErrorCode::timedOut, "No answer came in time");
 }
 
 }  // namespace sable::platform
