@@ -19,6 +19,7 @@ namespace service {
 
 namespace {
 
+constexpr size_t kMostHits = 60;
 /// Whoever has typed a whole term most likely means it, even where a longer one is more common.
 constexpr uint64_t kWholeTermFactor = 10;
 
@@ -200,7 +201,7 @@ std::optional<Completion> Index::completeLastWord(Corpus corpus, const std::stri
   const std::string head = space == typed.npos ? "" : typed.substr(0, space + 1);
   const std::string last = typed.substr(head.size());
   if (head.empty() || last.empty()) {
-    return find(corpus, typed, 1).empty() ? std::nullopt : std::optional(Completion{typed, 1});
+    return finds(corpus, typed) ? std::optional(Completion{typed, 1}) : std::nullopt;
   }
   const auto& terms = terms_.at(numberOf(corpus));
   const auto [first, end] = range(terms, last);
@@ -215,13 +216,12 @@ std::optional<Completion> Index::completeLastWord(Corpus corpus, const std::stri
                                                            begin + static_cast<ptrdiff_t>(end), uint64_t{0}));
   for (const size_t i : candidates | std::views::take(tries)) {
     const std::string text = head + terms.texts[i];
-    if (!find(corpus, text, 1).empty())
-      return Completion{text, static_cast<double>(terms.weights[i]) / total};
+    if (finds(corpus, text)) return Completion{text, static_cast<double>(terms.weights[i]) / total};
   }
-  return find(corpus, typed, 1).empty() ? std::nullopt : std::optional(Completion{typed, 1});
+  return finds(corpus, typed) ? std::optional(Completion{typed, 1}) : std::nullopt;
 }
 
-std::vector<Hit> Index::find(Corpus corpus, const std::string& words, size_t most) const {
+std::vector<Hit> Index::find(Corpus corpus, const std::string& words) const {
   std::vector<Hit> hits;
   const std::string inNames = expression("names", words);
   const std::string anywhere = expression("", words);
@@ -230,7 +230,7 @@ std::vector<Hit> Index::find(Corpus corpus, const std::string& words, size_t mos
   auto& statement = reader->matches.at(numberOf(corpus));
   std::set<std::string> seen;
   const auto collect = [&](const std::string& match, bool named) {
-    statement.bind(0, match).bind(1, static_cast<int64_t>(most));
+    statement.bind(0, match).bind(1, static_cast<int64_t>(kMostHits));
     while (statement.step()) {
       Entry found = readEntry(statement);
       if (!seen.insert(found.reference).second) continue;
@@ -241,9 +241,20 @@ std::vector<Hit> Index::find(Corpus corpus, const std::string& words, size_t mos
   };
   collect(inNames, true);
   std::ranges::stable_partition(hits, &Hit::exact);
-  if (hits.size() < most) collect(anywhere, false);
-  hits.resize(std::min(hits.size(), most));
+  if (hits.size() < kMostHits) collect(anywhere, false);
+  hits.resize(std::min(hits.size(), kMostHits));
   return hits;
+}
+
+bool Index::finds(Corpus corpus, const std::string& words) const {
+  const std::string anywhere = expression("", words);
+  if (anywhere.empty()) return false;
+  const Lease reader(*this);
+  auto& statement = reader->matches.at(numberOf(corpus));
+  statement.bind(0, anywhere).bind(1, int64_t{1});
+  bool found = false;
+  while (statement.step()) found = true;
+  return found;
 }
 
 std::vector<Hit> Index::lookUp(const std::string& name) const {

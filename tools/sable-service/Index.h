@@ -54,8 +54,8 @@ class Index {
   /// last word completed so that something is found. None when nothing would be found.
   std::optional<Completion> complete(Corpus corpus, const std::string& typed) const;
   /// Entries that contain every word, those named exactly so first, then those with the words in their names,
-  /// then by weight.
-  std::vector<Hit> find(Corpus corpus, const std::string& words, size_t most = 60) const;
+  /// then by weight; at most 60.
+  std::vector<Hit> find(Corpus corpus, const std::string& words) const;
   /// Entries of one name exactly.
   std::vector<Hit> lookUp(const std::string& name) const;
   std::optional<Entry> entry(const std::string& reference) const;
@@ -75,6 +75,8 @@ class Index {
 
   std::optional<Completion> completeTerm(Corpus corpus, const std::string& typed) const;
   std::optional<Completion> completeLastWord(Corpus corpus, const std::string& typed) const;
+  /// Whether any entry contains every word.
+  bool finds(Corpus corpus, const std::string& words) const;
   std::pair<size_t, size_t> range(const Terms& terms, const std::string& beginning) const;
 
   std::filesystem::path path_;

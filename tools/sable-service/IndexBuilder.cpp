@@ -10,7 +10,7 @@ namespace service {
 
 namespace {
 
-constexpr int64_t kFormat = 1;
+constexpr int64_t kFormat = 2;
 
 constexpr const char* kSchema = R"(
   PRAGMA journal_mode = OFF;

@@ -69,13 +69,17 @@ void readField(std::string_view line, Entry& entry, Dependents& dependents) {
     countDependencies(list, dependents);
 }
 
+/// Words of three letters and more; what has digits in it is no word that someone completes.
 void countWords(std::string_view text, Source& source) {
   std::unordered_set<std::string> words;
   const auto isLetter = [](char c) { return std::isalpha(static_cast<unsigned char>(c)) != 0; };
-  for (auto at = text.begin(); at != text.end();) {
-    at = std::find_if(at, text.end(), isLetter);
-    const auto end = std::find_if_not(at, text.end(), isLetter);
-    if (end - at > 2) words.insert(lowercase({at, end}));
+  const auto isPart = [](char c) {
+    return std::isalnum(static_cast<unsigned char>(c)) != 0 || static_cast<unsigned char>(c) >= 0x80;
+  };
+  for (const auto* at = text.begin(); at != text.end();) {
+    at = std::find_if(at, text.end(), isPart);
+    const auto* const end = std::find_if_not(at, text.end(), isPart);
+    if (end - at > 2 && std::all_of(at, end, isLetter)) words.insert(lowercase({at, end}));
     at = end;
   }
   for (const auto& word : words) ++source.terms[word];
