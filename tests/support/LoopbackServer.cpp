@@ -7,6 +7,8 @@
 #include <unistd.h>
 
 #include <array>
+#include <cctype>
+#include <cerrno>
 #include <list>
 #include <stdexcept>
 
@@ -62,6 +64,7 @@ class LoopbackServer::State : public std::enable_shared_from_this<State> {
   std::vector<std::string> requests_;
   std::list<std::shared_ptr<Connection>> connections_;
   int accepted_ = 0;
+  std::function<void()> noneIsOpen_;
 
  private:
   int listener_ = -1;
@@ -99,6 +102,12 @@ class LoopbackServer::Connection : public std::enable_shared_from_this<Connectio
       if (count < 0) return errno == EAGAIN;
       if (count == 0) return false;
       inbox_.append(buffer.data(), static_cast<std::size_t>(count));
+      if (std::isalpha(static_cast<unsigned char>(inbox_.front())) == 0) {
+        // Not HTTP: TLS, or another protocol that a client mistook us for.
+        outbox_ = "HTTP/1.1 400 Bad Request\r\n\r\n";
+        then_ = Reply::Then::close;
+        return write();
+      }
       while (const std::size_t size = requestSize()) {
         const std::string request = inbox_.substr(0, size);
         inbox_.erase(0, size);
@@ -154,6 +163,7 @@ void LoopbackServer::State::acceptAll() {
 
 void LoopbackServer::State::forget(Connection* connection) {
   connections_.remove_if([&](const auto& each) { return each.get() == connection; });
+  if (connections_.empty() && noneIsOpen_) std::exchange(noneIsOpen_, nullptr)();
 }
 
 LoopbackServer::LoopbackServer(HostRuntime& runtime) : state_(std::make_shared<State>(runtime)) {
@@ -184,8 +194,13 @@ int LoopbackServer::connections() const {
   return state_->queue_->sync([this] { return state_->accepted_; });
 }
 
-int LoopbackServer::openConnections() const {
-  return state_->queue_->sync([this] { return static_cast<int>(state_->connections_.size()); });
+void LoopbackServer::waitUntilNoneIsOpen() {
+  const auto none = state_->runtime_.semaphore(0);
+  state_->queue_->sync([&] {
+    state_->noneIsOpen_ = [&] { none->signal(); };
+    state_->forget(nullptr);
+  });
+  static_cast<void>(none->wait(platform::MonotonicTime::max()));
 }
 
 std::string LoopbackServer::ok(const std::string& body, const std::string& headerLines) {

@@ -37,8 +37,8 @@ class LoopbackServer {
   /// Requests as they came.
   std::vector<std::string> requests() const;
   int connections() const;
-  /// Connections that are open now.
-  int openConnections() const;
+  /// Waits until clients have closed all their connections.
+  void waitUntilNoneIsOpen();
 
   /// "HTTP/1.1 200 OK", the header lines given, a Content-Length, and the body.
   static std::string ok(const std::string& body, const std::string& headerLines = "");
