@@ -73,7 +73,7 @@ Expected<Node> makeInteger(const Dictionary& value) {
 }
 
 Expected<Node> makeNode(const Dictionary& value, int depth) {
-  if (depth > kMaximumJSONDepth)
+  if (value.is_structured() && depth >= kMaximumJSONDepth)
     return notEncodable(fmt::format("nested more than {} deep", kMaximumJSONDepth));
   if (value.is_object()) return makeDictionary(value, depth);
   if (value.is_array()) return makeArray(value, depth);
