@@ -1,0 +1,207 @@
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <memory>
+#include <vector>
+
+#include "platform/FileManager.h"
+#include "platform/host/HostFileManager.h"
+#include "platform/host/HostRuntime.h"
+#include "platform/simulated/SimulatedFileManager.h"
+#include "tests/support/TemporaryFolder.h"
+
+namespace sable::platform {
+namespace {
+
+std::int64_t errorOf(const auto& result) {
+  return result ? 0 : result.error().code;
+}
+
+mode_t modeOf(const std::filesystem::path& path) {
+  struct stat status {};
+  return lstat(path.c_str(), &status) == 0 ? status.st_mode & 07777 : 0;
+}
+
+/// What every file manager promises.
+struct FileManagerContract : testing::TestWithParam<bool> {
+  TemporaryFolder folder;
+  std::unique_ptr<FileManager> files = makeFiles();
+
+  std::unique_ptr<FileManager> makeFiles() {
+    if (GetParam()) return std::make_unique<host::HostFileManager>(folder.folders());
+    return std::make_unique<simulated::SimulatedFileManager>();
+  }
+};
+
+TEST_P(FileManagerContract, WhatIsWrittenIsReadUntilItIsRemoved) {
+  const auto caches = files->cachesDirectory();
+  ASSERT_TRUE(caches);
+  const auto file = *caches / "com.kestrel.sabled" / "bag.plist";
+  EXPECT_EQ(errorOf(files->writeAtomically(file, "early")), ENOENT);
+  ASSERT_TRUE(files->createDirectory(file.parent_path()));
+  ASSERT_TRUE(files->createDirectory(file.parent_path()));
+
+  for (const std::string& bytes : {std::string("first"), std::string(), std::string(100'000, '\0')}) {
+    ASSERT_TRUE(files->writeAtomically(file, bytes));
+    EXPECT_EQ(*files->read(file, bytes.size()), bytes);
+    EXPECT_EQ(errorOf(files->read(file, bytes.size() - 1)), bytes.empty() ? 0 : EFBIG);
+  }
+  EXPECT_TRUE(files->remove(file));
+  EXPECT_EQ(errorOf(files->remove(file)), ENOENT);
+  EXPECT_EQ(errorOf(files->read(file, 10)), ENOENT);
+  EXPECT_EQ(errorOf(files->read(file.parent_path(), 10)), EISDIR);
+  EXPECT_EQ(errorOf(files->writeAtomically(file.parent_path(), "x")), EISDIR);
+}
+
+INSTANTIATE_TEST_SUITE_P(Both, FileManagerContract, testing::Bool(),
+                         [](const auto& each) { return each.param ? "Host" : "Simulated"; });
+
+struct HostFileManagerTest : testing::Test {
+  TemporaryFolder folder;
+  host::HostFileManager files{folder.folders()};
+};
+
+TEST_F(HostFileManagerTest, FilesAndFoldersAreForTheirOwnerOnly) {
+  const mode_t before = umask(0);
+  ASSERT_TRUE(files.createDirectory(folder / "a/b"));
+  ASSERT_TRUE(files.writeAtomically(folder / "a/b/file", "x"));
+  umask(before);
+  EXPECT_EQ(modeOf(folder / "a"), 0700u);
+  EXPECT_EQ(modeOf(folder / "a/b"), 0700u);
+  EXPECT_EQ(modeOf(folder / "a/b/file"), 0600u);
+
+  writeFile(folder / "open", "old");
+  ASSERT_EQ(chmod((folder / "open").c_str(), 0666), 0);
+  ASSERT_TRUE(files.writeAtomically(folder / "open", "new"));
+  EXPECT_EQ(modeOf(folder / "open"), 0600u);
+}
+
+TEST_F(HostFileManagerTest, ReadsRegularFilesOnlyAndNeverWaits) {
+  writeFile(folder / "target", "secret");
+  ASSERT_EQ(symlink("target", (folder / "link").c_str()), 0);
+  ASSERT_EQ(mkfifo((folder / "fifo").c_str(), 0600), 0);
+  EXPECT_EQ(errorOf(files.read(folder / "link", 100)), ELOOP);
+  EXPECT_EQ(errorOf(files.read(folder / "fifo", 100)), EINVAL);
+  EXPECT_EQ(errorOf(files.read("/dev/null", 100)), EINVAL);
+}
+
+TEST_F(HostFileManagerTest, ALinkInThePlaceOfAFileIsReplacedNotFollowed) {
+  writeFile(folder / "target", "untouched");
+  ASSERT_EQ(symlink("target", (folder / "link").c_str()), 0);
+  ASSERT_TRUE(files.writeAtomically(folder / "link", "new"));
+  EXPECT_EQ(readFile(folder / "target"), "untouched");
+  EXPECT_EQ(*files.read(folder / "link", 100), "new");
+}
+
+TEST_F(HostFileManagerTest, FoldersAreReachedThroughOwnLinksButNotThroughAStrangers) {
+  writeFile(folder / "real/file", "text");
+  ASSERT_EQ(symlink("real", (folder / "relative").c_str()), 0);
+  ASSERT_EQ(symlink((folder / "relative").c_str(), (folder / "absolute").c_str()), 0);
+  ASSERT_EQ(symlink("loop", (folder / "loop").c_str()), 0);
+  EXPECT_EQ(*files.read(folder / "absolute/../real/file", 100), "text");
+  EXPECT_EQ(errorOf(files.read(folder / "loop/file", 100)), ELOOP);
+  EXPECT_EQ(errorOf(files.read(folder / "real/file/file", 100)), ENOTDIR);
+
+  if (geteuid() != 0) GTEST_SKIP() << "needs root to give a link away";
+  ASSERT_EQ(lchown((folder / "relative").c_str(), 12345, 12345), 0);
+  EXPECT_EQ(errorOf(files.read(folder / "absolute/file", 100)), ELOOP);
+  EXPECT_EQ(errorOf(files.writeAtomically(folder / "relative/file", "x")), ELOOP);
+  EXPECT_EQ(errorOf(files.createDirectory(folder / "relative/below")), ELOOP);
+  EXPECT_EQ(readFile(folder / "real/file"), "text");
+}
+
+TEST_F(HostFileManagerTest, WhatAKilledWriterLeftIsUsedAgain) {
+  writeFile(folder / "file", "old");
+  writeFile(folder / ".file.new", "half of a much longer tex");
+  ASSERT_TRUE(files.writeAtomically(folder / "file", "new"));
+  EXPECT_EQ(readFile(folder / "file"), "new");
+  EXPECT_FALSE(std::filesystem::exists(folder / ".file.new"));
+}
+
+TEST_F(HostFileManagerTest, ReadersSeeOneOfTheTextsWholeWhileSeveralWrite) {
+  const auto path = folder / "file";
+  ASSERT_TRUE(files.writeAtomically(path, std::string(5000, 'a')));
+  host::HostRuntime runtime(3);
+  const auto writers = runtime.waitGroup();
+  for (const char letter : {'b', 'c', 'd'}) {
+    writers->enter();
+    runtime.globalQueue(QualityOfService::standard).async([&, letter] {
+      for (std::size_t i = 1; i <= 50; ++i)
+        EXPECT_TRUE(files.writeAtomically(path, std::string(i * 100, letter)));
+      writers->leave();
+    });
+  }
+  do {
+    const auto text = files.read(path, 10'000);
+    ASSERT_TRUE(text) << text.error().reason;
+    EXPECT_EQ(text->find_first_not_of(text->front()), std::string::npos);
+    EXPECT_EQ(text->size() % 100, 0u);
+  } while (!writers->wait(MonotonicTime{}));
+  EXPECT_FALSE(std::filesystem::exists(folder / ".file.new"));
+}
+
+TEST_F(HostFileManagerTest, AFailedWriteLeavesTheOldFileAndNoRest) {
+  writeFile(folder / "closed/file", "old");
+  std::filesystem::create_directory(folder / "closed/folder");
+  EXPECT_EQ(errorOf(files.writeAtomically(folder / "closed/folder", "x")), EISDIR);
+  EXPECT_FALSE(std::filesystem::exists(folder / "closed/.folder.new"));
+  EXPECT_EQ(errorOf(files.writeAtomically(folder / "missing/file", "x")), ENOENT);
+}
+
+TEST(FoldersTest, TheFirstVariableThatIsSetDecides) {
+  struct Case {
+    std::map<std::string, std::string> variables;
+    std::string runtime, caches, state, config, profile;
+  };
+  const std::string run = "/run/user/" + std::to_string(getuid());
+  const std::string etc = "/etc/com.kestrel.sabled/defaults.toml";
+  const Case cases[] = {
+      {{{"HOME", "/h"}},
+       run + "/com.kestrel.sabled",
+       "/h/.cache/com.kestrel.sabled",
+       "/h/.local/state/com.kestrel.sabled",
+       "/h/.config/com.kestrel.sabled",
+       etc},
+      {{{"HOME", "/h"},
+        {"XDG_RUNTIME_DIR", "/r"},
+        {"XDG_CACHE_HOME", "/c"},
+        {"XDG_STATE_HOME", "/s"},
+        {"XDG_CONFIG_HOME", "relative"}},
+       "/r/com.kestrel.sabled",
+       "/c/com.kestrel.sabled",
+       "/s/com.kestrel.sabled",
+       "/h/.config/com.kestrel.sabled",
+       etc},
+      {{{"HOME", "/h"},
+        {"XDG_RUNTIME_DIR", "/r"},
+        {"SABLED_RUNTIME_DIR", "/R"},
+        {"SABLED_CACHES_DIR", "/C"},
+        {"SABLED_STATE_DIR", "/S"},
+        {"SABLED_CONFIG_DIR", "/F"},
+        {"SABLED_PROFILE", "/P.toml"}},
+       "/R",
+       "/C/com.kestrel.sabled",
+       "/S",
+       "/F",
+       "/P.toml"},
+  };
+  for (const Case& each : cases) {
+    const auto folders = host::Folders::fromEnvironment([&](const char* name) -> std::optional<std::string> {
+      const auto found = each.variables.find(name);
+      return found == each.variables.end() ? std::nullopt : std::optional(found->second);
+    });
+    EXPECT_EQ(folders.runtime, each.runtime);
+    EXPECT_EQ(folders.socket(), each.runtime + "/relay.sock");
+    EXPECT_EQ(folders.caches, each.caches);
+    EXPECT_EQ(folders.state, each.state);
+    EXPECT_EQ(folders.config, each.config);
+    EXPECT_EQ(folders.profileSettings, each.profile);
+  }
+}
+
+}  // namespace
+}  // namespace sable::platform
