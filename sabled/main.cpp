@@ -4,6 +4,8 @@
 #include <vector>
 
 #include "SableKit/SBLConstants.h"
+#include "platform/host/ConfigurationSchema.h"
+#include "platform/host/Folders.h"
 #include "platform/host/HostLog.h"
 #include "platform/host/HostPlatform.h"
 #include "sabled/SableDaemon.h"
@@ -34,13 +36,15 @@ void declareOptions(CLI::App& app, Options& options) {
       ->type_name("LEVEL");
   app.add_option("--log-category", options.logCategories, "Log only this category (repeatable)")
       ->type_name("NAME");
-  app.add_option("--socket", options.socket, "Listen on this socket instead of relay.sock in the runtime folder")
+  app.add_option("--socket", options.socket,
+                 "Listen on this socket instead of relay.sock in the runtime folder")
       ->type_name("PATH");
   app.add_flag("--check-config", options.checkConfig, "Check settings and facts, then exit");
 }
 
 int checkConfiguration() {
-  const auto problems = sable::platform::host::checkConfiguration();
+  using namespace sable::platform::host;
+  const auto problems = checkConfiguration(Folders::fromEnvironment());
   for (const std::string& problem : problems) std::fprintf(stderr, "%s\n", problem.c_str());
   return problems.empty() ? 0 : kExitUsage;
 }

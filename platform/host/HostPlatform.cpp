@@ -1,0 +1,175 @@
+#include "platform/host/HostPlatform.h"
+
+#include <mutex>
+#include <optional>
+
+#include "platform/ConfiguredServiceProxy.h"
+#include "platform/NotificationCenter.h"
+#include "platform/ScriptLanguageTagger.h"
+#include "platform/host/FactFacilities.h"
+#include "platform/host/Folders.h"
+#include "platform/host/HostDeviceInfo.h"
+#include "platform/host/HostFacts.h"
+#include "platform/host/HostFileManager.h"
+#include "platform/host/HostHTTPSession.h"
+#include "platform/host/HostLocaleInfo.h"
+#include "platform/host/HostMemoryPressure.h"
+#include "platform/host/HostNotify.h"
+#include "platform/host/HostProcess.h"
+#include "platform/host/HostRelay.h"
+#include "platform/host/HostRuntime.h"
+#include "platform/host/HostTransactions.h"
+#include "platform/host/MappedTally.h"
+#include "platform/host/TOMLUserDefaults.h"
+
+namespace sable::platform::host {
+namespace {
+
+/// An object that is made when first asked for, once, from whatever thread.
+template <class T>
+class Lazy {
+ public:
+  template <class... Args>
+  T& get(Args&&... args) {
+    std::call_once(once_, [&] { object_.emplace(std::forward<Args>(args)...); });
+    return *object_;
+  }
+
+ private:
+  std::once_flag once_;
+  std::optional<T> object_;
+};
+
+std::string pressureFile(const HostFacts& facts) {
+  return facts.string("memory_pressure_file").value_or("");
+}
+
+}  // namespace
+
+/// In the order in which they need each other.
+struct HostPlatform::Facilities {
+  explicit Facilities(HostPlatformConfiguration configuration)
+      : socketPath(std::move(configuration.socketPath)) {}
+
+  HostFacts& hostFacts() { return facts.get(folders, HostSources{}, runtime.reactor(), notificationCenter); }
+
+  const std::filesystem::path socketPath;
+  const Folders folders = Folders::fromEnvironment();
+  HostRuntime runtime;
+  HostProcess process{runtime.reactor()};
+  HostFileManager fileManager{folders};
+  NotificationCenter notificationCenter;
+  ConfiguredServiceProxy networkServiceProxy;
+  ScriptLanguageTagger languageTagger;
+  Lazy<MappedTally> tally;
+  Lazy<TOMLUserDefaults> userDefaults;
+  Lazy<HostNotify> notify;
+  Lazy<HostTransactions> transactions;
+  Lazy<HostRelay> relay;
+  Lazy<HostHTTPSessions> httpSessions;
+  Lazy<HostFacts> facts;
+  Lazy<HostMemoryPressure> memoryPressure;
+  Lazy<HostDeviceInfo> deviceInfo;
+  Lazy<HostLocaleInfo> localeInfo;
+  Lazy<HostInputModes> inputModes;
+  Lazy<HostCountryConfiguration> countryConfiguration;
+  Lazy<HostManagedConfiguration> managedConfiguration;
+  Lazy<HostAccountStore> accountStore;
+  Lazy<HostMapsService> mapsService;
+};
+
+HostPlatform::HostPlatform(HostPlatformConfiguration configuration)
+    : facilities_(std::make_unique<Facilities>(std::move(configuration))) {}
+
+HostPlatform::~HostPlatform() = default;
+
+Runtime& HostPlatform::runtime() {
+  return facilities_->runtime;
+}
+Process& HostPlatform::process() {
+  return facilities_->process;
+}
+FileManager& HostPlatform::fileManager() {
+  return facilities_->fileManager;
+}
+NotificationCenter& HostPlatform::notificationCenter() {
+  return facilities_->notificationCenter;
+}
+LanguageTagger& HostPlatform::languageTagger() {
+  return facilities_->languageTagger;
+}
+NetworkServiceProxy& HostPlatform::networkServiceProxy() {
+  return facilities_->networkServiceProxy;
+}
+
+Tally& HostPlatform::tally() {
+  return facilities_->tally.get(facilities_->folders.counters());
+}
+
+UserDefaults& HostPlatform::userDefaults() {
+  auto& all = *facilities_;
+  return all.userDefaults.get(all.folders, all.runtime, all.runtime.reactor(), all.fileManager);
+}
+
+Notify& HostPlatform::notify() {
+  return facilities_->notify.get(facilities_->runtime);
+}
+
+Transactions& HostPlatform::transactions() {
+  return facilities_->transactions.get(facilities_->runtime);
+}
+
+Relay& HostPlatform::relay() {
+  HostRelayConfiguration configuration;
+  configuration.runtimeFolder = facilities_->folders.runtime;
+  configuration.socketPath = facilities_->socketPath;
+  return facilities_->relay.get(facilities_->runtime, std::move(configuration));
+}
+
+HTTPSessions& HostPlatform::httpSessions() {
+  return facilities_->httpSessions.get(facilities_->runtime, facilities_->folders.caches);
+}
+
+MemoryPressure& HostPlatform::memoryPressure() {
+  MemoryPressurePaths paths;
+  paths.file = pressureFile(facilities_->hostFacts());
+  return facilities_->memoryPressure.get(facilities_->runtime.reactor(), std::move(paths));
+}
+
+DeviceInfo& HostPlatform::deviceInfo() {
+  return facilities_->deviceInfo.get(facilities_->hostFacts());
+}
+LocaleInfo& HostPlatform::localeInfo() {
+  return facilities_->localeInfo.get(facilities_->hostFacts());
+}
+InputModes& HostPlatform::inputModes() {
+  return facilities_->inputModes.get(facilities_->hostFacts());
+}
+
+CountryConfiguration& HostPlatform::countryConfiguration() {
+  return facilities_->countryConfiguration.get(facilities_->hostFacts());
+}
+
+ManagedConfiguration& HostPlatform::managedConfiguration() {
+  return facilities_->managedConfiguration.get(facilities_->hostFacts());
+}
+
+AccountStore& HostPlatform::accountStore() {
+  return facilities_->accountStore.get(facilities_->hostFacts());
+}
+MapsService& HostPlatform::mapsService() {
+  return facilities_->mapsService.get(facilities_->hostFacts());
+}
+
+std::vector<Availability> HostPlatform::availability() {
+  notify();
+  memoryPressure();
+  auto& tallyFile = facilities_->tally.get(facilities_->folders.counters());
+  return {
+      {"counters", tallyFile.isPersistent(), facilities_->folders.counters().string()},
+      facilities_->notify.get(facilities_->runtime).availability(),
+      facilities_->memoryPressure.get(facilities_->runtime.reactor()).availability(),
+  };
+}
+
+}  // namespace sable::platform::host
