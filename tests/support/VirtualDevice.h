@@ -1,0 +1,117 @@
+#pragma once
+
+#include <deque>
+#include <memory>
+#include <nlohmann/json.hpp>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "SableKit/SBLReply.h"
+#include "SableKit/SBLRequest.h"
+#include "platform/Relay.h"
+#include "platform/simulated/SimulatedLog.h"
+#include "platform/simulated/SimulatedPlatform.h"
+#include "sabled/SableDaemon.h"
+
+namespace sable::test {
+
+using namespace std::chrono_literals;
+using json = nlohmann::ordered_json;
+
+class VirtualDevice;
+
+/// An answer for the scripted service to give.
+platform::simulated::Scripted answering(std::string body, int status = 200);
+
+/// What a call was answered with; nothing before it was.
+struct Answer {
+  std::uint64_t queryId = 0;
+  std::optional<SBLReply> reply;
+  std::optional<Error> error;
+
+  std::string data() const { return reply && reply->data ? *reply->data : std::string(); }
+};
+using PendingAnswer = std::shared_ptr<std::optional<Answer>>;
+
+/// An application on the virtual device: one raw connection to the daemon.
+class TestClient {
+ public:
+  TestClient(VirtualDevice& device, platform::RelayEndpoint endpoint, pid_t pid);
+  ~TestClient();
+
+  /// Sends Configure; the answer, if any, is in endpoint().
+  void configure(std::string identifier = "com.kestrel.beacon", std::string agent = "Beacon/1");
+  const std::optional<std::string>& endpoint() const { return state_->endpoint; }
+
+  /// Sends a request and goes on.
+  PendingAnswer send(SBLAnyRequest request);
+  /// Sends a search for `text` with the next query id and runs until it is answered.
+  Answer search(std::string text);
+  Answer ask(SBLAnyRequest request);
+
+  struct PushedBag {
+    json raw;
+    std::string userAgent;
+    std::optional<Error> error;
+  };
+  const std::vector<PushedBag>& bags() const { return state_->bags; }
+  bool isConnected() const { return !state_->invalidated; }
+  void disconnect() { connection_->invalidate(); }
+  platform::RelayConnection& connection() { return *connection_; }
+
+ private:
+  struct State {
+    std::optional<std::string> endpoint;
+    std::vector<PushedBag> bags;
+    bool invalidated = false;
+  };
+
+  VirtualDevice& device_;
+  const std::shared_ptr<State> state_ = std::make_shared<State>();
+  std::shared_ptr<platform::RelayConnection> connection_;
+  std::uint64_t queryId_ = 0;
+};
+
+/// The whole daemon on a device in memory and virtual time, with a scripted service. Until a test
+/// says otherwise the service offers a bag that enables everything and answers searches with one
+/// result set that completes the query.
+class VirtualDevice {
+ public:
+  explicit VirtualDevice(std::uint64_t seed = 1);
+  ~VirtualDevice();
+
+  /// Starts the daemon and lets it settle.
+  void start();
+
+  platform::simulated::SimulatedPlatform platform;
+  platform::simulated::SimulatedLog log;
+  platform::simulated::ScriptedService& service = platform.httpSessions().service();
+  /// What /bag answers; change it at any time.
+  json bag;
+
+  SableDaemon& daemon() { return *daemon_; }
+  Assembly& assembly() { return daemon_->assembly(); }
+
+  void run() { platform.runtime().run(); }
+  void advance(platform::Duration duration) { platform.runtime().advance(duration); }
+  /// Runs until an answer is there, for 30 s at most.
+  void await(const PendingAnswer& answer);
+
+  /// A connection, not yet configured.
+  TestClient& connect(pid_t pid = 100);
+  /// A configured connection.
+  TestClient& client(std::string identifier = "com.kestrel.beacon", std::string agent = "Beacon/1");
+
+  std::size_t sent(std::string_view path) const { return service.requests(path).size(); }
+  std::int64_t counter(const std::string& key) { return platform.tally().value("com.kestrel.sabled." + key); }
+  /// The bytes of bag.plist; empty when there is none.
+  std::string bagFile();
+
+ private:
+  std::unique_ptr<SableDaemon> daemon_;
+  std::deque<TestClient> clients_;
+};
+
+}  // namespace sable::test
