@@ -80,4 +80,10 @@ std::optional<Error> invalidity(const HTTPRequest& request) {
   return std::nullopt;
 }
 
+bool isProxyURL(std::string_view text) {
+  const auto url = URL::parse(text);
+  const std::string scheme = url ? url->scheme() : "";
+  return scheme == "http" || scheme == "https" || scheme == "socks5h";
+}
+
 }  // namespace sable::platform

@@ -98,6 +98,9 @@ Error httpError(HTTPErrorCode code, std::string reason);
 /// or header that would not be one line of its own. Tasks end with it.
 std::optional<Error> invalidity(const HTTPRequest& request);
 
+/// Whether HTTPDataTask::setProxy can use it: an absolute URL of scheme http, https or socks5h.
+bool isProxyURL(std::string_view text);
+
 /// What a data task ended with. Exactly one of two things holds: `error` is set and the rest is
 /// what had arrived until then, or `error` is empty and `response` is set.
 struct HTTPResult {

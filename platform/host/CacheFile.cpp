@@ -15,6 +15,9 @@ namespace {
 constexpr int kApplicationId = 0x5AB1CAC4;
 constexpr int kSchemaVersion = 1;
 
+// A session that has just ended may still be writing.
+constexpr int kLockWaitMilliseconds = 250;
+
 constexpr const char* kSettings =
     "PRAGMA locking_mode=EXCLUSIVE;"
     "PRAGMA cache_size=-256;"
@@ -138,6 +141,7 @@ int CacheFile::openDatabase() {
       sqlite3_open_v2(path_.c_str(), &database, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr);
   database_.reset(database);
   if (opened != SQLITE_OK) return opened;
+  sqlite3_busy_timeout(database, kLockWaitMilliseconds);
   if (const int code = execute(kSettings); code != SQLITE_OK) return code;
   Statement signature(database,
                       "SELECT (SELECT application_id FROM pragma_application_id),"

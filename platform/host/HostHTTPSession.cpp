@@ -6,7 +6,6 @@
 #include <unordered_map>
 #include <vector>
 
-#include "platform/URL.h"
 #include "platform/host/CurlMulti.h"
 #include "platform/host/CurlTransfer.h"
 #include "platform/host/ResponseCache.h"
@@ -23,13 +22,6 @@ struct CurlShareDeleter {
 void initializeLibcurl() {
   static std::once_flag once;
   std::call_once(once, [] { curl_global_init(CURL_GLOBAL_DEFAULT); });
-}
-
-bool isUsableProxy(const std::string& text) {
-  if (text.empty()) return true;
-  const auto url = URL::parse(text);
-  const std::string scheme = url ? url->scheme() : "";
-  return scheme == "http" || scheme == "https" || scheme == "socks5h";
 }
 
 }  // namespace
@@ -131,7 +123,7 @@ void HostHTTPSession::Core::start(const TaskPointer& task) {
   if (task->state_ != Task::State::created) return;
   if (closed_) return fail(*task, httpError(HTTPErrorCode::cancelled, "session is closed"));
   if (auto error = invalidity(task->request_)) return fail(*task, std::move(*error));
-  if (!isUsableProxy(task->proxyURL_)) {
+  if (!task->proxyURL_.empty() && !isProxyURL(task->proxyURL_)) {
     return fail(*task, httpError(HTTPErrorCode::proxyFailed, "not a URL of a proxy"));
   }
   const bool asksCache = cache_ && task->request_.cachePolicy == HTTPCachePolicy::useProtocol;

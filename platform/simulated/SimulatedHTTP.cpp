@@ -30,6 +30,9 @@ class SimulatedTask final : public HTTPDataTask, public std::enable_shared_from_
     if (std::exchange(resumed_, true)) return;
     start_ = shared_->runtime.now();
     if (auto error = invalidity(request_)) return end(Duration{}, std::move(error));
+    if (!proxyURL_.empty() && !isProxyURL(proxyURL_)) {
+      return end(Duration{}, httpError(HTTPErrorCode::proxyFailed, "not a URL of a proxy"));
+    }
     answer_ = shared_->service.answer(
         {request_, pathOf(request_.url), shared_->configuration.label, proxyURL_, shared_->runtime.ticks()});
     const auto timeout = fromSeconds(request_.timeout);

@@ -1,0 +1,373 @@
+#include <gtest/gtest.h>
+#include <sqlite3.h>
+#include <sys/stat.h>
+
+#include <fstream>
+
+#include "platform/host/CacheFile.h"
+#include "platform/host/HostHTTPSession.h"
+#include "platform/host/ResponseCache.h"
+#include "platform/simulated/SimulatedLog.h"
+#include "platform/simulated/SimulatedRuntime.h"
+#include "tests/support/LoopbackServer.h"
+
+namespace sable::platform::host {
+namespace {
+
+using std::chrono::hours;
+using std::chrono::seconds;
+using Fields = std::vector<std::pair<std::string, std::string>>;
+
+// Sun, 06 Nov 1994 08:49:37 GMT, the date that RFC 9110 is fond of.
+constexpr WallTime kDate{seconds(784111777)};
+constexpr const char* kDateText = "Sun, 06 Nov 1994 08:49:37 GMT";
+constexpr const char* kMinuteLater = "Sun, 06 Nov 1994 08:50:37 GMT";
+
+HTTPHeaders headers(const Fields& fields) {
+  HTTPHeaders result;
+  for (const auto& [name, value] : fields) result.add(name, value);
+  return result;
+}
+
+HTTPRequest get(const Fields& fields = {}) {
+  HTTPRequest request;
+  request.url = "http://h/";
+  request.headers = headers(fields);
+  return request;
+}
+
+TEST(CacheRules, WhatMayBeStored) {
+  const Fields fresh{{"Cache-Control", "max-age=60"}};
+  const struct {
+    int status;
+    Fields request, response;
+    bool storable;
+  } rows[] = {
+      {200, {}, {}, false},
+      {200, {}, fresh, true},
+      {203, {}, fresh, true},
+      {301, {}, fresh, true},
+      {404, {}, fresh, true},
+      {410, {}, fresh, true},
+      {204, {}, fresh, false},
+      {206, {}, fresh, false},
+      {302, {}, fresh, false},
+      {304, {}, fresh, false},
+      {500, {}, fresh, false},
+      {200, {}, {{"cache-control", "PRIVATE, Max-Age=\"60\""}}, true},
+      {200, {}, {{"Cache-Control", "max-age=0"}}, false},
+      {200, {}, {{"Cache-Control", "max-age=-1"}}, false},
+      {200, {}, {{"Cache-Control", "max-age=1x"}}, false},
+      {200, {}, {{"Cache-Control", "max-age=60"}, {"Cache-Control", "max-age=0"}}, false},
+      {200, {}, {{"Cache-Control", "max-age=99999999999999999999"}}, true},
+      {200, {}, {{"Cache-Control", "x=\"no-store, a\\\"\", max-age=1"}}, true},
+      {200, {}, {{"Cache-Control", "max-age=60"}, {"Cache-Control", "no-store"}}, false},
+      {200, {{"Cache-Control", "no-store"}}, fresh, false},
+      {200, {}, {{"Cache-Control", "max-age=60, no-cache"}}, false},
+      {200, {}, {{"Cache-Control", "no-cache"}, {"ETag", "\"1\""}}, true},
+      {200, {}, {{"Last-Modified", kDateText}}, true},
+      {200, {}, {{"Date", kDateText}, {"Expires", kMinuteLater}}, true},
+      {200, {}, {{"Date", kDateText}, {"Expires", kDateText}}, false},
+      {200, {}, {{"Expires", "0"}}, false},
+      {200, {}, {{"ETag", "\"1\""}, {"Vary", "Accept, *"}}, false},
+      {200, {}, {{"ETag", "\"1\""}, {"Vary", "Accept"}}, true},
+  };
+  for (const auto& row : rows) {
+    EXPECT_EQ(isStorable(get(row.request), row.status, headers(row.response)), row.storable)
+        << row.status << ' ' << headers(row.request).description() << headers(row.response).description();
+  }
+}
+
+TEST(CacheRules, WhatMayBeReused) {
+  using enum Reuse;
+  const struct {
+    Fields request, response;
+    int secondsLater;
+    Reuse expected;
+  } rows[] = {
+      {{}, {{"Cache-Control", "max-age=60"}}, 59, asItIs},
+      {{}, {{"Cache-Control", "max-age=60"}}, 60, never},
+      {{}, {{"Cache-Control", "max-age=60"}, {"ETag", "1"}}, 60, afterValidation},
+      {{}, {{"Cache-Control", "max-age=60"}, {"Expires", kDateText}}, 59, asItIs},
+      {{}, {{"Cache-Control", "s-maxage=0, max-age=60"}}, 59, asItIs},
+      {{}, {{"Cache-Control", "max-age=60, no-cache"}, {"ETag", "1"}}, 0, afterValidation},
+      {{}, {{"Cache-Control", "max-age=60"}, {"Age", "50"}}, 9, asItIs},
+      {{}, {{"Cache-Control", "max-age=60"}, {"Age", "50"}}, 10, never},
+      {{}, {{"Cache-Control", "max-age=60"}, {"Date", "Sun, 06 Nov 1994 08:48:38 GMT"}}, 0, asItIs},
+      {{}, {{"Cache-Control", "max-age=60"}, {"Date", "Sun, 06 Nov 1994 08:48:37 GMT"}}, 0, never},
+      {{}, {{"Cache-Control", "max-age=60"}, {"ETag", "1"}}, -1, afterValidation},  // the clock went back
+      {{}, {{"Expires", kMinuteLater}}, 59, asItIs},
+      {{}, {{"Expires", kMinuteLater}}, 60, never},
+      {{}, {{"Expires", "0"}, {"Last-Modified", kDateText}}, 0, afterValidation},
+      {{}, {{"Last-Modified", "Sun, 06 Nov 1984 08:49:37 GMT"}}, 0, afterValidation},
+      {{{"Cache-Control", "no-cache"}}, {{"Cache-Control", "max-age=60"}}, 0, never},
+      {{{"Pragma", "no-cache"}}, {{"Cache-Control", "max-age=60"}}, 0, never},
+      {{{"Cache-Control", "max-age=5"}}, {{"Cache-Control", "max-age=60"}}, 5, asItIs},
+      {{{"Cache-Control", "max-age=5"}}, {{"Cache-Control", "max-age=60"}}, 6, never},
+      {{{"Cache-Control", "min-fresh=10"}}, {{"Cache-Control", "max-age=60"}}, 49, asItIs},
+      {{{"Cache-Control", "min-fresh=10"}}, {{"Cache-Control", "max-age=60"}}, 50, never},
+      {{{"Cache-Control", "max-stale"}}, {{"Cache-Control", "max-age=60"}}, 61, never},
+  };
+  for (const auto& row : rows) {
+    const StoredResponse stored{"http://h/", 200, headers(row.response), {}, makeData(""), kDate, kDate};
+    EXPECT_EQ(reuse(stored, get(row.request), kDate + seconds(row.secondsLater)), row.expected)
+        << headers(row.request).description() << headers(row.response).description() << row.secondsLater;
+  }
+}
+
+TEST(CacheRules, VariantsAnswerTheirOwnRequests) {
+  const auto response = headers({{"Cache-Control", "max-age=60"}, {"Vary", "Accept-Language, x-none"}});
+  StoredResponse stored{"http://h/", 200, response, {}, makeData(""), kDate, kDate};
+  stored.varied = variedFields(headers({{"accept-language", "de"}, {"Accept-Language", " fr"}}), response);
+  EXPECT_EQ(reuse(stored, get({{"Accept-Language", "de, fr"}, {"Y", "1"}}), kDate), Reuse::asItIs);
+  for (const Fields& other :
+       {Fields{}, {{"Accept-Language", "de"}}, {{"Accept-Language", "de, fr"}, {"X-None", "1"}}})
+    EXPECT_EQ(reuse(stored, get(other), kDate), Reuse::never);
+}
+
+TEST(CacheRules, AValidationRenewsHeadersAndTimes) {
+  const StoredResponse stored{"http://h/",
+                              200,
+                              headers({{"Date", kDateText},
+                                       {"Age", "9"},
+                                       {"ETag", "1"},
+                                       {"X", "a"},
+                                       {"X", "b"},
+                                       {"Content-Length", "2"}}),
+                              {},
+                              makeData("hi"),
+                              kDate,
+                              kDate};
+  HTTPHeaders conditions;
+  addConditions(stored, conditions);
+  EXPECT_EQ(conditions.fields(), (Fields{{"If-None-Match", "1"}}));
+  const auto later = kDate + hours(1);
+  const auto renewed = validated(
+      stored, headers({{"X", "c"}, {"X", "d"}, {"Content-Length", "0"}, {"Cache-Control", "max-age=60"}}),
+      later, later);
+  EXPECT_EQ(
+      renewed.headers.fields(),
+      (Fields{
+          {"ETag", "1"}, {"Content-Length", "2"}, {"X", "c"}, {"X", "d"}, {"Cache-Control", "max-age=60"}}));
+  EXPECT_EQ(*renewed.body, "hi");
+  EXPECT_EQ(reuse(renewed, get(), later + seconds(59)), Reuse::asItIs);
+}
+
+class CacheInAFolder : public ::testing::Test {
+ protected:
+  CacheInAFolder() {
+    std::string pattern = ::testing::TempDir() + "cacheXXXXXX";
+    folder_ = ::mkdtemp(pattern.data());
+    file_ = folder_ / "http" / "cache.db";
+  }
+  ~CacheInAFolder() override { std::filesystem::remove_all(folder_); }
+
+  std::shared_ptr<ResponseCache> cache(std::size_t memory, std::size_t disk) {
+    return std::make_shared<ResponseCache>(runtime_, runtime_.serialQueue("owner"), file_, memory, disk);
+  }
+
+  static StoredResponse response(const std::string& url, std::string body) {
+    return {url,
+            200,
+            headers({{"ETag", "1"}, {"X", ""}}),
+            headers({{"Y", "y"}}),
+            makeData(std::move(body)),
+            kDate,
+            kDate + seconds(1)};
+  }
+
+  std::optional<std::string> bodyOf(ResponseCache& cache, const std::string& url) {
+    std::optional<std::string> body;
+    int answers = 0;
+    cache.find(url, [&](ResponseCache::Stored stored) {
+      ++answers;
+      if (stored) body = *stored->body;
+    });
+    runtime_.run();
+    EXPECT_EQ(answers, 1);
+    return body;
+  }
+
+  std::filesystem::path folder_, file_;
+  simulated::SimulatedRuntime runtime_;
+};
+
+TEST_F(CacheInAFolder, ResponsesOutliveTheProcess) {
+  EXPECT_EQ(bodyOf(*cache(1000, 1000), "a"), std::nullopt);
+  EXPECT_FALSE(std::filesystem::exists(file_)) << "nothing to keep, no file";
+  {
+    const auto first = cache(1000, 10000);
+    first->store(response("a", std::string("1\0x", 3)));
+    first->store(response("b", "2"));
+    first->store(response("b", "3"));
+    first->remove("a");
+    first->store(response("a", std::string("4\0x", 3)));
+  }
+  runtime_.run();
+  struct stat status {};
+  ASSERT_EQ(::stat(file_.c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 0777u, 0600u);
+  ASSERT_EQ(::stat(file_.parent_path().c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 0777u, 0700u);
+
+  const auto second = cache(1000, 10000);
+  EXPECT_EQ(bodyOf(*second, "a"), std::string("4\0x", 3));
+  EXPECT_EQ(bodyOf(*second, "b"), "3");
+  EXPECT_EQ(bodyOf(*second, "c"), std::nullopt);
+  second->find("a", [](ResponseCache::Stored stored) {
+    const auto expected = response("a", "");
+    EXPECT_EQ(stored->headers.fields(), expected.headers.fields());
+    EXPECT_EQ(stored->varied.fields(), expected.varied.fields());
+    EXPECT_EQ(stored->requestTime, expected.requestTime);
+    EXPECT_EQ(stored->responseTime, expected.responseTime);
+  });
+  second->remove("a");
+  second->purgeMemory();
+  second->rest();
+  EXPECT_EQ(bodyOf(*second, "a"), std::nullopt);
+  EXPECT_EQ(bodyOf(*second, "b"), "3");
+}
+
+TEST_F(CacheInAFolder, TheLeastRecentlyUsedGoFirst) {
+  const auto memoryOnly = cache(1000, 0);
+  const auto diskOnly = cache(0, 1000);
+  for (const auto& cache : {memoryOnly, diskOnly}) {
+    // 1 byte of URL and 12 of headers each: twenty fit, and a 21st drives one out.
+    for (char url = 'a'; url < 'a' + 20; ++url)
+      cache->store(response(std::string(1, url), std::string(37, 'x')));
+    EXPECT_TRUE(bodyOf(*cache, "a"));
+    cache->store(response("z", std::string(37, 'x')));
+    runtime_.run();
+    EXPECT_TRUE(bodyOf(*cache, "a"));
+    EXPECT_FALSE(bodyOf(*cache, "b"));
+    EXPECT_TRUE(bodyOf(*cache, "c"));
+    // More than a tenth of the capacity is not kept, and what it replaces is gone.
+    cache->store(response("c", std::string(100, 'x')));
+    EXPECT_FALSE(bodyOf(*cache, "c"));
+    EXPECT_TRUE(bodyOf(*cache, "d"));
+  }
+  EXPECT_TRUE(std::filesystem::exists(file_));
+}
+
+TEST_F(CacheInAFolder, AFileThatIsNoCacheIsReplacedOnce) {
+  const auto garbage = [&] { std::ofstream(file_) << std::string(5000, 'g'); };
+  const auto foreign = [&] {
+    sqlite3* database = nullptr;
+    ASSERT_EQ(sqlite3_open(file_.c_str(), &database), SQLITE_OK);
+    ASSERT_EQ(sqlite3_exec(database, "CREATE TABLE responses(x)", nullptr, nullptr, nullptr), SQLITE_OK);
+    sqlite3_close(database);
+  };
+  const auto damaged = [&] {
+    cache(0, 100000)->store(response("old", std::string(9000, 'x')));
+    runtime_.run();
+    std::fstream file(file_, std::ios::in | std::ios::out | std::ios::binary);
+    file.seekp(4096);
+    file << std::string(12000, '\xff');
+  };
+  for (const std::function<void()>& spoil :
+       {std::function<void()>(garbage), std::function<void()>(foreign), std::function<void()>(damaged)}) {
+    std::filesystem::remove_all(file_.parent_path());
+    std::filesystem::create_directory(file_.parent_path());
+    spoil();
+    const simulated::SimulatedLog log;
+    {
+      const auto cache = this->cache(0, 100000);
+      EXPECT_FALSE(bodyOf(*cache, "old"));
+      cache->store(response("a", "1"));
+      cache->store(response("b", "2"));
+      EXPECT_EQ(bodyOf(*cache, "b"), "2");
+    }
+    runtime_.run();
+    EXPECT_EQ(bodyOf(*cache(0, 100000), "b"), "2");
+    runtime_.run();
+    EXPECT_EQ(log.count(LogLevel::error), 1u);
+  }
+}
+
+TEST_F(CacheInAFolder, WithoutAFileMemoryStillServes) {
+  std::ofstream(folder_ / "http") << "in the way";
+  const simulated::SimulatedLog log;
+  const auto cache = this->cache(1000, 1000);
+  cache->store(response("a", "1"));
+  cache->store(response("b", "2"));
+  EXPECT_EQ(bodyOf(*cache, "a"), "1");
+  cache->purgeMemory();
+  EXPECT_EQ(bodyOf(*cache, "a"), std::nullopt);
+  runtime_.run();
+  EXPECT_EQ(log.count(LogLevel::error), 1u);
+}
+
+TEST_F(CacheInAFolder, ASessionAsksTheServerOnlyForWhatItMust) {
+  HostRuntime runtime(2);
+  tests::LoopbackServer server(runtime);
+  HostHTTPSessions sessions(runtime, folder_);
+  HTTPSessionConfiguration configuration;
+  configuration.label = "cached";
+  configuration.allowsCache = true;
+  configuration.cacheMemoryCapacity = configuration.cacheDiskCapacity = 1 << 20;
+  auto session = sessions.session(configuration);
+  const auto load = [&](const std::string& path, const Fields& fields = {}, std::string method = "GET",
+                        HTTPCachePolicy policy = HTTPCachePolicy::useProtocol) {
+    HTTPRequest request = get(fields);
+    request.url = server.url(path);
+    request.method = std::move(method);
+    request.cachePolicy = policy;
+    HTTPResult result;
+    const auto done = runtime.semaphore(0);
+    session
+        ->dataTask(std::move(request),
+                   [&](HTTPResult got) {
+                     result = std::move(got);
+                     done->signal();
+                   })
+        ->resume();
+    EXPECT_TRUE(done->wait(MonotonicTime::max()));
+    EXPECT_FALSE(result.error);
+    return result;
+  };
+  const auto asked = [&] { return server.requests().size(); };
+
+  server.on("/fresh", tests::LoopbackServer::ok("fresh", "Cache-Control: max-age=600\r\nVary: X\r\n"));
+  EXPECT_FALSE(load("/fresh").response->fromCache);
+  const auto second = load("/fresh");
+  EXPECT_TRUE(second.response->fromCache);
+  EXPECT_EQ(*second.data, "fresh");
+  EXPECT_NE(second.response->headers.find("Age"), nullptr);
+  EXPECT_EQ(asked(), 1u);
+  EXPECT_FALSE(load("/fresh", {{"X", "other"}}).response->fromCache);
+  EXPECT_FALSE(load("/fresh", {}, "GET", HTTPCachePolicy::ignoreLocal).response->fromCache);
+  EXPECT_FALSE(load("/fresh", {{"Range", "bytes=0-1"}}).response->fromCache);
+  EXPECT_EQ(asked(), 4u);
+
+  session->purgeMemoryCache();
+  EXPECT_TRUE(load("/fresh").response->fromCache);
+  session = nullptr;
+  session = sessions.session(configuration);
+  EXPECT_TRUE(load("/fresh").response->fromCache) << "the file outlives the session";
+  EXPECT_EQ(asked(), 4u);
+  load("/fresh", {}, "POST");
+  EXPECT_FALSE(load("/fresh").response->fromCache);
+
+  server.on("/checked", [](const std::string& request) -> tests::LoopbackServer::Reply {
+    if (request.find("If-None-Match: \"1\"\r\n") == std::string::npos)
+      return {tests::LoopbackServer::ok("checked", "ETag: \"1\"\r\nX: old\r\n")};
+    return {"HTTP/1.1 304 Not Modified\r\nX: new\r\n\r\n"};
+  });
+  EXPECT_FALSE(load("/checked").response->fromCache);
+  const auto validated = load("/checked");
+  EXPECT_TRUE(validated.response->fromCache);
+  EXPECT_EQ(validated.response->status, 200);
+  EXPECT_EQ(*validated.response->headers.find("X"), "new");
+  EXPECT_EQ(*validated.data, "checked");
+  EXPECT_EQ(load("/checked", {{"If-None-Match", "\"1\""}}).response->status, 304)
+      << "the caller's own condition";
+
+  server.on("/moved", "HTTP/1.1 302 F\r\nLocation: /fresh\r\nContent-Length: 0\r\n\r\n");
+  const auto before = asked();
+  load("/moved");
+  load("/moved");
+  EXPECT_EQ(asked(), before + 4) << "what a redirect led to is not kept under the first URL";
+}
+
+}  // namespace
+}  // namespace sable::platform::host
