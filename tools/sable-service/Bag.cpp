@@ -48,7 +48,7 @@ const std::map<std::string, std::string> kResources = {
 
 }  // namespace
 
-Bag::Bag(std::string base) : keys_(builtIn(base)), resources_(kResources) {
+Bag::Bag(const std::string& base) : keys_(builtIn(base)), resources_(kResources) {
   for (const auto& [identifier, content] : resources_) {
     keys_["download_resources_list"].push_back(identifier);
     keys_[identifier] = base + "/resources/" + identifier;

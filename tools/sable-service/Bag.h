@@ -13,7 +13,7 @@ class Bag {
  public:
   /// `base` is the service's own address without a trailing slash: all URLs of the built-in bag begin with
   /// it.
-  explicit Bag(std::string base);
+  explicit Bag(const std::string& base);
 
   /// Merges the members of an object into the bag (RFC 7396).
   void merge(const Json& keys);

@@ -8,7 +8,6 @@
 #include <algorithm>
 #include <cerrno>
 #include <numeric>
-#include <ranges>
 #include <set>
 #include <thread>
 
@@ -170,9 +169,9 @@ std::pair<size_t, size_t> Index::range(const Terms& terms, const std::string& be
   const auto cut = [&](const std::string& term) {
     return std::string_view(term).substr(0, beginning.size());
   };
-  const auto found = std::ranges::equal_range(terms.texts, std::string_view(beginning), {}, cut);
-  const auto first = static_cast<size_t>(found.begin() - terms.texts.begin());
-  return {first, first + found.size()};
+  const auto first = std::ranges::lower_bound(terms.texts, beginning, {}, cut);
+  const auto last = std::ranges::upper_bound(terms.texts, beginning, {}, cut);
+  return {first - terms.texts.begin(), last - terms.texts.begin()};
 }
 
 std::optional<Completion> Index::completeTerm(Corpus corpus, const std::string& typed) const {
@@ -214,7 +213,8 @@ std::optional<Completion> Index::completeLastWord(Corpus corpus, const std::stri
   const auto begin = terms.weights.begin();
   const double total = static_cast<double>(std::accumulate(begin + static_cast<ptrdiff_t>(first),
                                                            begin + static_cast<ptrdiff_t>(end), uint64_t{0}));
-  for (const size_t i : candidates | std::views::take(tries)) {
+  candidates.resize(tries);
+  for (const size_t i : candidates) {
     const std::string text = head + terms.texts[i];
     if (finds(corpus, text)) return Completion{text, static_cast<double>(terms.weights[i]) / total};
   }
@@ -240,7 +240,7 @@ std::vector<Hit> Index::find(Corpus corpus, const std::string& words) const {
     }
   };
   collect(inNames, true);
-  std::ranges::stable_partition(hits, &Hit::exact);
+  std::stable_partition(hits.begin(), hits.end(), [](const Hit& hit) { return hit.exact; });
   if (hits.size() < kMostHits) collect(anywhere, false);
   hits.resize(std::min(hits.size(), kMostHits));
   return hits;

@@ -54,7 +54,7 @@ void deliver(Answer answer, const FaultPlan& plan, httplib::Response& response) 
 
 }  // namespace
 
-Service::Service(std::string base, const Index& index, Faults& faults, Recorder& recorder)
+Service::Service(const std::string& base, const Index& index, Faults& faults, Recorder& recorder)
     : bag_(base), search_(index, base), faults_(faults), recorder_(recorder) {}
 
 void Service::handle(const Request& request, httplib::Response& response) {

@@ -21,7 +21,7 @@ namespace service {
 class Service {
  public:
   /// `base` is the service's own address; the others outlive the service.
-  Service(std::string base, const Index& index, Faults& faults, Recorder& recorder);
+  Service(const std::string& base, const Index& index, Faults& faults, Recorder& recorder);
 
   Bag& bag() { return bag_; }
 
