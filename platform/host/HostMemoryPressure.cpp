@@ -119,17 +119,23 @@ class HostMemoryPressure::Listeners : public std::enable_shared_from_this<Listen
   const MemoryPressurePaths& paths() const { return paths_; }
 
   void add(std::shared_ptr<Listener> listener) {
-    const std::lock_guard lock(mutex_);
-    if (listeners_.empty()) startSensors();
-    listeners_.insert(std::move(listener));
+    const std::lock_guard sensing(sensorsMutex_);
+    {
+      const std::lock_guard lock(mutex_);
+      listeners_.insert(std::move(listener));
+    }
+    if (sensors_ == nullptr) startSensors();
   }
 
   void remove(const std::shared_ptr<Listener>& listener) {
     listener->alive = false;
-    std::shared_ptr<Sensors> unused;  // ends unlocked: it waits for a handler that may be calling raise()
-    const std::lock_guard lock(mutex_);
-    listeners_.erase(listener);
-    if (listeners_.empty()) unused = std::move(sensors_);
+    const std::lock_guard sensing(sensorsMutex_);
+    {
+      const std::lock_guard lock(mutex_);
+      listeners_.erase(listener);
+      if (!listeners_.empty()) return;
+    }
+    sensors_ = nullptr;
   }
 
  private:
@@ -152,9 +158,12 @@ class HostMemoryPressure::Listeners : public std::enable_shared_from_this<Listen
   Reactor& reactor_;
   const MemoryPressurePaths paths_;
 
-  std::mutex mutex_;  // guards what follows
-  std::set<std::shared_ptr<Listener>> listeners_;
+  // Apart from the listeners, for ending the sensors waits for the handlers that call raise().
+  std::mutex sensorsMutex_;
   std::shared_ptr<Sensors> sensors_;
+
+  std::mutex mutex_;
+  std::set<std::shared_ptr<Listener>> listeners_;
 };
 
 class HostMemoryPressure::ListeningSource final : public Source {
