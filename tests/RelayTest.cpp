@@ -1,46 +1,464 @@
+#include <fmt/format.h>
 #include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <mutex>
 
 #include "platform/Relay.h"
 #include "platform/host/HostRelay.h"
 #include "platform/host/HostRuntime.h"
+#include "platform/simulated/SimulatedRelay.h"
+#include "platform/simulated/SimulatedRuntime.h"
 
+// What every Relay does, on the host's sockets and threads and on the simulated one.
 namespace sable::platform {
 namespace {
 
-constexpr RelayMethod kMethods[] = {{"Echo", "ay", "ay"}};
-constexpr RelayInterface kInterface{"com.kestrel.Test", "/com/kestrel/test", kMethods};
+constexpr RelayMethod kMethods[] = {
+    {"Echo", "bxtdsayasa{sv}aa{sv}a(ss)a{ss}a{say}ah", "bxtdsayasa{sv}aa{sv}a(ss)a{ss}a{say}ah"},
+    {"Fail", "", ""},
+    {"Drop", "", ""},
+    {"Forget", "", ""},
+    {"CallBack", "s", "s"},
+    {"Note", "ts", ""},
+    {"Keep", "", ""}};
+enum Method : std::size_t { kEcho, kFail, kDrop, kForget, kCallBack, kNote, kKeep };
+constexpr RelayInterface kServer{"com.kestrel.Test", "/com/kestrel/test", kMethods};
 
-TEST(HostRelay, Echo) {
-  std::string folder = ::testing::TempDir() + "relay";
-  host::HostRuntime runtime;
-  host::HostRelayConfiguration c;
-  c.runtimeFolder = folder;
-  host::HostRelay relay(runtime, c);
-  auto listener = relay.namedListener("test");
-  std::shared_ptr<RelayConnection> held;
-  listener->setAcceptHandler([&](std::shared_ptr<RelayConnection> connection) {
-    connection->exportObject(kInterface,
-                             [](RelayCall call) { call.reply(std::get<Data>(call.arguments[0])); });
+constexpr RelayMethod kClientMethods[] = {{"Shout", "s", "s"}};
+constexpr RelayInterface kClient{"com.kestrel.TestClient", "/com/kestrel/client", kClientMethods};
+constexpr RelayMethod kOtherMethods[] = {{"Nothing", "", ""}};
+constexpr RelayMethod kMistakenMethods[] = {{"Note", "t", ""}};
+constexpr RelayInterface kMistaken{"com.kestrel.Test", "/com/kestrel/test", kMistakenMethods};
+constexpr RelayInterface kNowhere{"com.kestrel.Nowhere", "/com/kestrel/test", kOtherMethods};
+
+constexpr Duration kLong = std::chrono::seconds(60);
+
+/// A value as text, to compare and to print.
+std::string show(const RelayValue& value) {
+  struct Show {
+    std::string operator()(std::monostate) { return "nothing"; }
+    std::string operator()(bool v) { return v ? "true" : "false"; }
+    std::string operator()(std::int64_t v) { return fmt::format("{}x", v); }
+    std::string operator()(std::uint64_t v) { return fmt::format("{}t", v); }
+    std::string operator()(double v) { return fmt::format("{}d", v); }
+    std::string operator()(const std::string& v) { return '"' + v + '"'; }
+    std::string operator()(const Data& v) { return v ? "<" + *v + ">" : "null"; }
+    std::string operator()(const RelayStrings& v) {
+      std::string text = "[";
+      for (const auto& item : v) text += (*this)(item);
+      return text + "]";
+    }
+    std::string operator()(const RelayRecord& v) {
+      std::string text = "{";
+      for (const auto& member : v.members()) text += member.name + "=" + show(member.value) + " ";
+      return text + "}";
+    }
+    std::string operator()(const RelayRecords& v) {
+      std::string text = "[";
+      for (const auto& record : v) text += (*this)(record);
+      return text + "]";
+    }
+    std::string operator()(const RelayStringPairs& v) { return pairs(v.pairs); }
+    std::string operator()(const RelayStringMap& v) { return pairs(v.entries); }
+    std::string operator()(const RelayDataMap& v) {
+      std::string text;
+      for (const auto& [name, data] : v.entries) text += name + (*this)(data);
+      return text;
+    }
+    std::string operator()(const RelayFile& v) { return v.descriptor ? "file" : "no file"; }
+    std::string pairs(const std::vector<std::pair<std::string, std::string>>& v) {
+      std::string text;
+      for (const auto& [first, second] : v) text += first + ":" + second + " ";
+      return text;
+    }
+  };
+  return std::visit(Show{}, value);
+}
+
+std::string show(const Expected<RelayArguments>& result) {
+  if (!result) return result.error().reason;
+  std::string text;
+  for (const auto& value : *result) text += show(value) + "; ";
+  return text;
+}
+
+RelayArguments oneOfEach() {
+  RelayRecord inner;
+  inner.add("n", std::int64_t{-1});
+  inner.add("text", std::string("käse"));
+  RelayRecord record;
+  record.add("flag", true);
+  record.add("big", std::uint64_t{0xFFFFFFFFFFFFFFFF});
+  record.add("half", 0.5);
+  record.add("bytes", makeData(std::string("\0\xff", 2)));
+  record.add("inner", inner);
+  record.add("pairs", RelayStringPairs{{{"a", "1"}, {"a", "2"}}});
+  record.add("strings", RelayStrings{"x", ""});
+  return {true,
+          std::int64_t{-5},
+          std::uint64_t{5},
+          1e300,
+          std::string("text"),
+          makeData(std::string(5000, 'd')),
+          RelayStrings{"one", "two"},
+          record,
+          RelayRecords{inner, RelayRecord(), record},
+          RelayStringPairs{{{"q", "1"}, {"q", "2"}}},
+          RelayStringMap{{{"Accept", "*/*"}}},
+          RelayDataMap{{{"image", makeData("png")}}},
+          RelayFile()};
+}
+
+/// A runtime with its Relay.
+class World {
+ public:
+  virtual ~World() = default;
+  virtual Runtime& runtime() = 0;
+  virtual Relay& relay() = 0;
+  virtual Expected<std::shared_ptr<RelayConnection>> connectAsStranger(const RelayEndpoint& endpoint) = 0;
+  virtual void raiseEvent(std::string_view stream, std::optional<std::string> name) = 0;
+};
+
+class HostWorld final : public World {
+ public:
+  HostWorld() : relay_(runtime_, configuration()) {}
+  Runtime& runtime() override { return runtime_; }
+  Relay& relay() override { return relay_; }
+  Expected<std::shared_ptr<RelayConnection>> connectAsStranger(const RelayEndpoint& endpoint) override {
+    admitting_ = false;
+    return relay_.connect(endpoint);
+  }
+  void raiseEvent(std::string_view stream, std::optional<std::string> name) override {
+    relay_.raiseEvent(stream, std::move(name));
+  }
+
+ private:
+  host::HostRelayConfiguration configuration() {
+    host::HostRelayConfiguration made;
+    made.runtimeFolder = fmt::format("{}relay-{}", ::testing::TempDir(), getpid());
+    made.admits = [this](uid_t) { return admitting_.load(); };
+    return made;
+  }
+  std::atomic<bool> admitting_ = true;
+  host::HostRuntime runtime_;
+  host::HostRelay relay_;
+};
+
+class SimulatedWorld final : public World {
+ public:
+  SimulatedWorld() : relay_(runtime_) {}
+  Runtime& runtime() override { return runtime_; }
+  Relay& relay() override { return relay_; }
+  Expected<std::shared_ptr<RelayConnection>> connectAsStranger(const RelayEndpoint& endpoint) override {
+    return relay_.connectAs(endpoint, {.pid = 77, .uid = 77});
+  }
+  void raiseEvent(std::string_view stream, std::optional<std::string> name) override {
+    relay_.raiseEvent(stream, std::move(name));
+  }
+
+ private:
+  simulated::SimulatedRuntime runtime_;
+  simulated::SimulatedRelay relay_;
+};
+
+/// Lines that queues add and the test waits for.
+class Heard {
+ public:
+  explicit Heard(Runtime& runtime) : runtime_(runtime), added_(runtime.semaphore(0)) {}
+  void add(std::string line) {
+    const std::lock_guard lock(mutex_);
+    lines_.push_back(std::move(line));
+    added_->signal();
+  }
+  /// The next `count` lines.
+  std::vector<std::string> next(std::size_t count = 1) {
+    std::vector<std::string> taken;
+    for (; count > 0; --count) {
+      if (!added_->wait(runtime_.ticks() + kLong)) return taken;
+      const std::lock_guard lock(mutex_);
+      taken.push_back(std::move(lines_.front()));
+      lines_.erase(lines_.begin());
+    }
+    return taken;
+  }
+  bool silent() {
+    const std::lock_guard lock(mutex_);
+    return lines_.empty();
+  }
+
+ private:
+  Runtime& runtime_;
+  const std::unique_ptr<Semaphore> added_;
+  std::mutex mutex_;
+  std::vector<std::string> lines_;
+};
+
+using Lines = std::vector<std::string>;
+
+class RelayContract : public ::testing::TestWithParam<std::string> {
+ protected:
+  RelayContract() {
+    listener_ = relay().namedListener("test");
+    listener_->setAcceptHandler([this](std::shared_ptr<RelayConnection> connection) {
+      serve(connection);
+      const std::lock_guard lock(mutex_);
+      served_.push_back(std::move(connection));
+      return true;
+    });
+    EXPECT_TRUE(listener_->resume());
+  }
+  ~RelayContract() override {
+    listener_.reset();
+    kept_.clear();
+    const std::lock_guard lock(mutex_);
+    served_.clear();
+  }
+
+  Runtime& runtime() { return world_->runtime(); }
+  Relay& relay() { return world_->relay(); }
+
+  void serve(const std::shared_ptr<RelayConnection>& connection) {
+    connection->exportObject(kServer, [this, weak = std::weak_ptr(connection)](RelayCall call) {
+      handle(std::move(call), weak.lock());
+    });
+    connection->setInvalidationHandler([this] { server_.add("ended"); });
     connection->resume();
-    held = connection;
+  }
+
+  void handle(RelayCall call, const std::shared_ptr<RelayConnection>& connection) {
+    switch (call.method) {
+      case kEcho:
+        return call.reply.send(std::move(call.arguments));
+      case kFail:
+        return call.reply.fail("com.kestrel.Error.Test", "as asked");
+      case kDrop:
+        return;
+      case kForget:
+        return call.reply.forget();
+      case kNote:
+        return server_.add(show(call.arguments[0]));
+      case kKeep: {
+        const std::lock_guard lock(mutex_);
+        kept_.push_back(std::move(call.reply));
+        return server_.add("kept");
+      }
+      default:
+        break;
+    }
+    connection->call(kClient, 0, {std::get<std::string>(call.arguments[0])}, kLong,
+                     [reply = std::move(call.reply)](Expected<RelayArguments> result) mutable {
+                       reply(std::get<std::string>(result->at(0)) + "?");
+                     });
+  }
+
+  std::shared_ptr<RelayConnection> connect() {
+    auto connection = relay().connect(listener_->endpoint());
+    EXPECT_TRUE(connection);
+    (*connection)->exportObject(kClient, [](RelayCall call) {
+      call.reply(std::get<std::string>(call.arguments[0]) + "!");
+    });
+    (*connection)->setInvalidationHandler([this] { client_.add("ended"); });
+    (*connection)->resume();
+    return *connection;
+  }
+
+  void call(RelayConnection& connection, std::size_t method, RelayArguments arguments = {},
+            const RelayInterface& interface = kServer, Duration timeout = kLong) {
+    connection.call(interface, method, std::move(arguments), timeout,
+                    [this](Expected<RelayArguments> result) { client_.add(show(result)); });
+  }
+
+  const std::unique_ptr<World> world_ = GetParam() == "host" ? std::unique_ptr<World>(new HostWorld)
+                                                             : std::unique_ptr<World>(new SimulatedWorld);
+  Heard client_{runtime()};
+  Heard server_{runtime()};
+  std::mutex mutex_;
+  std::vector<std::shared_ptr<RelayConnection>> served_;
+  std::vector<RelayReply> kept_;
+  std::unique_ptr<RelayListener> listener_;
+};
+
+INSTANTIATE_TEST_SUITE_P(Worlds, RelayContract, ::testing::Values("host", "simulated"),
+                         [](const auto& world) { return world.param; });
+
+TEST_P(RelayContract, EveryTypeOfValueArrivesAsItWasSent) {
+  const auto connection = connect();
+  call(*connection, kEcho, oneOfEach());
+  EXPECT_EQ(client_.next(), Lines{show(oneOfEach())});
+}
+
+TEST_P(RelayContract, AFileArrivesOpenAndAbsentMembersDoNotArrive) {
+  int ends[2];
+  ASSERT_EQ(pipe(ends), 0);
+  RelayArguments arguments = oneOfEach();
+  arguments[12] = RelayFile{std::make_shared<const int>(ends[1])};
+  RelayRecord record;
+  record.add("none", RelayValue());
+  record.add("null", Data());
+  record.add("empty", makeData(""));
+  arguments[7] = record;
+  const auto connection = connect();
+  connection->call(kServer, kEcho, std::move(arguments), kLong, [&](Expected<RelayArguments> result) {
+    const auto& file = std::get<RelayFile>(result->at(12));
+    EXPECT_EQ(write(*file.descriptor, "x", 1), 1);
+    client_.add(show(result->at(7)));
+  });
+  EXPECT_EQ(client_.next(), Lines{"{empty=<> }"});
+  char byte = 0;
+  EXPECT_EQ(read(ends[0], &byte, 1), 1);
+  close(ends[0]);
+  close(ends[1]);
+}
+
+TEST_P(RelayContract, ACallThatGoesWrongIsAnsweredWithTheReason) {
+  const auto connection = connect();
+  call(*connection, kFail);
+  EXPECT_EQ(client_.next(), Lines{"com.kestrel.Error.Test as asked"});
+  call(*connection, kDrop);
+  EXPECT_EQ(client_.next(), Lines{"org.freedesktop.DBus.Error.NoReply The call was dropped unanswered"});
+  call(*connection, 0, {}, kNowhere);
+  EXPECT_EQ(client_.next()[0].substr(0, 34), "org.freedesktop.DBus.Error.Unknown");
+  call(*connection, 0, {std::uint64_t{1}}, kMistaken);
+  EXPECT_EQ(client_.next(), Lines{"org.freedesktop.DBus.Error.InvalidArgs Note takes \"ts\", not \"t\""});
+}
+
+TEST_P(RelayContract, AForgottenCallIsNeverAnswered) {
+  const auto connection = connect();
+  call(*connection, kForget);
+  call(*connection, kFail);
+  EXPECT_EQ(client_.next(), Lines{"com.kestrel.Error.Test as asked"});
+  call(*connection, kForget, {}, kServer, std::chrono::milliseconds(1));
+  EXPECT_EQ(client_.next(), Lines{"No answer came in time"});
+  EXPECT_TRUE(client_.silent());
+}
+
+TEST_P(RelayContract, EitherSideCallsTheOtherDuringACall) {
+  const auto connection = connect();
+  call(*connection, kCallBack, {std::string("hello")});
+  EXPECT_EQ(client_.next(), Lines{"\"hello!?\"; "});
+}
+
+TEST_P(RelayContract, OneWayCallsArriveInOrderHoweverMany) {
+  const auto connection = connect();
+  Lines sent;
+  for (std::uint64_t i = 0; i < 2000; ++i) {
+    connection->send(kServer, kNote, {i, std::string(1000, 'n')});
+    sent.push_back(show(RelayValue(i)));
+  }
+  EXPECT_EQ(server_.next(2000), sent);
+}
+
+TEST_P(RelayContract, AnEndedConnectionIsHeardOfOnceAfterItsPendingCalls) {
+  const auto connection = connect();
+  call(*connection, kKeep);
+  call(*connection, kKeep);
+  EXPECT_EQ(server_.next(2), (Lines{"kept", "kept"}));
+  connection->invalidate();
+  connection->invalidate();
+  EXPECT_EQ(client_.next(3), (Lines{"The connection has ended", "The connection has ended", "ended"}));
+  EXPECT_EQ(server_.next(), Lines{"ended"});
+  call(*connection, kFail);
+  EXPECT_EQ(client_.next(), Lines{"The connection has ended"});
+  EXPECT_TRUE(server_.silent());
+}
+
+TEST_P(RelayContract, APeerThatIsDroppedIsHeardOfAndReleased) {
+  auto connection = connect();
+  call(*connection, kKeep);
+  EXPECT_EQ(server_.next(), Lines{"kept"});
+  const std::weak_ptr<RelayConnection> client = connection;
+  connection.reset();
+  EXPECT_EQ(client_.next(2), (Lines{"The connection has ended", "ended"}));
+  EXPECT_EQ(server_.next(), Lines{"ended"});
+  EXPECT_TRUE(client.expired());
+  std::weak_ptr<RelayConnection> server;
+  std::shared_ptr<SerialQueue> queue;
+  {
+    const std::lock_guard lock(mutex_);
+    server = served_.front();
+    served_.clear();
+    kept_.clear();
+  }
+  EXPECT_TRUE(server.expired());
+}
+
+TEST_P(RelayContract, AConnectionMayEndWithinItsOwnCall) {
+  const auto connection = connect();
+  connection->call(kServer, kFail, {}, kLong, [&](Expected<RelayArguments>) {
+    connection->invalidate();
+    client_.add("answered");
+  });
+  EXPECT_EQ(client_.next(2), (Lines{"answered", "ended"}));
+}
+
+TEST_P(RelayContract, AnAnonymousListenerIsFoundByItsEndpointOnly) {
+  auto listener = relay().anonymousListener();
+  listener->setAcceptHandler([this](std::shared_ptr<RelayConnection> connection) {
+    serve(connection);
+    const std::lock_guard lock(mutex_);
+    served_.push_back(std::move(connection));
     return true;
   });
-  auto ok = listener->resume();
-  ASSERT_TRUE(ok) << ok.error().description();
-  auto client = relay.connect(listener->endpoint());
-  ASSERT_TRUE(client);
-  (*client)->resume();
-  auto s = runtime.semaphore(0);
-  std::string got;
-  for (int i = 0; i < 1000; ++i) {
-    (*client)->call(kInterface, 0, {makeData("hello")}, std::chrono::seconds(5),
-                    [&](Expected<RelayArguments> r) {
-                      got = r ? *std::get<Data>(r->at(0)) : r.error().description();
-                      s->signal();
-                    });
-    ASSERT_TRUE(s->wait(runtime.ticks() + std::chrono::seconds(6)));
-    ASSERT_EQ(got, "hello");
+  ASSERT_TRUE(listener->resume());
+  EXPECT_NE(listener->endpoint(), listener_->endpoint());
+  const auto endpoint = listener->endpoint();
+  const auto connection = relay().connect(endpoint);
+  ASSERT_TRUE(connection);
+  (*connection)->resume();
+  call(**connection, kFail);
+  EXPECT_EQ(client_.next(), Lines{"com.kestrel.Error.Test as asked"});
+  listener.reset();
+  EXPECT_FALSE(relay().connect(endpoint));
+}
+
+TEST_P(RelayContract, ARefusedConnectionEnds) {
+  auto listener = relay().anonymousListener();
+  listener->setAcceptHandler([](const std::shared_ptr<RelayConnection>&) { return false; });
+  ASSERT_TRUE(listener->resume());
+  const auto connection = relay().connect(listener->endpoint());
+  ASSERT_TRUE(connection);
+  (*connection)->setInvalidationHandler([this] { client_.add("ended"); });
+  (*connection)->resume();
+  EXPECT_EQ(client_.next(), Lines{"ended"});
+}
+
+TEST_P(RelayContract, AStrangerIsRefusedBeforeAnybodyHearsOfHim) {
+  const auto connection = world_->connectAsStranger(listener_->endpoint());
+  ASSERT_TRUE(connection);
+  (*connection)->setInvalidationHandler([this] { client_.add("ended"); });
+  (*connection)->resume();
+  call(**connection, kFail);
+  EXPECT_EQ(client_.next(2), (Lines{"The connection has ended", "ended"}));
+  const std::lock_guard lock(mutex_);
+  EXPECT_TRUE(served_.empty());
+}
+
+TEST_P(RelayContract, ASecondNamedListenerIsToldThatThereIsOne) {
+  const auto second = relay().namedListener("test");
+  const auto resumed = second->resume();
+  ASSERT_FALSE(resumed);
+  EXPECT_EQ(resumed.error().reason.substr(0, 21), "another daemon holds ");
+}
+
+TEST_P(RelayContract, EventsReachTheirStreamsHandlerThoughItCameLater) {
+  world_->raiseEvent("one", "early");
+  relay().setEventStreamHandler(
+      "one", runtime().serialQueue("events"),
+      [this](std::optional<std::string> name) { server_.add(name.value_or("unnamed")); });
+  world_->raiseEvent("two", "other");
+  world_->raiseEvent("one", std::nullopt);
+  EXPECT_EQ(server_.next(2), (Lines{"early", "unnamed"}));
+}
+
+TEST_P(RelayContract, ManyClientsAreServedSideBySide) {
+  std::vector<std::shared_ptr<RelayConnection>> connections;
+  for (int i = 0; i < 64; ++i) connections.push_back(connect());
+  for (int round = 0; round < 20; ++round) {
+    for (const auto& connection : connections) call(*connection, kFail);
   }
+  EXPECT_EQ(client_.next(64 * 20), Lines(64 * 20, "com.kestrel.Error.Test as asked"));
 }
 
 }  // namespace
