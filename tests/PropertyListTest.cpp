@@ -72,25 +72,21 @@ TEST(PropertyListTest, WhatHasNoCounterpartIsLeftOutRoundedOrRefused) {
 }
 
 TEST(PropertyListTest, ReadsWhatOtherWritersWrite) {
-  const std::string five = std::string("\x10\x05");
-  EXPECT_EQ(*decodePropertyList(propertyList({"\x14" + bigEndian(0, 8) + bigEndian(~0ull, 8)})),
-            json("18446744073709551615"));
-  EXPECT_EQ(*decodePropertyList(propertyList({"\x13" + bigEndian(~0ull, 8)})), json("-1"));
-  EXPECT_EQ(*decodePropertyList(propertyList({"\x33" + bigEndian(0x4000000000000000, 8)})),
-            json("978307202.0"));
-  EXPECT_EQ(*decodePropertyList(propertyList({"\x22" + bigEndian(0x3FC00000, 4)})), json("1.5"));
-  EXPECT_EQ(*decodePropertyList(propertyList({"\x41"
-                                              "a"})),
-            json(R"("YQ==")"));
-  EXPECT_EQ(*decodePropertyList(propertyList({"\x42"
-                                              "ab"})),
-            json(R"("YWI=")"));
-  EXPECT_EQ(*decodePropertyList(propertyList({"\x44"
-                                              "abcd"})),
-            json(R"("YWJjZA==")"));
-  EXPECT_EQ(*decodePropertyList(propertyList({std::string("\x80\x07", 2)})), json("7"));
-  EXPECT_EQ(*decodePropertyList(propertyList({"\xA2" + reference(1) + reference(1), five})), json("[5,5]"));
-  EXPECT_EQ(*decodePropertyList(propertyList({"\x6F\x10\x02\xD8\x3D\xDE\x00"})), json(R"("😀")"));
+  const auto decoded = [](const std::vector<std::string>& objects) {
+    const auto value = decodePropertyList(propertyList(objects));
+    return value ? compactJSON(*value) : value.error().description();
+  };
+  EXPECT_EQ(decoded({"\x14" + bigEndian(0, 8) + bigEndian(~0ull, 8)}), "18446744073709551615");
+  EXPECT_EQ(decoded({"\x13" + bigEndian(~0ull, 8)}), "-1");
+  EXPECT_EQ(decoded({"\x10\xFF"}), "255");
+  EXPECT_EQ(decoded({"\x33" + bigEndian(0x4000000000000000, 8)}), "978307202.0");
+  EXPECT_EQ(decoded({"\x22" + bigEndian(0x3FC00000, 4)}), "1.5");
+  EXPECT_EQ(decoded({std::string("\x41") + "a"}), R"("YQ==")");
+  EXPECT_EQ(decoded({std::string("\x42") + "ab"}), R"("YWI=")");
+  EXPECT_EQ(decoded({std::string("\x44") + "abcd"}), R"("YWJjZA==")");
+  EXPECT_EQ(decoded({"\x80\x07"}), "7");
+  EXPECT_EQ(decoded({"\xA2" + reference(1) + reference(1), "\x10\x05"}), "[5,5]");
+  EXPECT_EQ(decoded({std::string("\x6F\x10\x02\xD8\x3D\xDE\x00", 7)}), R"("😀")");
 }
 
 TEST(PropertyListTest, HostileFilesAreRefused) {
@@ -111,8 +107,8 @@ TEST(PropertyListTest, HostileFilesAreRefused) {
       propertyList({"\xD2" + reference(1) + reference(1) + reference(1) + reference(1), "\x51k"}),
       propertyList({"\x5F\x13\xFF\xFF\xFF\xFF\xFF\xFF\xFF\xFF"}),
       propertyList({"\xAF\x13\xFF\xFF\xFF\xFF\xFF\xFF\xFF\xFF"}),
-      propertyList({"\x61\xD8\x00"}),
-      propertyList({"\x61\xDC\x00"}),
+      propertyList({std::string("\x61\xD8\x00", 3)}),
+      propertyList({std::string("\x61\xDC\x00", 3)}),
       propertyList({"\x51\xE9"}),
       propertyList({"\x17"}),
       propertyList({"\x14" + bigEndian(1, 8) + bigEndian(0, 8)}),
