@@ -60,7 +60,7 @@ from jeepney import DBusAddress, new_method_call
 from jeepney.io.blocking import open_dbus_connection
 
 connection = open_dbus_connection(sys.argv[1])
-daemon = DBusAddress('/com/kestrel/sabled', interface='com.kestrel.SBLDaemonRelay')
+daemon = DBusAddress('/com/kestrel/sabled', bus_name='com.kestrel.sabled', interface='com.kestrel.SBLDaemonRelay')
 configuration = {'identifier': ('s', 'python'), 'userAgent': ('s', 'python/1')}
 endpoint, = connection.send_and_get_reply(new_method_call(daemon, 'Configure', 'a{sv}', (configuration,))).body
 assert endpoint.startswith('unix:path='), endpoint
