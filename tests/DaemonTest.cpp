@@ -1,0 +1,337 @@
+#include <gtest/gtest.h>
+
+#include "SableKit/SBLBag.h"
+#include "SableKit/SBLRelayInterfaces.h"
+#include "platform/PropertyList.h"
+#include "sabled/ClientState.h"
+#include "sabled/ClientStateManager.h"
+#include "sabled/SableBagController.h"
+#include "sabled/SableService.h"
+#include "tests/support/VirtualDevice.h"
+
+// The whole daemon on the virtual device: what clients and the service see, in virtual time.
+namespace sable::test {
+namespace {
+
+using platform::HTTPErrorCode;
+using platform::HTTPRequest;
+using platform::simulated::Scripted;
+
+SBLSearchRequest searchFor(std::string text, std::uint64_t queryId) {
+  SBLSearchRequest request;
+  request.queryId = queryId;
+  request.queryString = std::move(text);
+  return request;
+}
+
+class Daemon : public testing::Test {
+ protected:
+  VirtualDevice device;
+};
+
+// Connections
+
+TEST_F(Daemon, AClientIsConfiguredAndGetsTheBag) {
+  device.start();
+  TestClient& client = device.client("com.kestrel.beacon", "Beacon/1");
+  ASSERT_TRUE(client.endpoint());
+  ASSERT_EQ(client.bags().size(), 1u);
+  EXPECT_EQ(client.bags()[0].raw["version"], "1");
+  EXPECT_EQ(client.bags()[0].userAgent, "Sabled/1.0 (SableBook1,1; Sable OS 1A1) Beacon/1");
+  EXPECT_FALSE(client.bags()[0].error);
+
+  device.bag["version"] = "2";
+  device.assembly().bagController->forceFetchBag({{"bag", 2}});
+  device.advance(1s);
+  ASSERT_EQ(client.bags().size(), 2u) << "a new bag is pushed to whoever is there";
+  EXPECT_EQ(client.bags()[1].raw["version"], "2");
+}
+
+TEST_F(Daemon, AFailedConfigurationClosesTheConnectionWithoutAnAnswer) {
+  device.start();
+  for (const auto& [identifier, agent] : {std::pair{"com.kestrel.beacon", ""}, std::pair{"", "Beacon/1"}}) {
+    TestClient& client = device.client(identifier, agent);
+    EXPECT_FALSE(client.endpoint());
+    EXPECT_FALSE(client.isConnected());
+  }
+  EXPECT_EQ(device.log.count("invalid configuration, closing connection"), 2u);
+  EXPECT_EQ(device.log.count("configuration requires identifier and agent"), 1u);
+  EXPECT_TRUE(device.daemon().service().getClientConnections().empty());
+}
+
+TEST_F(Daemon, AnAgentThatIsAlreadyComposedIsNotComposedAgain) {
+  device.start();
+  TestClient& client = device.client("com.kestrel.rover", "Sabled/1.0 (X; Y 1) Rover/2");
+  EXPECT_EQ(client.bags().at(0).userAgent, "Sabled/1.0 (X; Y 1) Rover/2");
+}
+
+TEST_F(Daemon, ASilentConnectionIsClosedAfterSixtySecondsAndACallPostponesThat) {
+  device.start();
+  TestClient& silent = device.connect();
+  TestClient& busy = device.client();
+  device.advance(59s);
+  EXPECT_TRUE(silent.isConnected());
+  busy.search("wea");
+  device.advance(2s);
+  EXPECT_FALSE(silent.isConnected());
+  device.advance(57s);
+  EXPECT_TRUE(busy.isConnected());
+  device.advance(2s);
+  EXPECT_FALSE(busy.isConnected());
+  EXPECT_EQ(device.log.count("timing out idle relay connection"), 2u);
+}
+
+TEST_F(Daemon, SeveralConnectionsOfOneProcessAreToldOfAndKept) {
+  device.start();
+  TestClient& first = device.client();
+  TestClient& second = device.client();
+  EXPECT_TRUE(device.log.contains("too many connections 2 from pid 100"));
+  EXPECT_EQ(device.log.count("new connection from beacon (100)"), 2u);
+  EXPECT_FALSE(first.search("wea").data().empty());
+  EXPECT_FALSE(second.search("wea").data().empty());
+  EXPECT_EQ(device.counter("clientconnection"), 2);
+  first.disconnect();
+  device.run();
+  EXPECT_EQ(device.service.memoryPurges(), 0);
+  second.disconnect();
+  device.run();
+  EXPECT_EQ(device.service.memoryPurges(), 1) << "when the last connection is gone";
+  EXPECT_EQ(device.counter("beacon.realyinvalidation"), 2);
+  EXPECT_EQ(device.platform.transactions().openCount(), 0u) << "the daemon may be stopped";
+}
+
+TEST_F(Daemon, ConnectionsWithOneIdentifierShareAState) {
+  device.platform.userDefaults().setByUser("SBLPersistSessions", true);
+  device.start();
+  device.client("com.kestrel.rover", "Rover/1");
+  device.client("com.kestrel.rover", "Rover/1");
+  device.client("com.kestrel.news", "News/1");
+  const auto sessions = device.assembly().clientStateManager->sessions();
+  ASSERT_EQ(sessions.size(), 2u);
+  EXPECT_EQ(sessions[0].identifier, "com.kestrel.news");
+  const auto saved = device.platform.userDefaults().array("sessions");
+  ASSERT_TRUE(saved);
+  EXPECT_EQ(saved->size(), 2u);
+  EXPECT_EQ((*saved)[1]["agent"], "Sabled/1.0 (SableBook1,1; Sable OS 1A1) Rover/1");
+}
+
+TEST_F(Daemon, TheEleventhEndpointConnectionIsRefusedUntilAPlaceIsFree) {
+  device.start();
+  const auto endpoint = *device.client().endpoint();
+  std::vector<std::shared_ptr<platform::RelayConnection>> open;
+  const auto invalidated = std::make_shared<int>(0);
+  const auto connect = [&] {
+    auto connection = *device.platform.relay().connectAs(endpoint, {100, 1000});
+    connection->setInvalidationHandler([invalidated] { ++*invalidated; });
+    connection->resume();
+    open.push_back(std::move(connection));
+    device.advance(150ms);
+  };
+  for (int i = 0; i < 11; ++i) connect();
+  EXPECT_EQ(*invalidated, 1);
+  EXPECT_EQ(device.log.count("endpoint semaphore timeout"), 1u);
+  open.front()->invalidate();
+  device.run();
+  connect();
+  EXPECT_EQ(device.log.count("endpoint semaphore timeout"), 1u);
+}
+
+// The road of a query
+
+TEST_F(Daemon, ASearchIsAnsweredWithTheServicesBytes) {
+  device.platform.mapsService().sessions = {{"id-1", "entity-1"}};
+  device.start();
+  SBLSearchRequest request = searchFor("wea", 1);
+  request.scale = 3;
+  request.verboseReply = true;
+  const Answer answer = device.client().ask(request);
+  EXPECT_EQ(answer.queryId, 1u);
+  ASSERT_TRUE(answer.reply);
+  EXPECT_FALSE(answer.error);
+  EXPECT_EQ(answer.data(), R"([{"query":"weather","completion_score":0.5,"status":"OK"}])");
+  EXPECT_EQ(answer.reply->scale, 3);
+  EXPECT_EQ(answer.reply->geoSessionEntityString, "entity-1");
+  EXPECT_EQ(answer.reply->httpResponse->status, 200);
+  EXPECT_NE(answer.reply->httpRequest->url.find("q=wea"), std::string::npos);
+  EXPECT_EQ(*answer.reply->httpRequest->headers.find("X-Kestrel-UI-Scale"), "3.0");
+  EXPECT_EQ(device.counter("searches"), 1);
+  EXPECT_EQ(device.counter("beacon.keystrokes"), 1);
+  EXPECT_EQ(device.counter("beacon.fedapicall.serverstatus.200"), 1);
+}
+
+TEST_F(Daemon, TheGatesAnswerWithNothing) {
+  device.bag["minimum_query_length"] = 3;
+  device.bag["agents"] = {{"rover", {{"enabled", false}}}};
+  device.start();
+  TestClient& beacon = device.client();
+  for (const char* tooShort : {"", "we", "🦋"}) {
+    const Answer answer = beacon.search(tooShort);
+    EXPECT_FALSE(answer.reply || answer.error) << tooShort;
+  }
+  EXPECT_TRUE(beacon.search("wea").reply);
+  EXPECT_TRUE(beacon.search("🦋a").reply) << "two UTF-16 code units and one";
+  EXPECT_TRUE(device.log.contains("query[2] input 'we' less than 3"));
+
+  TestClient& rover = device.client("com.kestrel.rover", "Rover/1");
+  EXPECT_FALSE(rover.search("weather").reply);
+  EXPECT_FALSE(rover.ask(SBLZeroKeywordRequest{}).error);
+  EXPECT_FALSE(rover.ask(SBLLookupRequest{}).reply);
+  EXPECT_EQ(device.log.count("no search, bag disabled"), 1u);
+  EXPECT_EQ(device.log.count("no zkw, bag disabled"), 1u);
+  EXPECT_EQ(device.log.count("no lookup, bag disabled"), 1u);
+  EXPECT_EQ(device.sent("/search"), 2u);
+}
+
+TEST_F(Daemon, WithoutABagAQueryWaitsASecondThenFails) {
+  device.service.on("/bag", answering("not found", 404));
+  device.start();
+  TestClient& client = device.client();
+  device.advance(2s);
+  const auto start = device.platform.runtime().ticks();
+  const Answer answer = client.search("wea");
+  EXPECT_EQ(device.platform.runtime().ticks() - start, 1s);
+  EXPECT_EQ(answer.error, (Error{"SBLErrorDomain", 1, "timeout"}));
+  EXPECT_TRUE(device.log.contains("Bag fetch failed, can't complete non-cached query wea."));
+  ASSERT_FALSE(client.bags().empty());
+  EXPECT_EQ(client.bags()[0].error, (Error{"SBLErrorDomain", 1, "timeout"}));
+}
+
+TEST_F(Daemon, ABagThatArrivesWithinTheSecondServesEveryWaitingQuery) {
+  Scripted late = answering(device.bag.dump());
+  late.latency = 700ms;
+  device.service.on("/bag", late);
+  device.start();
+  std::vector<PendingAnswer> answers;
+  for (int i = 0; i < 4; ++i) {
+    TestClient& client = device.connect(100 + i);
+    client.configure("com.kestrel.client" + std::to_string(i), "Client/1");
+    answers.push_back(client.send(searchFor("wea", 1)));
+  }
+  for (const auto& answer : answers) {
+    device.await(answer);
+    EXPECT_TRUE((*answer)->reply);
+  }
+}
+
+TEST_F(Daemon, OnlyTheNewestSearchIsAnsweredWithResults) {
+  device.start();
+  TestClient& client = device.client();
+  const PendingAnswer first = client.send(searchFor("w", 1));
+  const PendingAnswer second = client.send(searchFor("we", 5));
+  const PendingAnswer stale = client.send(searchFor("wea", 4));
+  const PendingAnswer repeated = client.send(searchFor("weat", 5));
+  for (const auto& answer : {first, second, stale, repeated}) device.await(answer);
+  EXPECT_FALSE((*first)->reply || (*first)->error) << "superseded while the service was busy";
+  EXPECT_TRUE((*second)->reply);
+  EXPECT_FALSE((*stale)->reply || (*stale)->error);
+  EXPECT_FALSE((*repeated)->reply || (*repeated)->error);
+  EXPECT_EQ(device.sent("/search"), 2u) << "stale searches do not reach the service";
+}
+
+TEST_F(Daemon, WhateverTheServiceSaysReachesTheClient) {
+  device.start();
+  TestClient& client = device.client();
+  device.service.on("/search", answering("<html>no</html>", 503));
+  const Answer html = client.search("wea");
+  EXPECT_EQ(html.data(), "<html>no</html>");
+  ASSERT_TRUE(html.error);
+  EXPECT_EQ(html.error->domain, "JSONErrorDomain");
+  EXPECT_EQ(device.counter("beacon.fedapicall.serverstatus.503"), 1);
+
+  device.service.on("/search", answering("[]", 418));
+  EXPECT_FALSE(client.search("weat").error);
+
+  device.service.failNext(1, HTTPErrorCode::connectionLost);
+  const Answer broken = client.search("weath");
+  EXPECT_FALSE(broken.reply);
+  ASSERT_TRUE(broken.error);
+  EXPECT_EQ(broken.error->domain, platform::kHTTPErrorDomain);
+  EXPECT_EQ(device.sent("/search"), 3u) << "a search is sent once";
+}
+
+TEST_F(Daemon, LookupsAreTriedAgainUntilTheirPageNoLongerWaits) {
+  device.start();
+  TestClient& client = device.client();
+  device.service.failNext(2, HTTPErrorCode::cannotConnect);
+  EXPECT_TRUE(client.ask(SBLLookupRequest{}).reply);
+  EXPECT_EQ(device.sent("/search"), 3u);
+
+  Scripted slow;
+  slow.error = HTTPErrorCode::timedOut;
+  slow.latency = 3s;
+  device.service.on("/search", slow);
+  EXPECT_TRUE(client.ask(SBLLookupRequest{}).error);
+  EXPECT_EQ(device.sent("/search"), 4u) << "after the deadline nothing is sent again";
+}
+
+TEST_F(Daemon, MoreResultsAndCardsAreServedOnTheEndpointAndNothingElseIs) {
+  device.start();
+  TestClient& client = device.client();
+  device.service.on("/card", answering("no object"));
+  SBLMoreResultsRequest more;
+  more.moreResultsURL = "https://service.test/more?page=2";
+  EXPECT_EQ(client.ask(more).data(), "{}");
+  SBLCardRequest card;
+  card.cardURL = "https://service.test/card?id=1";
+  EXPECT_EQ(client.ask(card).data(), "no object");
+  EXPECT_TRUE(device.log.contains("Failed to deserialize card details for into a dictionary. Error: "));
+  card.cardURL = "file:///etc/passwd";
+  EXPECT_TRUE(client.ask(card).error);
+  EXPECT_TRUE(device.log.contains("Card fetch failed with HTTP status code 0 error "));
+
+  for (const SBLAnyRequest& flight :
+       {SBLAnyRequest(SBLFlightSearchRequest{}), SBLAnyRequest(SBLFlightLookupRequest{})}) {
+    const Answer answer = client.ask(flight);
+    EXPECT_FALSE(answer.reply || answer.error);
+  }
+  const PendingAnswer unknown = std::make_shared<std::optional<Answer>>();
+  client.connection().call(kSBLDaemonRelay, SBLDaemonRelay::request,
+                           {std::string("SBLNoRequest"), platform::RelayRecord()}, 20s,
+                           [unknown](auto) { unknown->emplace(); });
+  device.advance(10s);
+  EXPECT_FALSE(unknown->has_value()) << "a record of another class never gets an answer";
+}
+
+TEST_F(Daemon, AMessagesClientNeverGoesThroughThePrivacyProxy) {
+  device.bag["bramble"] = {{"proxy", "http://proxy.test:8080"}, {"enabled", true}};
+  device.start();
+  device.client("com.kestrel.messages", "Messages/1").search("wea");
+  EXPECT_EQ(device.service.requests("/search").back().proxyURL, "");
+  EXPECT_FALSE(device.service.requests("/search").back().request.proxied);
+  device.client("com.kestrel.beacon", "Beacon/1").search("wea");
+  EXPECT_EQ(device.service.requests("/search").back().proxyURL, "http://proxy.test:8080");
+  device.client("com.kestrel.beacon", "Beacon/1").ask(SBLZeroKeywordRequest{});
+  EXPECT_EQ(device.service.requests("/search").back().proxyURL, "")
+      << "zero keyword says nothing worth hiding";
+  device.platform.userDefaults().setByUser("SBLUseBramble", false);
+  device.client("com.kestrel.vox", "Vox/1").search("wea");
+  EXPECT_EQ(device.service.requests("/search").back().proxyURL, "");
+}
+
+TEST_F(Daemon, AConnectionIsWarmedAtMostOnceInThirtySeconds) {
+  device.start();
+  const auto state = device.assembly().clientStateManager->stateForClientIdentifier("com.kestrel.beacon");
+  state->warm();
+  state->warm();
+  device.advance(29s);
+  state->warm();
+  EXPECT_EQ(device.sent("/warm"), 1u);
+  device.advance(2s);
+  state->warm();
+  EXPECT_EQ(device.sent("/warm"), 2u);
+}
+
+TEST_F(Daemon, AnswersVouchForTheHostsOfTheirImages) {
+  device.bag["image_urls"] = {{"logo", "https://bag.test/logo.png"}};
+  device.start();
+  device.service.on("/search",
+                    answering(R"([{"query": "q", "results": [{"image": {"url": "https://a.test/1"}},
+      {"images": [{"id": "logo"}, {"url": "nonsense"}]}]}])"));
+  device.client().search("wea");
+  device.run();
+  EXPECT_EQ(device.assembly().clientStateManager->validImageHosts(),
+            (std::set<std::string>{"a.test", "bag.test"}));
+}
+
+}  // namespace
+}  // namespace sable::test
