@@ -4,27 +4,13 @@
 
 #include "SableKit/SBLRelayCoding.h"
 #include "SableKit/SBLRelayInterfaces.h"
+#include "platform/RelaySupport.h"
 
 namespace sable {
 
 using platform::RelayArguments;
 using platform::RelayConnection;
 using platform::RelayRecord;
-
-namespace {
-
-Error disconnectedError() {
-  return {std::string(platform::kRelayErrorDomain),
-          static_cast<std::int64_t>(platform::RelayErrorCode::disconnected), "not connected to the daemon"};
-}
-
-Error badReplyError() {
-  return {std::string(platform::kRelayErrorDomain),
-          static_cast<std::int64_t>(platform::RelayErrorCode::badReply),
-          "the daemon's reply has another form"};
-}
-
-}  // namespace
 
 std::shared_ptr<SBLClient> SBLClient::create(platform::Runtime& runtime, platform::Relay& relay,
                                              platform::RelayEndpoint daemon,
@@ -37,7 +23,8 @@ SBLClient::SBLClient(Key, platform::Runtime& runtime, platform::Relay& relay, pl
     : relay_(relay),
       daemon_(std::move(daemon)),
       configuration_(std::move(configuration)),
-      queue_(runtime.serialQueue("com.kestrel.sable.client")) {}
+      queue_(runtime.serialQueue("com.kestrel.sable.client")),
+      callbackQueue_(runtime.serialQueue("com.kestrel.sable.client.callbacks")) {}
 
 void SBLClient::setBagHandler(BagHandler handler) {
   queue_->sync([&] { bagHandler_ = std::move(handler); });
@@ -52,47 +39,61 @@ Expected<std::shared_ptr<RelayConnection>> SBLClient::ensureConnection() {
   endpoint_.reset();
 
   const std::weak_ptr<SBLClient> weak = weak_from_this();
+  const std::weak_ptr<RelayConnection> connection = connection_;
   connection_->exportObject(kSBLClientRelay, [weak](platform::RelayCall call) {
     if (const auto self = weak.lock()) self->handleCall(std::move(call));
   });
-  connection_->setInvalidationHandler([weak, connection = connection_.get()] {
+  connection_->setInvalidationHandler([weak, connection] {
     if (const auto self = weak.lock()) self->connectionLost(connection);
   });
   connection_->resume();
   // Calls are delivered in order, so whatever follows finds the connection configured.
   connection_->call(kSBLDaemonRelay, SBLDaemonRelay::configure, {encodeConfiguration(configuration_)},
-                    timeout_, [weak](Expected<RelayArguments> result) {
-                      if (const auto self = weak.lock()) self->configured(std::move(result));
+                    timeout_, [weak, connection](Expected<RelayArguments> result) {
+                      if (const auto self = weak.lock()) self->configured(connection, std::move(result));
                     });
   return connection_;
 }
 
-void SBLClient::configured(Expected<RelayArguments> result) {
-  queue_->async([self = shared_from_this(), result = std::move(result)] {
-    self->endpoint_ = result.map([](const RelayArguments& arguments) {
-      const auto* address = arguments.empty() ? nullptr : std::get_if<std::string>(&arguments[0]);
-      return address == nullptr ? platform::RelayEndpoint() : *address;
-    });
-    for (auto& handler : std::exchange(self->awaitingEndpoint_, {})) handler(*self->endpoint_);
+void SBLClient::configured(const std::weak_ptr<RelayConnection>& weak, Expected<RelayArguments> result) {
+  queue_->async([self = shared_from_this(), weak, result = std::move(result)] {
+    const auto connection = weak.lock();
+    if (connection == nullptr || connection != self->connection_) return;
+    if (!result) {
+      // Without a configuration the daemon answers nothing: the next call starts anew.
+      connection->invalidate();
+      return self->dropConnection(result.error());
+    }
+    self->endpoint_ = std::get<std::string>((*result)[0]);
+    self->finishConnecting(*self->endpoint_);
   });
 }
 
-void SBLClient::connectionLost(const RelayConnection* connection) {
-  queue_->async([self = shared_from_this(), connection] {
-    if (self->connection_.get() != connection) return;
-    self->connection_.reset();
-    for (auto& handler : std::exchange(self->awaitingEndpoint_, {}))
-      handler(tl::unexpected(disconnectedError()));
+void SBLClient::connectionLost(const std::weak_ptr<RelayConnection>& weak) {
+  queue_->async([self = shared_from_this(), weak] {
+    if (const auto connection = weak.lock(); connection != nullptr && connection == self->connection_)
+      self->dropConnection(platform::relayDisconnected().value());
   });
+}
+
+void SBLClient::dropConnection(const Error& reason) {
+  queue_->assertIsCurrent();
+  connection_.reset();
+  endpoint_.reset();
+  finishConnecting(tl::unexpected(reason));
+}
+
+void SBLClient::finishConnecting(const Expected<platform::RelayEndpoint>& result) {
+  for (auto& handler : std::exchange(awaitingEndpoint_, {})) {
+    callbackQueue_->async([handler = std::move(handler), result]() mutable { handler(result); });
+  }
 }
 
 void SBLClient::handleCall(platform::RelayCall call) {
-  if (call.method == SBLClientRelay::bagDidLoad) {
-    BagHandler handler = queue_->sync([this] { return bagHandler_; });
-    if (handler) {
-      handler(std::get<std::string>(call.arguments[0]), std::get<std::string>(call.arguments[1]),
-              decodeError(std::get<RelayRecord>(call.arguments[2])));
-    }
+  const BagHandler handler = queue_->sync([this] { return bagHandler_; });
+  if (handler) {
+    handler(std::get<std::string>(call.arguments[0]), std::get<std::string>(call.arguments[1]),
+            decodeError(std::get<RelayRecord>(call.arguments[2])));
   }
   call.reply.send({});
 }
@@ -100,24 +101,31 @@ void SBLClient::handleCall(platform::RelayCall call) {
 void SBLClient::connect(platform::Function<void(Expected<platform::RelayEndpoint>)> handler) {
   queue_->async([self = shared_from_this(), handler = std::move(handler)]() mutable {
     const auto connection = self->ensureConnection();
-    if (!connection) return handler(tl::unexpected(connection.error()));
-    if (self->endpoint_) return handler(*self->endpoint_);
     self->awaitingEndpoint_.push_back(std::move(handler));
+    if (!connection) return self->finishConnecting(tl::unexpected(connection.error()));
+    if (self->endpoint_) self->finishConnecting(*self->endpoint_);
   });
 }
 
 void SBLClient::call(std::size_t method, RelayArguments arguments, ResultHandler handler) {
   const auto connection = queue_->sync([this] { return ensureConnection(); });
-  if (!connection) return handler(tl::unexpected(connection.error()));
+  if (!connection) {
+    return callbackQueue_->async([handler = std::move(handler), error = connection.error()]() mutable {
+      handler(tl::unexpected(error));
+    });
+  }
   (*connection)->call(kSBLDaemonRelay, method, std::move(arguments), timeout_, std::move(handler));
 }
 
-void SBLClient::request(SBLAnyRequest request, SBLReplyHandler handler) {
-  const std::uint64_t queryId = std::visit([](const auto& one) { return one.queryId; }, request);
-  call(SBLDaemonRelay::request, {std::string(requestClassName(request)), encodeRequest(request)},
+void SBLClient::request(const SBLAnyRequest& request, SBLReplyHandler handler) {
+  this->request(std::string(requestClassName(request)), encodeRequest(request), std::move(handler));
+}
+
+void SBLClient::request(std::string className, RelayRecord record, SBLReplyHandler handler) {
+  const std::uint64_t queryId = record.unsignedInteger("queryId").value_or(0);
+  call(SBLDaemonRelay::request, {std::move(className), std::move(record)},
        [queryId, handler = std::move(handler)](Expected<RelayArguments> result) mutable {
          if (!result) return handler(queryId, std::nullopt, result.error());
-         if (result->size() != 3) return handler(queryId, std::nullopt, badReplyError());
          handler(std::get<std::uint64_t>((*result)[0]), decodeReply(std::get<RelayRecord>((*result)[1])),
                  decodeError(std::get<RelayRecord>((*result)[2])));
        });
@@ -126,7 +134,6 @@ void SBLClient::request(SBLAnyRequest request, SBLReplyHandler handler) {
 void SBLClient::bag(platform::Function<void(std::string, std::string, std::optional<Error>)> handler) {
   call(SBLDaemonRelay::bag, {}, [handler = std::move(handler)](Expected<RelayArguments> result) mutable {
     if (!result) return handler({}, {}, result.error());
-    if (result->size() != 3) return handler({}, {}, badReplyError());
     handler(std::get<std::string>((*result)[0]), std::get<std::string>((*result)[1]),
             decodeError(std::get<RelayRecord>((*result)[2])));
   });
@@ -134,7 +141,9 @@ void SBLClient::bag(platform::Function<void(std::string, std::string, std::optio
 
 void SBLClient::disconnect() {
   queue_->async([self = shared_from_this()] {
-    if (self->connection_ != nullptr) std::exchange(self->connection_, nullptr)->invalidate();
+    if (self->connection_ == nullptr) return;
+    self->connection_->invalidate();
+    self->dropConnection(platform::relayDisconnected().value());
   });
 }
 

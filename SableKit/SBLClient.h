@@ -19,8 +19,8 @@ namespace sable {
 /// after 60 s). A call that was under way when the connection broke fails; it is not sent again,
 /// for a search of a moment ago may no longer be wanted.
 ///
-/// All operations: any thread, never wait for the daemon. Handlers run on the connection's queue,
-/// exactly once each.
+/// All operations: any thread; they never wait for an answer. Handlers run exactly once each, on a
+/// queue and never within the call, and may call the client.
 class SBLClient : public std::enable_shared_from_this<SBLClient> {
  public:
   /// The raw bag, as JSON text, and the user agent it was read for; called whenever the daemon
@@ -39,7 +39,9 @@ class SBLClient : public std::enable_shared_from_this<SBLClient> {
 
   /// Opens and configures the connection, if there is none; the result is the endpoint's address.
   void connect(platform::Function<void(Expected<platform::RelayEndpoint>)> handler);
-  void request(SBLAnyRequest request, SBLReplyHandler handler);
+  void request(const SBLAnyRequest& request, SBLReplyHandler handler);
+  /// A request as it travels. The daemon never answers a class it does not know.
+  void request(std::string className, platform::RelayRecord record, SBLReplyHandler handler);
   void bag(platform::Function<void(std::string rawBag, std::string userAgent, std::optional<Error>)> handler);
 
   /// Any method of SBLDaemonRelay, with its arguments and results as they travel.
@@ -58,18 +60,22 @@ class SBLClient : public std::enable_shared_from_this<SBLClient> {
  private:
   Expected<std::shared_ptr<platform::RelayConnection>> ensureConnection();
   void handleCall(platform::RelayCall call);
-  void configured(Expected<platform::RelayArguments> result);
-  void connectionLost(const platform::RelayConnection* connection);
+  void configured(const std::weak_ptr<platform::RelayConnection>& connection,
+                  Expected<platform::RelayArguments> result);
+  void connectionLost(const std::weak_ptr<platform::RelayConnection>& connection);
+  void dropConnection(const Error& reason);
+  void finishConnecting(const Expected<platform::RelayEndpoint>& result);
 
   platform::Relay& relay_;
   const platform::RelayEndpoint daemon_;
   const SBLSessionConfiguration configuration_;
   const std::shared_ptr<platform::SerialQueue> queue_;
+  const std::shared_ptr<platform::SerialQueue> callbackQueue_;  ///< of what no connection calls
   platform::Duration timeout_ = std::chrono::seconds(20);
 
   // On queue_.
   std::shared_ptr<platform::RelayConnection> connection_;
-  std::optional<Expected<platform::RelayEndpoint>> endpoint_;
+  std::optional<platform::RelayEndpoint> endpoint_;  ///< once configured
   std::vector<platform::Function<void(Expected<platform::RelayEndpoint>)>> awaitingEndpoint_;
   BagHandler bagHandler_;
 };

@@ -1,0 +1,26 @@
+#pragma once
+
+#include <optional>
+#include <string>
+
+#include "tools/sablectl/Output.h"
+#include "tools/sablectl/Session.h"
+
+/// How an answer to a request is shown.
+namespace sable::sablectl {
+
+/// {"query_id", "reply": {"scale", "data", "source", "http_request", "http_response"} or null,
+/// "error": {"code", "domain", "reason"} or null, "milliseconds"}.
+Dictionary answerDocument(const Answer& answer);
+
+/// Where the reply came from: "network" or "cache"; nullopt when there is no reply, or when the
+/// request did not ask.
+std::optional<std::string> sourceOf(const Answer& answer);
+
+/// The completed query of the first result set; nullopt when the reply has none.
+std::optional<std::string> bestCompletion(const Answer& answer);
+
+/// The whole answer for a person, as lines.
+std::vector<std::string> answerLines(const Output& output, const Answer& answer);
+
+}  // namespace sable::sablectl

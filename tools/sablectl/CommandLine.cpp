@@ -1,0 +1,199 @@
+#include "tools/sablectl/CommandLine.h"
+
+#include <CLI/CLI.hpp>
+#include <memory>
+
+#include "SableKit/SBLConstants.h"
+#include "SableKit/SBLRelayCoding.h"
+#include "tools/sablectl/Commands.h"
+#include "tools/sablectl/RequestRecord.h"
+
+namespace sable::sablectl {
+namespace {
+
+/// Adds a subcommand that runs `command`, which owns what its options are read into.
+CLI::App& add(CLI::App& app, Invocation& invocation, const char* name, const char* description,
+              Command command) {
+  CLI::App& subcommand = *app.add_subcommand(name, description);
+  subcommand.callback([&invocation, command = std::move(command)] { invocation.command = command; });
+  return subcommand;
+}
+
+std::string checkNameAndValue(const std::string& word) {
+  const auto pair = nameAndValue(word);
+  return pair ? std::string() : pair.error().reason;
+}
+
+void addRequestOptions(CLI::App& command, SBLRequest& request) {
+  request.queryId = 1;
+  request.verboseReply = true;
+  command.add_option("--query-id", request.queryId, "The query's id; 1 unless given")->type_name("N");
+  command.add_option("--trigger", request.triggerEvent, "What made the client ask")->type_name("N");
+  command.add_option("--scale", request.scale, "Pixels per point of the client's screen")
+      ->type_name("S")
+      ->check(CLI::PositiveNumber);
+  command
+      .add_option_function<std::vector<std::string>>(
+          "--item",
+          [&request](const std::vector<std::string>& words) {
+            for (const std::string& word : words) {
+              auto [name, value] = *nameAndValue(word);
+              request.queryItems.push_back({std::move(name), std::move(value)});
+            }
+          },
+          "Forces a query item on the request to the service (repeatable)")
+      ->type_name("NAME=VALUE")
+      ->allow_extra_args(false)
+      ->check(CLI::Validator(checkNameAndValue, ""));
+  command.add_flag_callback(
+      "--no-verbose", [&request] { request.verboseReply = false; },
+      "Do not ask for the HTTP request and response");
+}
+
+/// Adds a subcommand that sends one request; its options are read into the request.
+template <class Request>
+CLI::App& addRequest(CLI::App& app, Invocation& invocation, const char* name, const char* description,
+                     const std::shared_ptr<Request>& request) {
+  CLI::App& command = add(app, invocation, name, description, [request](const Context& context) {
+    return runRequest(context, std::string(Request::kClassName), encodeRequest(*request));
+  });
+  addRequestOptions(command, *request);
+  return command;
+}
+
+void addText(CLI::App& command, const char* name, std::string& value, const char* description) {
+  command.add_option(name, value, description)->required();
+}
+
+void addSearches(CLI::App& app, Invocation& invocation) {
+  const auto search = std::make_shared<SBLSearchRequest>();
+  addText(addRequest(app, invocation, "search", "Search once", search), "TEXT", search->queryString,
+          "What to search");
+
+  const auto typed = std::make_shared<SBLSearchRequest>();
+  CLI::App& type = add(app, invocation, "type", "Search at every keystroke, on one connection",
+                       [typed](const Context& context) { return runType(context, *typed); });
+  addRequestOptions(type, *typed);
+  addText(type, "TEXT", typed->queryString, "What to type");
+
+  addRequest(app, invocation, "zkw", "Ask what to offer before anything is typed",
+             std::make_shared<SBLZeroKeywordRequest>());
+
+  const auto more = std::make_shared<SBLMoreResultsRequest>();
+  addText(addRequest(app, invocation, "more", "Ask for more results", more), "URL", more->moreResultsURL,
+          "A result's URL of more results");
+
+  const auto card = std::make_shared<SBLCardRequest>();
+  addText(addRequest(app, invocation, "card", "Ask for a card", card), "URL", card->cardURL,
+          "A result's URL of its card");
+}
+
+void addLookups(CLI::App& app, Invocation& invocation) {
+  const auto lookup = std::make_shared<SBLLookupRequest>();
+  CLI::App& command = addRequest(app, invocation, "lookup", "Look a selected text up", lookup);
+  addText(command, "TEXT", lookup->queryString, "The selected text");
+  command
+      .add_option_function<std::string>(
+          "--context", [lookup](const std::string& text) { lookup->queryContext = text; },
+          "The text around it")
+      ->type_name("C");
+  command.add_option("--app", lookup->appBundleId, "The application it was selected in")->type_name("ID");
+  command.add_option("--domain", lookup->domain, "The domain it was selected in")->type_name("D");
+  command.add_option("--selection", lookup->lookupSelectionType, "How it was selected")->type_name("N");
+
+  const auto search = std::make_shared<SBLFlightSearchRequest>();
+  const auto lookUp = std::make_shared<bool>(false);
+  CLI::App& flight =
+      add(app, invocation, "flight", "Ask for a flight", [search, lookUp](const Context& context) {
+        if (!*lookUp)
+          return runRequest(context, std::string(SBLFlightSearchRequest::kClassName), encodeRequest(*search));
+        SBLFlightLookupRequest request{*search, search->queryString};
+        return runRequest(context, std::string(request.kClassName), encodeRequest(request));
+      });
+  addRequestOptions(flight, *search);
+  addText(flight, "TEXT", search->queryString, "The flight");
+  flight.add_flag("--lookup", *lookUp, "As the lookup of a flight, not as its search");
+}
+
+void addAnyRequest(CLI::App& app, Invocation& invocation) {
+  struct Words {
+    std::string className;
+    std::vector<std::string> members;
+    platform::RelayRecord record;
+  };
+  const auto words = std::make_shared<Words>();
+  CLI::App& command = *app.add_subcommand("request", "Send any request record");
+  addText(command, "CLASS", words->className, "The record's class");
+  command.add_option("MEMBER", words->members, "Members as NAME=VALUE; queryItems.NAME=VALUE adds an item");
+  command.callback([&invocation, words] {
+    auto record = requestRecord(words->members);
+    if (!record) throw CLI::ValidationError(record.error().reason);
+    invocation.command = [words, record = std::move(*record)](const Context& context) {
+      return runRequest(context, words->className, record);
+    };
+  });
+}
+
+void addQuestions(CLI::App& app, Invocation& invocation) {
+  add(app, invocation, "bag", "Show the bag as this agent sees it", runBag);
+  add(app, invocation, "sessions", "List the sessions that the daemon holds open", runSessions);
+  add(app, invocation, "feedback", "Show the feedback that the daemon has not sent yet", runFeedback);
+
+  struct Resource {
+    std::string identifier;
+    std::filesystem::path save;
+  };
+  const auto resource = std::make_shared<Resource>();
+  CLI::App& command =
+      add(app, invocation, "resource", "Get a resource file", [resource](const Context& context) {
+        return runResource(context, resource->identifier,
+                           resource->save.empty() ? std::nullopt : std::optional(resource->save));
+      });
+  addText(command, "ID", resource->identifier, "The resource's identifier");
+  command.add_option("--save", resource->save, "Write the file's content there")->type_name("F");
+
+  const auto openMetrics = std::make_shared<bool>(false);
+  add(app, invocation, "counters", "Show the daemon's counters", [openMetrics](const Context& context) {
+    return runCounters(context, *openMetrics);
+  }).add_flag("--openmetrics", *openMetrics, "As OpenMetrics text");
+  add(app, invocation, "status", "Show what the daemon is, has and holds", runStatus);
+}
+
+void addOptions(CLI::App& app, Options& options) {
+  app.set_version_flag("--version", std::string(kSBLSabledNameVersion));
+  app.add_option("--socket", options.socket, "The daemon's socket")->type_name("PATH");
+  app.add_option("--identifier", options.identifier, "The client's identifier")
+      ->capture_default_str()
+      ->type_name("ID");
+  app.add_option("--agent", options.agent, "The client's user agent")->capture_default_str()->type_name("UA");
+  app.add_option("--timeout", options.timeout, "How long to wait for an answer")
+      ->capture_default_str()
+      ->type_name("SECONDS")
+      ->check(CLI::Range(0.001, 86400.0));
+  app.add_flag("--json", options.json, "Print JSON");
+}
+
+}  // namespace
+
+std::variant<Invocation, ExitCode> readCommandLine(int argc, const char* const* argv) {
+  Invocation invocation;
+  CLI::App app("Asks sabled as any program that searches would, and looks into it.", "sablectl");
+  app.require_subcommand(1);
+  app.fallthrough();
+  addOptions(app, invocation.options);
+  addSearches(app, invocation);
+  addLookups(app, invocation);
+  addAnyRequest(app, invocation);
+  addQuestions(app, invocation);
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::Success& success) {
+    return app.exit(success) == 0 ? kExitSuccess : kExitUsage;
+  } catch (const CLI::ParseError& error) {
+    complain(error.what());
+    return kExitUsage;
+  }
+  return invocation;
+}
+
+}  // namespace sable::sablectl

@@ -1,0 +1,29 @@
+#pragma once
+
+#include <filesystem>
+#include <optional>
+#include <string>
+
+#include "tools/sablectl/Context.h"
+
+/// What the tool does, a function a command. Each prints its result and says what to exit with.
+namespace sable::sablectl {
+
+// Requests.
+ExitCode runRequest(const Context& context, const std::string& className,
+                    const platform::RelayRecord& record);
+/// Asks for "t", "te", "tex", "text" one after the other; query ids ascend from the request's.
+ExitCode runType(const Context& context, SBLSearchRequest request);
+
+// What the daemon tells.
+ExitCode runBag(const Context& context);
+ExitCode runSessions(const Context& context);
+ExitCode runFeedback(const Context& context);
+ExitCode runResource(const Context& context, const std::string& identifier,
+                     const std::optional<std::filesystem::path>& save);
+
+// What its files tell.
+ExitCode runCounters(const Context& context, bool openMetrics);
+ExitCode runStatus(const Context& context);
+
+}  // namespace sable::sablectl

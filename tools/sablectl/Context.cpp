@@ -1,0 +1,39 @@
+#include "tools/sablectl/Context.h"
+
+#include <fmt/format.h>
+
+#include <nlohmann/json.hpp>
+
+#include "SableKit/SBLConstants.h"
+#include "SableKit/SBLError.h"
+
+namespace sable::sablectl {
+
+Session Context::makeSession() const {
+  return {host, {options.identifier, options.agent}, platform::fromSeconds(options.timeout)};
+}
+
+ExitCode withSession(const Context& context, const std::function<ExitCode(Session&)>& use) {
+  Session session = context.makeSession();
+  const auto connected = session.connect();
+  if (connected) return use(session);
+  if (connected.error().domain != kPOSIXErrorDomain) return fail(context, connected.error());
+  if (context.output.json) context.output.document({{"error", encodeErrorForJSON(connected.error())}});
+  complain(
+      fmt::format("no daemon at {} ({}); start it with \"sabled\" or \"systemctl --user start {}.socket\"",
+                  context.host.socket.string(), connected.error().reason, kSBLSubsystem));
+  return kExitNoDaemon;
+}
+
+ExitCode fail(const Context& context, const Error& error) {
+  if (context.output.json) context.output.document({{"error", encodeErrorForJSON(error)}});
+  const ExitCode code = exitCodeFor(error);
+  if (code == kExitTimeout) {
+    complain(fmt::format("no answer within {:g} s", context.options.timeout));
+  } else {
+    complain(error.description());
+  }
+  return code;
+}
+
+}  // namespace sable::sablectl

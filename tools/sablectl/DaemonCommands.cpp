@@ -1,0 +1,137 @@
+#include <fmt/format.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <fstream>
+#include <nlohmann/json.hpp>
+
+#include "SableKit/SBLBag.h"
+#include "SableKit/SBLError.h"
+#include "SableKit/SBLRelayCoding.h"
+#include "SableKit/SBLRelayInterfaces.h"
+#include "tools/sablectl/Commands.h"
+#include "tools/sablectl/RecordDocument.h"
+#include "tools/sablectl/Text.h"
+
+namespace sable::sablectl {
+namespace {
+
+using platform::RelayRecord;
+
+constexpr std::size_t kMaximumBagBytes = 64u << 20;
+
+/// Leaves of nested objects as rows of dotted key and value.
+void flatten(const std::string& key, const Dictionary& value, std::vector<std::vector<std::string>>& rows) {
+  if (!value.is_object() || value.empty()) {
+    rows.push_back({printable(key), plainText(value)});
+    return;
+  }
+  for (const auto& [name, member] : value.items())
+    flatten(key.empty() ? name : key + "." + name, member, rows);
+}
+
+void printBag(const Output& output, const Dictionary& raw, const std::string& userAgent) {
+  output.line(output.paint(Colour::bold, printable(userAgent)));
+  std::vector<std::vector<std::string>> rows;
+  flatten("", raw, rows);
+  std::ranges::sort(rows);
+  for (const std::string& line : aligned(rows)) output.line(line);
+  for (const std::string& problem : SBLBag(std::make_shared<const Dictionary>(raw), userAgent).problems())
+    complain("bag: " + problem);
+}
+
+Expected<std::uint64_t> copyFile(int descriptor, const std::optional<std::filesystem::path>& save) {
+  std::ofstream file;
+  if (save) file.open(*save, std::ios::binary | std::ios::trunc);
+  if (save && !file) return tl::unexpected(posixError(errno, save->string()));
+  std::uint64_t size = 0;
+  char bytes[65536];
+  for (ssize_t count; (count = pread(descriptor, bytes, sizeof bytes, static_cast<off_t>(size))) != 0;) {
+    if (count < 0) return tl::unexpected(posixError(errno, "read"));
+    size += static_cast<std::uint64_t>(count);
+    if (save) file.write(bytes, count);
+  }
+  if (save && !file.flush()) return tl::unexpected(posixError(EIO, save->string()));
+  return size;
+}
+
+}  // namespace
+
+ExitCode runBag(const Context& context) {
+  return withSession(context, [&](Session& session) {
+    const auto bag = session.bag();
+    if (!bag) return fail(context, bag.error());
+    const auto raw = parseJSON(bag->json, kMaximumBagBytes);
+    if (!raw) return fail(context, raw.error());
+    if (context.output.json) {
+      context.output.document(*raw);
+    } else {
+      printBag(context.output, *raw, bag->userAgent);
+    }
+    return kExitSuccess;
+  });
+}
+
+ExitCode runSessions(const Context& context) {
+  return withSession(context, [&](Session& session) {
+    const auto result = session.call(SBLDaemonRelay::listSessions, {});
+    if (!result) return fail(context, result.error());
+    const Dictionary sessions = recordDocuments(std::get<platform::RelayRecords>((*result)[0]));
+    if (context.output.json) {
+      context.output.document(sessions);
+    } else {
+      for (const std::string& line : tableLines(sessions)) context.output.line(line);
+    }
+    return kExitSuccess;
+  });
+}
+
+ExitCode runFeedback(const Context& context) {
+  return withSession(context, [&](Session& session) {
+    const auto result = session.call(SBLDaemonRelay::feedback, {});
+    if (!result) return fail(context, result.error());
+    if (const auto error = decodeError(std::get<RelayRecord>((*result)[1]))) return fail(context, *error);
+    Dictionary entries = Dictionary::array();
+    for (const std::string& text : std::get<platform::RelayStrings>((*result)[0])) {
+      const auto parsed = parseJSON(text, text.size());
+      entries.push_back(parsed ? *parsed : Dictionary(text));
+    }
+    if (context.output.json) {
+      context.output.document(entries);
+    } else {
+      for (const Dictionary& entry : entries) context.output.line(plainText(entry));
+      if (entries.empty()) context.output.line("no feedback");
+    }
+    return kExitSuccess;
+  });
+}
+
+ExitCode runResource(const Context& context, const std::string& identifier,
+                     const std::optional<std::filesystem::path>& save) {
+  return withSession(context, [&](Session& session) {
+    const auto result = session.call(SBLDaemonRelay::fileHandleAndAttributesForResource, {identifier});
+    if (!result) return fail(context, result.error());
+    if (const auto error = decodeError(std::get<RelayRecord>((*result)[2]))) return fail(context, *error);
+    const auto& file = std::get<platform::RelayFile>((*result)[0]);
+    if (file.descriptor == nullptr)
+      return fail(context, makeSBLError(SBLErrorCode::daemonSide, "no file for " + identifier));
+    const auto size = copyFile(*file.descriptor, save);
+    if (!size) return fail(context, size.error());
+
+    Dictionary document;
+    document["identifier"] = identifier;
+    document["bytes"] = *size;
+    if (save) document["saved"] = save->string();
+    document["attributes"] = recordDocument(std::get<RelayRecord>((*result)[1]));
+    if (context.output.json) {
+      context.output.document(document);
+    } else {
+      std::vector<std::vector<std::string>> rows;
+      flatten("", document, rows);
+      for (const std::string& line : aligned(rows)) context.output.line(line);
+    }
+    return kExitSuccess;
+  });
+}
+
+}  // namespace sable::sablectl

@@ -1,0 +1,38 @@
+#pragma once
+
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <map>
+#include <string>
+#include <vector>
+
+#include "platform/FileManager.h"
+#include "platform/Process.h"
+#include "platform/Relay.h"
+#include "platform/Runtime.h"
+
+namespace sable::sablectl {
+
+struct NamedPath {
+  std::string name;
+  std::filesystem::path path;
+};
+
+/// What the commands use of the machine; main.cpp provides it. Outlives every command.
+struct Host {
+  platform::Runtime& runtime;
+  platform::Relay& relay;
+  platform::FileManager& fileManager;
+
+  std::filesystem::path socket;
+  std::filesystem::path caches;    ///< the daemon's own
+  std::filesystem::path counters;  ///< the file
+  std::vector<NamedPath> places;   ///< folders and files of the daemon, in the order in which they are told
+
+  std::function<platform::RelayEndpoint(const std::filesystem::path&)> endpointOf;
+  std::function<Expected<std::map<std::string, std::int64_t>>(const std::filesystem::path&)> readCounters;
+  std::function<std::vector<platform::Availability>()> availability;
+};
+
+}  // namespace sable::sablectl

@@ -1,0 +1,193 @@
+#include <fmt/chrono.h>
+#include <fmt/format.h>
+
+#include <chrono>
+#include <cmath>
+#include <nlohmann/json.hpp>
+
+#include "SableKit/SBLError.h"
+#include "SableKit/SBLRelayInterfaces.h"
+#include "platform/PropertyList.h"
+#include "tools/sablectl/Commands.h"
+#include "tools/sablectl/RecordDocument.h"
+#include "tools/sablectl/Text.h"
+
+namespace sable::sablectl {
+namespace {
+
+constexpr std::size_t kMaximumBagBytes = 8u << 20;
+/// Where the daemon notes when a kept bag expires, in seconds since 1970.
+constexpr const char* kExpirationKey = "__expiration";
+
+/// Asks for the sessions: that the daemon answers is what counts. The exit code goes to `code`.
+Dictionary openSessions(const Context& context, ExitCode& code, Dictionary& problem) {
+  Session session = context.makeSession();
+  const auto fault = [&](const Error& error, ExitCode failure) {
+    code = failure;
+    problem = encodeErrorForJSON(error);
+    return Dictionary(nullptr);
+  };
+  if (const auto connected = session.connect(); !connected) {
+    const bool nobody = connected.error().domain == kPOSIXErrorDomain;
+    return fault(connected.error(), nobody ? kExitNoDaemon : exitCodeFor(connected.error()));
+  }
+  const auto sessions = session.call(SBLDaemonRelay::listSessions, {});
+  if (!sessions) return fault(sessions.error(), exitCodeFor(sessions.error()));
+  return recordDocuments(std::get<platform::RelayRecords>((*sessions)[0]));
+}
+
+/// Who opened the listener, as the kernel knows: under socket activation that is the service
+/// manager, not the daemon.
+void addPeer(const Context& context, Dictionary& status) {
+  status["pid"] = nullptr;
+  status["executable"] = nullptr;
+  const auto connection = context.host.relay.connect(context.host.endpointOf(context.host.socket));
+  if (!connection) return;
+  const pid_t pid = (*connection)->peer().pid;
+  status["pid"] = pid;
+  if (const auto path = context.host.relay.executablePath(pid)) status["executable"] = *path;
+}
+
+Dictionary daemonStatus(const Context& context, ExitCode& code) {
+  Dictionary status = Dictionary::object();
+  Dictionary problem;
+  status["socket"] = context.host.socket.string();
+  Dictionary sessions = openSessions(context, code, problem);
+  status["answers"] = code == kExitSuccess;
+  addPeer(context, status);
+  status["error"] = std::move(problem);
+  status["sessions"] = std::move(sessions);
+  return status;
+}
+
+Dictionary placesStatus(const Host& host) {
+  Dictionary places = Dictionary::array();
+  for (const auto& [name, path] : host.places) {
+    std::error_code error;
+    const bool exists = std::filesystem::exists(path, error);
+    Dictionary place;
+    place["name"] = name;
+    place["path"] = path.string();
+    place["exists"] = error ? Dictionary(nullptr) : Dictionary(exists);
+    places.push_back(std::move(place));
+  }
+  return places;
+}
+
+double secondsBetween(platform::WallTime from, platform::WallTime to) {
+  return std::round(platform::toSeconds(to - from));
+}
+
+Dictionary bagStatus(const Host& host) {
+  const auto path = host.caches / "bag.plist";
+  Dictionary status;
+  status["file"] = path.string();
+  const auto bytes = host.fileManager.read(path, kMaximumBagBytes);
+  const auto bag = bytes ? platform::decodePropertyList(*bytes) : tl::unexpected(bytes.error());
+  if (!bag || !bag->is_object()) {
+    status["error"] = bag ? "not a dictionary" : bag.error().reason;
+    return status;
+  }
+  const auto version = bag->find("version");
+  status["version"] = version == bag->end() ? Dictionary(nullptr) : *version;
+  std::error_code error;
+  const auto written = std::filesystem::last_write_time(path, error);
+  const auto now = host.runtime.now();
+  status["age_seconds"] =
+      error ? Dictionary(nullptr) : Dictionary(secondsBetween(std::chrono::file_clock::to_sys(written), now));
+  const auto expiration = numberMember(*bag, kExpirationKey);
+  status["expires_in_seconds"] =
+      expiration ? Dictionary(secondsBetween(now, platform::wallTimeFromSecondsSince1970(*expiration)))
+                 : Dictionary(nullptr);
+  return status;
+}
+
+Dictionary facilitiesStatus(const Host& host) {
+  Dictionary facilities = Dictionary::array();
+  for (const auto& [facility, available, detail] : host.availability()) {
+    Dictionary one;
+    one["facility"] = facility;
+    one["available"] = available;
+    one["detail"] = detail;
+    facilities.push_back(std::move(one));
+  }
+  return facilities;
+}
+
+/// "3 h 59 min", "12 s": the two largest units.
+std::string duration(double seconds) {
+  const auto whole = static_cast<long long>(std::fabs(seconds));
+  if (whole >= 86400) return fmt::format("{} d {} h", whole / 86400, whole % 86400 / 3600);
+  if (whole >= 3600) return fmt::format("{} h {} min", whole / 3600, whole % 3600 / 60);
+  if (whole >= 60) return fmt::format("{} min {} s", whole / 60, whole % 60);
+  return fmt::format("{} s", whole);
+}
+
+std::string bagText(const Dictionary& bag) {
+  if (bag.contains("error")) return "cannot be read: " + plainText(bag["error"]);
+  std::string text = "version " + plainText(bag["version"]);
+  if (const auto age = numberMember(bag, "age_seconds")) text += fmt::format(", {} old", duration(*age));
+  if (const auto rest = numberMember(bag, "expires_in_seconds"))
+    text += *rest < 0 ? fmt::format(", expired {} ago", duration(*rest))
+                      : fmt::format(", expires in {}", duration(*rest));
+  return text;
+}
+
+std::string processText(const Dictionary& daemon) {
+  if (daemon["pid"].is_null()) return "unknown";
+  const Dictionary& executable = daemon["executable"];
+  return fmt::format("{} ({})", daemon["pid"].get<std::int64_t>(),
+                     executable.is_null() ? "executable cannot be read" : plainText(executable));
+}
+
+using Rows = std::vector<std::vector<std::string>>;
+
+void print(const Output& output, const Dictionary& status) {
+  const auto section = [&](std::string_view title, const Rows& rows) {
+    output.line(output.paint(Colour::bold, title));
+    for (const std::string& line : aligned(rows)) output.line("  " + line);
+  };
+  const Dictionary& daemon = status["daemon"];
+  const bool answers = daemon["answers"].get<bool>();
+  section("Daemon", {{"socket", plainText(daemon["socket"])},
+                     {"answers", answers ? "yes" : "no: " + plainText(daemon["error"]["reason"])},
+                     {"process", processText(daemon)}});
+  section("Bag", {{"kept", bagText(status["bag"])}, {"file", plainText(status["bag"]["file"])}});
+  Rows places;
+  for (const Dictionary& place : status["places"]) {
+    places.push_back({plainText(place["name"]), plainText(place["path"]),
+                      place["exists"] == true    ? ""
+                      : place["exists"] == false ? "missing"
+                                                 : "cannot be seen"});
+  }
+  section("Files", places);
+  Rows facilities;
+  for (const Dictionary& one : status["facilities"]) {
+    facilities.push_back({plainText(one["facility"]),
+                          one["available"] == true ? "available" : "not available",
+                          plainText(one["detail"])});
+  }
+  section("Host, as this program sees it", facilities);
+  if (!answers) return;
+  output.line(output.paint(Colour::bold, "Sessions"));
+  for (const std::string& line : tableLines(daemon["sessions"])) output.line("  " + line);
+}
+
+}  // namespace
+
+ExitCode runStatus(const Context& context) {
+  ExitCode code = kExitSuccess;
+  Dictionary status;
+  status["daemon"] = daemonStatus(context, code);
+  status["bag"] = bagStatus(context.host);
+  status["places"] = placesStatus(context.host);
+  status["facilities"] = facilitiesStatus(context.host);
+  if (context.output.json) {
+    context.output.document(status);
+  } else {
+    print(context.output, status);
+  }
+  return code;
+}
+
+}  // namespace sable::sablectl

@@ -1,0 +1,64 @@
+#include "platform/host/Folders.h"
+#include "platform/host/HostFileManager.h"
+#include "platform/host/HostMemoryPressure.h"
+#include "platform/host/HostNotify.h"
+#include "platform/host/HostRelay.h"
+#include "platform/host/HostRuntime.h"
+#include "platform/host/MappedTally.h"
+#include "platform/host/UnixSocket.h"
+#include "tools/sablectl/CommandLine.h"
+
+namespace {
+
+using namespace sable::sablectl;
+namespace host = sable::platform::host;
+
+/// One thread reads answers while the main thread waits for them.
+constexpr unsigned kThreads = 1;
+
+std::vector<NamedPath> placesOf(const host::Folders& folders) {
+  return {{"runtime folder", folders.runtime},       {"caches folder", folders.caches},
+          {"state folder", folders.state},           {"counters", folders.counters()},
+          {"user settings", folders.userSettings()}, {"profile settings", folders.profileSettings},
+          {"user facts", folders.userFacts()},       {"system facts", folders.systemFacts}};
+}
+
+std::vector<sable::platform::Availability> probe(host::HostRuntime& runtime) {
+  return {host::HostNotify(runtime).availability(),
+          host::HostMemoryPressure(runtime.reactor()).availability()};
+}
+
+ExitCode run(const Invocation& invocation) {
+  const auto folders = host::Folders::fromEnvironment();
+  const auto socket = invocation.options.socket.empty()
+                          ? folders.socket()
+                          : std::filesystem::absolute(invocation.options.socket);
+  host::HostRuntime runtime(kThreads);
+  host::HostFileManager fileManager(folders);
+  host::HostRelayConfiguration configuration;
+  configuration.runtimeFolder = folders.runtime;
+  configuration.socketPath = socket;
+  host::HostRelay relay(runtime, configuration);
+  Host machine{
+      .runtime = runtime,
+      .relay = relay,
+      .fileManager = fileManager,
+      .socket = socket,
+      .caches = folders.caches,
+      .counters = folders.counters(),
+      .places = placesOf(folders),
+      .endpointOf = [](const std::filesystem::path& path) { return host::endpointOf(path.native()); },
+      .readCounters = host::MappedTally::snapshotOf,
+      .availability = [&runtime] { return probe(runtime); },
+  };
+  const Output output = Output::standard(invocation.options.json);
+  return invocation.command({machine, invocation.options, output});
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  const auto read = readCommandLine(argc, argv);
+  const auto* invocation = std::get_if<Invocation>(&read);
+  return invocation != nullptr ? run(*invocation) : std::get<ExitCode>(read);
+}
