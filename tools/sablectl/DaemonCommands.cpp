@@ -36,8 +36,8 @@ void printBag(const Output& output, const Dictionary& raw, const std::string& us
   flatten("", raw, rows);
   std::ranges::sort(rows);
   for (const std::string& line : aligned(rows)) output.line(line);
-  for (const std::string& problem : SBLBag(std::make_shared<const Dictionary>(raw), userAgent).problems())
-    complain("bag: " + problem);
+  const SBLBag bag(std::make_shared<const Dictionary>(raw), userAgent);
+  for (const std::string& problem : bag.problems()) complain("bag: " + problem);
 }
 
 Expected<std::uint64_t> copyFile(int descriptor, const std::optional<std::filesystem::path>& save) {
