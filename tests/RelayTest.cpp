@@ -223,7 +223,7 @@ class RelayContract : public ::testing::TestWithParam<std::string> {
     connection->exportObject(kServer, [this, weak = std::weak_ptr(connection)](RelayCall call) {
       handle(std::move(call), weak.lock());
     });
-    connection->setInvalidationHandler([this] { server_.add("ended"); });
+    connection->setInvalidationHandler([heard = server_] { heard->add("ended"); });
     connection->resume();
   }
 
@@ -238,11 +238,11 @@ class RelayContract : public ::testing::TestWithParam<std::string> {
       case kForget:
         return call.reply.forget();
       case kNote:
-        return server_.add(show(call.arguments[0]));
+        return server_->add(show(call.arguments[0]));
       case kKeep: {
         const std::lock_guard lock(mutex_);
         kept_.push_back(std::move(call.reply));
-        return server_.add("kept");
+        return server_->add("kept");
       }
       default:
         break;
@@ -259,7 +259,7 @@ class RelayContract : public ::testing::TestWithParam<std::string> {
     (*connection)->exportObject(kClient, [](RelayCall call) {
       call.reply(std::get<std::string>(call.arguments[0]) + "!");
     });
-    (*connection)->setInvalidationHandler([this] { client_.add("ended"); });
+    (*connection)->setInvalidationHandler([heard = client_] { heard->add("ended"); });
     (*connection)->resume();
     return *connection;
   }
@@ -267,13 +267,14 @@ class RelayContract : public ::testing::TestWithParam<std::string> {
   void call(RelayConnection& connection, std::size_t method, RelayArguments arguments = {},
             const RelayInterface& interface = kServer, Duration timeout = kLong) {
     connection.call(interface, method, std::move(arguments), timeout,
-                    [this](Expected<RelayArguments> result) { client_.add(show(result)); });
+                    [heard = client_](Expected<RelayArguments> result) { heard->add(show(result)); });
   }
 
   const std::unique_ptr<World> world_ = GetParam() == "host" ? std::unique_ptr<World>(new HostWorld)
                                                              : std::unique_ptr<World>(new SimulatedWorld);
-  Heard client_{runtime()};
-  Heard server_{runtime()};
+  // Shared, for a connection's last words come after it is let go of.
+  const std::shared_ptr<Heard> client_ = std::make_shared<Heard>(runtime());
+  const std::shared_ptr<Heard> server_ = std::make_shared<Heard>(runtime());
   std::mutex mutex_;
   std::vector<std::shared_ptr<RelayConnection>> served_;
   std::vector<RelayReply> kept_;
@@ -286,7 +287,7 @@ INSTANTIATE_TEST_SUITE_P(Worlds, RelayContract, ::testing::Values("host", "simul
 TEST_P(RelayContract, EveryTypeOfValueArrivesAsItWasSent) {
   const auto connection = connect();
   call(*connection, kEcho, oneOfEach());
-  EXPECT_EQ(client_.next(), Lines{show(oneOfEach())});
+  EXPECT_EQ(client_->next(), Lines{show(oneOfEach())});
 }
 
 TEST_P(RelayContract, AFileArrivesOpenAndAbsentMembersDoNotArrive) {
@@ -303,9 +304,9 @@ TEST_P(RelayContract, AFileArrivesOpenAndAbsentMembersDoNotArrive) {
   connection->call(kServer, kEcho, std::move(arguments), kLong, [&](Expected<RelayArguments> result) {
     const auto& file = std::get<RelayFile>(result->at(12));
     EXPECT_EQ(write(*file.descriptor, "x", 1), 1);
-    client_.add(show(result->at(7)));
+    client_->add(show(result->at(7)));
   });
-  EXPECT_EQ(client_.next(), Lines{"{empty=<> }"});
+  EXPECT_EQ(client_->next(), Lines{"{empty=<> }"});
   char byte = 0;
   EXPECT_EQ(read(ends[0], &byte, 1), 1);
   close(ends[0]);
@@ -315,29 +316,29 @@ TEST_P(RelayContract, AFileArrivesOpenAndAbsentMembersDoNotArrive) {
 TEST_P(RelayContract, ACallThatGoesWrongIsAnsweredWithTheReason) {
   const auto connection = connect();
   call(*connection, kFail);
-  EXPECT_EQ(client_.next(), Lines{"com.kestrel.Error.Test as asked"});
+  EXPECT_EQ(client_->next(), Lines{"com.kestrel.Error.Test as asked"});
   call(*connection, kDrop);
-  EXPECT_EQ(client_.next(), Lines{"org.freedesktop.DBus.Error.NoReply The call was dropped unanswered"});
+  EXPECT_EQ(client_->next(), Lines{"org.freedesktop.DBus.Error.NoReply The call was dropped unanswered"});
   call(*connection, 0, {}, kNowhere);
-  EXPECT_EQ(client_.next()[0].substr(0, 34), "org.freedesktop.DBus.Error.Unknown");
+  EXPECT_EQ(client_->next()[0].substr(0, 34), "org.freedesktop.DBus.Error.Unknown");
   call(*connection, 0, {std::uint64_t{1}}, kMistaken);
-  EXPECT_EQ(client_.next(), Lines{"org.freedesktop.DBus.Error.InvalidArgs Note takes \"ts\", not \"t\""});
+  EXPECT_EQ(client_->next(), Lines{"org.freedesktop.DBus.Error.InvalidArgs Note takes \"ts\", not \"t\""});
 }
 
 TEST_P(RelayContract, AForgottenCallIsNeverAnswered) {
   const auto connection = connect();
   call(*connection, kForget);
   call(*connection, kFail);
-  EXPECT_EQ(client_.next(), Lines{"com.kestrel.Error.Test as asked"});
+  EXPECT_EQ(client_->next(), Lines{"com.kestrel.Error.Test as asked"});
   call(*connection, kForget, {}, kServer, std::chrono::milliseconds(1));
-  EXPECT_EQ(client_.next(), Lines{"No answer came in time"});
-  EXPECT_TRUE(client_.silent());
+  EXPECT_EQ(client_->next(), Lines{"No answer came in time"});
+  EXPECT_TRUE(client_->silent());
 }
 
 TEST_P(RelayContract, EitherSideCallsTheOtherDuringACall) {
   const auto connection = connect();
   call(*connection, kCallBack, {std::string("hello")});
-  EXPECT_EQ(client_.next(), Lines{"\"hello!?\"; "});
+  EXPECT_EQ(client_->next(), Lines{"\"hello!?\"; "});
 }
 
 TEST_P(RelayContract, OneWayCallsArriveInOrderHoweverMany) {
@@ -347,31 +348,31 @@ TEST_P(RelayContract, OneWayCallsArriveInOrderHoweverMany) {
     connection->send(kServer, kNote, {i, std::string(1000, 'n')});
     sent.push_back(show(RelayValue(i)));
   }
-  EXPECT_EQ(server_.next(2000), sent);
+  EXPECT_EQ(server_->next(2000), sent);
 }
 
 TEST_P(RelayContract, AnEndedConnectionIsHeardOfOnceAfterItsPendingCalls) {
   const auto connection = connect();
   call(*connection, kKeep);
   call(*connection, kKeep);
-  EXPECT_EQ(server_.next(2), (Lines{"kept", "kept"}));
+  EXPECT_EQ(server_->next(2), (Lines{"kept", "kept"}));
   connection->invalidate();
   connection->invalidate();
-  EXPECT_EQ(client_.next(3), (Lines{"The connection has ended", "The connection has ended", "ended"}));
-  EXPECT_EQ(server_.next(), Lines{"ended"});
+  EXPECT_EQ(client_->next(3), (Lines{"The connection has ended", "The connection has ended", "ended"}));
+  EXPECT_EQ(server_->next(), Lines{"ended"});
   call(*connection, kFail);
-  EXPECT_EQ(client_.next(), Lines{"The connection has ended"});
-  EXPECT_TRUE(server_.silent());
+  EXPECT_EQ(client_->next(), Lines{"The connection has ended"});
+  EXPECT_TRUE(server_->silent());
 }
 
 TEST_P(RelayContract, APeerThatIsDroppedIsHeardOfAndReleased) {
   auto connection = connect();
   call(*connection, kKeep);
-  EXPECT_EQ(server_.next(), Lines{"kept"});
+  EXPECT_EQ(server_->next(), Lines{"kept"});
   const std::weak_ptr<RelayConnection> client = connection;
   connection.reset();
-  EXPECT_EQ(client_.next(2), (Lines{"The connection has ended", "ended"}));
-  EXPECT_EQ(server_.next(), Lines{"ended"});
+  EXPECT_EQ(client_->next(2), (Lines{"The connection has ended", "ended"}));
+  EXPECT_EQ(server_->next(), Lines{"ended"});
   EXPECT_TRUE(client.expired());
   std::weak_ptr<RelayConnection> server;
   std::shared_ptr<SerialQueue> queue;
@@ -388,9 +389,9 @@ TEST_P(RelayContract, AConnectionMayEndWithinItsOwnCall) {
   const auto connection = connect();
   connection->call(kServer, kFail, {}, kLong, [&](Expected<RelayArguments>) {
     connection->invalidate();
-    client_.add("answered");
+    client_->add("answered");
   });
-  EXPECT_EQ(client_.next(2), (Lines{"answered", "ended"}));
+  EXPECT_EQ(client_->next(2), (Lines{"answered", "ended"}));
 }
 
 TEST_P(RelayContract, AnAnonymousListenerIsFoundByItsEndpointOnly) {
@@ -408,7 +409,7 @@ TEST_P(RelayContract, AnAnonymousListenerIsFoundByItsEndpointOnly) {
   ASSERT_TRUE(connection);
   (*connection)->resume();
   call(**connection, kFail);
-  EXPECT_EQ(client_.next(), Lines{"com.kestrel.Error.Test as asked"});
+  EXPECT_EQ(client_->next(), Lines{"com.kestrel.Error.Test as asked"});
   listener.reset();
   EXPECT_FALSE(relay().connect(endpoint));
 }
@@ -419,18 +420,18 @@ TEST_P(RelayContract, ARefusedConnectionEnds) {
   ASSERT_TRUE(listener->resume());
   const auto connection = relay().connect(listener->endpoint());
   ASSERT_TRUE(connection);
-  (*connection)->setInvalidationHandler([this] { client_.add("ended"); });
+  (*connection)->setInvalidationHandler([heard = client_] { heard->add("ended"); });
   (*connection)->resume();
-  EXPECT_EQ(client_.next(), Lines{"ended"});
+  EXPECT_EQ(client_->next(), Lines{"ended"});
 }
 
 TEST_P(RelayContract, AStrangerIsRefusedBeforeAnybodyHearsOfHim) {
   const auto connection = world_->connectAsStranger(listener_->endpoint());
   ASSERT_TRUE(connection);
-  (*connection)->setInvalidationHandler([this] { client_.add("ended"); });
+  (*connection)->setInvalidationHandler([heard = client_] { heard->add("ended"); });
   (*connection)->resume();
   call(**connection, kFail);
-  EXPECT_EQ(client_.next(2), (Lines{"The connection has ended", "ended"}));
+  EXPECT_EQ(client_->next(2), (Lines{"The connection has ended", "ended"}));
   const std::lock_guard lock(mutex_);
   EXPECT_TRUE(served_.empty());
 }
@@ -446,10 +447,10 @@ TEST_P(RelayContract, EventsReachTheirStreamsHandlerThoughItCameLater) {
   world_->raiseEvent("one", "early");
   relay().setEventStreamHandler(
       "one", runtime().serialQueue("events"),
-      [this](std::optional<std::string> name) { server_.add(name.value_or("unnamed")); });
+      [this](std::optional<std::string> name) { server_->add(name.value_or("unnamed")); });
   world_->raiseEvent("two", "other");
   world_->raiseEvent("one", std::nullopt);
-  EXPECT_EQ(server_.next(2), (Lines{"early", "unnamed"}));
+  EXPECT_EQ(server_->next(2), (Lines{"early", "unnamed"}));
 }
 
 TEST_P(RelayContract, ManyClientsAreServedSideBySide) {
@@ -458,7 +459,7 @@ TEST_P(RelayContract, ManyClientsAreServedSideBySide) {
   for (int round = 0; round < 20; ++round) {
     for (const auto& connection : connections) call(*connection, kFail);
   }
-  EXPECT_EQ(client_.next(64 * 20), Lines(64 * 20, "com.kestrel.Error.Test as asked"));
+  EXPECT_EQ(client_->next(64 * 20), Lines(64 * 20, "com.kestrel.Error.Test as asked"));
 }
 
 }  // namespace
