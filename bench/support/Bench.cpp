@@ -1,0 +1,79 @@
+#include "bench/support/Bench.h"
+
+#include <fmt/core.h>
+#include <sched.h>
+#include <signal.h>
+#include <sys/prctl.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdio>
+#include <cstdlib>
+#include <string_view>
+
+namespace sable::bench {
+
+void fail(const std::string& what) {
+  fmt::print(stderr, "bench: {}\n", what);
+  std::exit(1);
+}
+
+double median(std::vector<double> values) {
+  const auto middle = values.begin() + static_cast<std::ptrdiff_t>(values.size() / 2);
+  std::nth_element(values.begin(), middle, values.end());
+  return *middle;
+}
+
+void report(const Measure& measure, int argc, char** argv) {
+  const auto ratio = measure.floor ? std::optional(measure.median / *measure.floor) : std::nullopt;
+  const char* verdict = !measure.bound                                     ? "-"
+                        : ratio.value_or(measure.median) <= *measure.bound ? "ok"
+                                                                           : "short";
+  const auto number = [](std::optional<double> value, const char* absent) {
+    return value ? fmt::format("{:.2f}", *value) : std::string(absent);
+  };
+  const bool json = std::any_of(argv, argv + argc, [](std::string_view word) { return word == "--json"; });
+  if (json) {
+    fmt::print(
+        R"({{"name": "{}", "unit": "{}", "median": {:.2f}, "floor": {}, "ratio": {}, "bound": {}, "verdict": "{}"}})"
+        "\n",
+        measure.name, measure.unit, measure.median, number(measure.floor, "null"), number(ratio, "null"),
+        number(measure.bound, "null"), verdict);
+  } else {
+    fmt::print("{:<28} {:>10.2f} {:<8} floor {:>9}  ratio {:>6}  bound {:>6}  {}\n", measure.name,
+               measure.median, measure.unit, number(measure.floor, "-"), number(ratio, "-"),
+               number(measure.bound, "-"), verdict);
+  }
+  std::fflush(stdout);
+}
+
+Child::Child(const std::function<void()>& run) {
+  std::fflush(stdout);
+  pid_ = ::fork();
+  if (pid_ < 0) fail("fork");
+  if (pid_ > 0) return;
+  ::prctl(PR_SET_PDEATHSIG, SIGKILL);
+  run();
+  ::_exit(0);
+}
+
+Child::~Child() {
+  if (pid_ < 0) return;
+  ::kill(pid_, SIGKILL);
+  ::waitpid(pid_, nullptr, 0);
+}
+
+void pin(pid_t process, int processor) {
+  cpu_set_t set;
+  CPU_ZERO(&set);
+  for (int each = 0; each < CPU_SETSIZE; ++each) {
+    if (processor < 0 || each == processor) CPU_SET(static_cast<std::size_t>(each), &set);
+  }
+  const std::string tasks = fmt::format("/proc/{}/task", process == 0 ? ::getpid() : process);
+  for (const auto& task : std::filesystem::directory_iterator(tasks)) {
+    ::sched_setaffinity(std::stoi(task.path().filename()), sizeof set, &set);
+  }
+}
+
+}  // namespace sable::bench

@@ -1,0 +1,146 @@
+#pragma once
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <filesystem>
+#include <functional>
+#include <optional>
+#include <string>
+#include <utility>
+#include <vector>
+
+struct sd_bus;
+
+/// What the benchmarks share: the real daemon in folders of its own with a service that always gives
+/// the same answer, a plain client of it, the floor that it is held against, and the line a measure
+/// ends in. A step that fails ends the program with a text.
+namespace sable::bench {
+
+[[noreturn]] void fail(const std::string& what);
+
+using Microseconds = std::vector<double>;
+double median(std::vector<double> values);
+
+/// Times `count` calls one by one.
+template <class Call>
+void measure(int count, Microseconds& times, Call call) {
+  for (int i = 0; i < count; ++i) {
+    const auto start = std::chrono::steady_clock::now();
+    call();
+    const std::chrono::duration<double, std::micro> time = std::chrono::steady_clock::now() - start;
+    times.push_back(time.count());
+  }
+}
+
+/// With a floor the bound is one of the ratio, else of the median.
+struct Measure {
+  std::string name, unit;
+  double median;
+  std::optional<double> floor, bound;
+};
+/// Prints `name  median  floor  ratio  bound  ok|short`; with "--json" among the arguments as JSON.
+void report(const Measure& measure, int argc, char** argv);
+
+/// A forked process; killed with its object, and with its parent.
+class Child {
+ public:
+  Child() = default;
+  explicit Child(const std::function<void()>& run);
+  ~Child();
+  Child(Child&& other) noexcept : pid_(std::exchange(other.pid_, -1)) {}
+  Child& operator=(Child&& other) noexcept {
+    std::swap(pid_, other.pid_);
+    return *this;
+  }
+  pid_t pid() const { return pid_; }
+
+ private:
+  pid_t pid_ = -1;
+};
+
+/// Answers a search with the same 10 KB of JSON, on connections that stay open.
+class Service {
+ public:
+  static constexpr std::size_t kAnswerBytes = 10240;
+
+  Service();
+  const std::string& url() const { return url_; }
+  /// The head of the last search request.
+  std::string lastSearch() const;
+
+ private:
+  struct Shared;
+  std::string url_;
+  Shared* shared_;
+  Child process_;
+};
+
+/// sabled and its service.
+class World {
+ public:
+  World();
+  ~World();
+  World(const World&) = delete;
+  World& operator=(const World&) = delete;
+
+  void startDaemon();
+  void killDaemon() { daemon_ = Child(); }
+  pid_t daemon() const { return daemon_.pid(); }
+  std::string path(const char* name) const { return (root_ / name).string(); }
+  std::string socket() const { return path("run/relay.sock"); }
+  const Service& service() const { return service_; }
+
+ private:
+  std::filesystem::path root_;
+  Service service_;
+  Child daemon_;
+};
+
+/// A connection to the daemon with the D-Bus library alone.
+class Client {
+ public:
+  enum class Outcome { nothing, answer };
+
+  /// Returns when Configure is answered.
+  explicit Client(const std::string& socket);
+  ~Client();
+  Client(const Client&) = delete;
+  Client& operator=(const Client&) = delete;
+
+  /// A search with a query id of its own; fails unless it ends in `wanted`.
+  void search(const char* text, Outcome wanted);
+  /// The sizes of such a call's messages on the socket.
+  struct Sizes {
+    std::size_t request, reply;
+  };
+  Sizes sizes(const char* text, Outcome wanted);
+
+ private:
+  sd_bus* bus_ = nullptr;
+  std::uint64_t queryId_ = 0;
+};
+
+/// The floor of a call: the same numbers of bytes through a Unix socket, served by a process with
+/// one thread and a one-shot epoll set.
+class RawServer {
+ public:
+  RawServer(std::string path, Client::Sizes sizes);
+  pid_t pid() const { return process_.pid(); }
+  int connect() const;
+  /// One call.
+  void call(int socket) const;
+
+ private:
+  void serve() const;
+
+  std::string path_;
+  Client::Sizes sizes_;
+  int listener_;
+  Child process_;
+};
+
+/// Puts all threads of a process (0: of this one) on a processor, or back on all (-1).
+void pin(pid_t process, int processor);
+
+}  // namespace sable::bench
