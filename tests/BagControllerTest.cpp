@@ -19,6 +19,7 @@ class BagController : public testing::Test {
 
   /// The same device after its daemon was killed.
   void restart() {
+    restarted.reset();  // its log makes way for the next
     restarted = std::make_unique<VirtualDevice>();
     auto& files = restarted->platform.fileManager();
     for (const auto& directory : device.platform.fileManager().directories())
