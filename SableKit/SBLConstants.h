@@ -2,12 +2,14 @@
 
 #include <string_view>
 
+#include "platform/Subsystem.h"
+
 /// Names and values that the daemon, its clients and the service share. All leave the process.
 namespace sable {
 
 inline constexpr std::string_view kSBLErrorDomain = "SBLErrorDomain";
 inline constexpr std::string_view kSBLSabledNameVersion = "Sabled/1.0";
-inline constexpr std::string_view kSBLSubsystem = "com.kestrel.sabled";
+inline constexpr std::string_view kSBLSubsystem = platform::kSubsystem;
 /// The name under which clients find the daemon.
 inline constexpr std::string_view kSBLServiceName = kSBLSubsystem;
 /// Counts every search sent to the service, by any client.

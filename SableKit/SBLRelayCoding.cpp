@@ -107,13 +107,13 @@ std::optional<SBLAnyRequest> decodeAs(std::string_view className, const RelayRec
 RelayStringMap encodeHeaders(const HTTPHeaders& headers) {
   // A D-Bus dictionary has each key once: fields of one name are joined (RFC 9110 section 5.3).
   RelayStringMap map;
-  for (const auto& [name, value] : headers.fields()) {
-    const auto sameName = [&](const auto& entry) { return entry.first == name; };
-    const auto found = std::find_if(map.entries.begin(), map.entries.end(), sameName);
+  for (const auto& field : headers.fields()) {
+    const auto found =
+        std::ranges::find(map.entries, field.first, [](const auto& entry) { return entry.first; });
     if (found == map.entries.end()) {
-      map.entries.emplace_back(name, value);
+      map.entries.push_back(field);
     } else {
-      found->second.append(", ").append(value);
+      found->second.append(", ").append(field.second);
     }
   }
   return map;

@@ -5,13 +5,15 @@
 #include <atomic>
 #include <exception>
 
+#include "platform/Subsystem.h"
+
 namespace sable::platform {
 
 namespace {
 
 std::atomic<LogSink*> installedSink = nullptr;
 
-constinit const LogHandle platformHandle("com.kestrel.sabled", "Platform");
+constinit const LogHandle platformHandle(kSubsystem, "Platform");
 
 }  // namespace
 

@@ -102,7 +102,7 @@ const SBLNetworkRequestFactory::LocaleConventions& SBLNetworkRequestFactory::con
   contextAccessQueue_->assertIsCurrent();
   if (!context_.conventions) {
     const auto& locale = assembly_.platform.localeInfo();
-    LocaleConventions& made = context_.conventions.emplace();
+    LocaleConventions& made = context_.conventions.emplace(LocaleConventions{});
     made.localeCalendarIdentifier = locale.calendarIdentifier();
     made.localeMeasurementSystem = unitsName(locale.measurementSystem());
     made.tempUnits = locale.temperatureUnit().value_or("").substr(0, 1);

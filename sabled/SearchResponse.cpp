@@ -61,8 +61,9 @@ Expected<SearchResponse> SearchResponse::parse(const std::string& text) {
   auto failure = parser.allocate(std::max<std::size_t>(text.size(), 64), kMaximumJSONDepth);
   if (failure == simdjson::SUCCESS) failure = parser.parse(text).get(root);
   if (failure != simdjson::SUCCESS) {
-    return tl::unexpected(Error{std::string(kJSONErrorDomain), static_cast<std::int64_t>(JSONErrorCode::malformed),
-                               simdjson::error_message(failure)});
+    return tl::unexpected(Error{std::string(kJSONErrorDomain),
+                                static_cast<std::int64_t>(JSONErrorCode::malformed),
+                                simdjson::error_message(failure)});
   }
   SearchResponse response;
   response.isObject = root.type() == element_type::OBJECT;

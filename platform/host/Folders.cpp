@@ -6,11 +6,13 @@
 #include <array>
 #include <cstdlib>
 
+#include "platform/Subsystem.h"
+
 namespace sable::platform::host {
 
 namespace {
 
-constexpr const char* kName = "com.kestrel.sabled";
+constexpr std::string_view kName = kSubsystem;
 
 using Path = std::filesystem::path;
 
