@@ -28,8 +28,8 @@ bool isHangup(int error) {
 /// What a failure of the bus is to the log; a peer that just leaves is not worth a line.
 std::string reasonFor(int error) {
   if (isHangup(error)) return {};
-  if (error == -ENOBUFS) return "it does not read what it asked for";
-  if (error == -EMSGSIZE) return "its message is too large";
+  if (error == -EDQUOT) return "it does not read what it asked for";
+  if (error == -EMSGSIZE || error == -ENOBUFS) return "its message is too large";
   if (error == -EBADMSG) return "it sent what is no D-Bus message";
   return std::generic_category().message(-error);
 }

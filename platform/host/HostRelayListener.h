@@ -12,7 +12,8 @@ namespace sable::platform::host {
 class RelayAcceptor;
 struct RelayAdmission;
 
-/// A listening Unix socket. Destroying it takes the socket's file away.
+/// A listening Unix socket. Destroying it takes the socket's file away, and
+/// waits for an accept handler that runs on another thread.
 class HostRelayListener final : public RelayListener {
  public:
   enum class Kind {

@@ -31,10 +31,17 @@ void RelayAcceptor::start(Descriptor socket) {
 }
 
 void RelayAcceptor::stop() {
-  const std::lock_guard lock(mutex_);
-  retry_.cancel();
-  watch_.reset();
-  socket_ = Descriptor();
+  {
+    const std::lock_guard lock(mutex_);
+    retry_.cancel();
+    watch_.reset();
+    socket_ = Descriptor();
+  }
+  if (queue_->isCurrent()) {
+    stopped_ = true;
+  } else {
+    queue_->sync([this] { stopped_ = true; });
+  }
 }
 
 void RelayAcceptor::acceptAll() {
@@ -75,7 +82,7 @@ void RelayAcceptor::admit(Descriptor socket) {
   auto connection = std::make_shared<HostRelayConnection>(runtime_, std::move(socket), *peer,
                                                           RelayBus::Side::server, admission_.quotas);
   Function<void()> offer = [self = shared_from_this(), connection = std::move(connection)]() mutable {
-    if (self->handler_) self->handler_(std::move(connection));
+    if (self->handler_ && !self->stopped_) self->handler_(std::move(connection));
   };
   if (!queue_->tryRunInline(offer)) queue_->async(std::move(offer));
 }

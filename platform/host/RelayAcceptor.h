@@ -26,7 +26,7 @@ class RelayAcceptor final : public std::enable_shared_from_this<RelayAcceptor> {
   /// Before start().
   void setHandler(RelayListener::AcceptHandler handler) { handler_ = std::move(handler); }
   void start(Descriptor socket);
-  /// Accepts nobody from now on.
+  /// Accepts nobody from now on; waits for the handler where it runs on another thread.
   void stop();
 
  private:
@@ -38,7 +38,9 @@ class RelayAcceptor final : public std::enable_shared_from_this<RelayAcceptor> {
   HostRuntime& runtime_;
   const RelayAdmission admission_;
   const std::shared_ptr<HostQueue> queue_;
-  RelayListener::AcceptHandler handler_;  // called on queue_
+
+  RelayListener::AcceptHandler handler_;  // this and the next: on queue_
+  bool stopped_ = false;
 
   std::mutex mutex_;  // guards what follows
   Descriptor socket_;

@@ -66,7 +66,7 @@ bool RelayBus::messageGrowsTooLarge() {
 int RelayBus::send(RelayOutgoing outgoing) {
   if (ready_ && outbox_.empty() && !sdBusHoldsMessages()) return transmit(outgoing);
   const std::size_t size = relayWireSize(outgoing.arguments);
-  if (handedBytes_ + outboxBytes_ + size > quotas_.queuedBytes) return -ENOBUFS;
+  if (handedBytes_ + outboxBytes_ + size > quotas_.queuedBytes) return -EDQUOT;
   outboxBytes_ += size;
   outbox_.push_back(std::move(outgoing));
   return 0;

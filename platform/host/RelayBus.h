@@ -38,7 +38,7 @@ class RelayBus {
   /// more, and `message`, where set, has been received.
   [[nodiscard]] int process(RelayMessage& message);
 
-  /// Sends, or keeps until the peer has read what was sent before. -ENOBUFS: past the quota.
+  /// Sends, or keeps until the peer has read what was sent before. -EDQUOT: past the quota.
   [[nodiscard]] int send(RelayOutgoing outgoing);
 
   /// What to wait for on the socket.
