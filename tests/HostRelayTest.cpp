@@ -2,6 +2,7 @@
 #include <fcntl.h>
 #include <fmt/format.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <systemd/sd-bus.h>
@@ -185,7 +186,8 @@ TEST_F(HostRelayTest, AnyClientOfDBusFindsItsWay) {
   }
   EXPECT_EQ(ask(bus, path, "org.freedesktop.DBus.Properties", "GetAll", "s", "com.kestrel.Test"), "a{sv}");
   struct Case {
-    std::string answer, error;
+    std::string answer;
+    std::string error;
   };
   const char* properties = "org.freedesktop.DBus.Properties";
   for (const auto& [answer, error] : std::initializer_list<Case>{
@@ -319,7 +321,6 @@ TEST_F(HostRelayTest, AMessagePastTheLimitEndsItsConnection) {
   configuration_.quotas.messageBytes = 50'000;
   start();
   sd_bus* bus = connectBus();
-  const std::string bytes(49'000, 'b');
   for (const std::size_t size : {std::size_t{49'000}, std::size_t{50'001}}) {
     const std::string body(size, 'b');
     sd_bus_message* call = nullptr;
@@ -355,8 +356,10 @@ TEST_F(HostRelayTest, ConnectingAndLeavingLeavesNothingBehind) {
 TEST_F(HostRelayTest, ALackOfDescriptorsLosesNobody) {
   start();
   ASSERT_TRUE(stillServes());
-  std::vector<Descriptor> waiting;
-  for (int i = 0; i < 3; ++i) waiting.push_back(connectRaw());
+  rlimit limit{};
+  ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &limit), 0);
+  const rlimit low{std::min<rlim_t>(200, limit.rlim_max), limit.rlim_max};
+  ASSERT_EQ(setrlimit(RLIMIT_NOFILE, &low), 0);
   std::vector<Descriptor> hogs;
   for (;;) {
     Descriptor hog(open("/dev/null", O_RDONLY | O_CLOEXEC));
@@ -371,6 +374,7 @@ TEST_F(HostRelayTest, ALackOfDescriptorsLosesNobody) {
   shutdown(late.number(), SHUT_WR);
   EXPECT_NE(readAll(late.number()).find("ay"), std::string::npos);
   EXPECT_EQ(log_.count("cannot accept"), 1u);
+  setrlimit(RLIMIT_NOFILE, &limit);
 }
 
 TEST_F(HostRelayTest, TheSocketIsPrivateHeldByOneAndTakenOverFromTheDead) {

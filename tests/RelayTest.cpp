@@ -429,8 +429,8 @@ TEST_P(RelayContract, AStrangerIsRefusedBeforeAnybodyHearsOfHim) {
   const auto connection = world_->connectAsStranger(listener_->endpoint());
   ASSERT_TRUE(connection);
   (*connection)->setInvalidationHandler([heard = client_] { heard->add("ended"); });
-  (*connection)->resume();
   call(**connection, kFail);
+  (*connection)->resume();
   EXPECT_EQ(client_->next(2), (Lines{"The connection has ended", "ended"}));
   const std::lock_guard lock(mutex_);
   EXPECT_TRUE(served_.empty());

@@ -32,8 +32,12 @@ class SimulatedRelay::Listener final : public RelayListener {
   Listener(std::shared_ptr<State> state, std::shared_ptr<SerialQueue> queue, RelayEndpoint endpoint)
       : state_(std::move(state)), queue_(std::move(queue)), endpoint_(std::move(endpoint)) {}
   ~Listener() override {
-    const std::lock_guard lock(state_->mutex);
-    if (listening_) state_->listeners.erase(endpoint_);
+    {
+      const std::lock_guard lock(state_->mutex);
+      if (listening_) state_->listeners.erase(endpoint_);
+    }
+    if (!handler_ || queue_->isCurrent()) return;
+    queue_->sync([this] { *handler_ = nullptr; });
   }
 
   void setAcceptHandler(AcceptHandler handler) override {
