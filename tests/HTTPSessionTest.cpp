@@ -2,9 +2,14 @@
 #include <zlib.h>
 
 #include <filesystem>
+#include <functional>
+#include <nlohmann/json.hpp>
 
+#include "platform/ConfiguredServiceProxy.h"
 #include "platform/HTTPSession.h"
 #include "platform/host/HostHTTPSession.h"
+#include "platform/simulated/SimulatedHTTP.h"
+#include "platform/simulated/SimulatedRuntime.h"
 #include "tests/support/LoopbackServer.h"
 
 namespace sable::platform {
@@ -383,6 +388,131 @@ TEST_F(HostSession, IdleConnectionsAreClosedAndReplaced) {
   const auto patient = this->session();
   EXPECT_FALSE(load(*patient, request("/last")).error);
   EXPECT_EQ(*load(*patient, request("/ok")).data, "x");
+}
+
+class ScriptedSession : public ::testing::Test {
+ protected:
+  ScriptedSession() {
+    HTTPSessionConfiguration configuration;
+    configuration.label = "scripted";
+    configuration.maximumResponseBytes = 4;
+    session_ = sessions_.session(std::move(configuration));
+  }
+
+  static simulated::Scripted answer(int status, std::string body, int latencySeconds) {
+    simulated::Scripted answer;
+    answer.status = status;
+    answer.body = std::move(body);
+    answer.latency = std::chrono::seconds(latencySeconds);
+    return answer;
+  }
+
+  std::shared_ptr<HTTPDataTask> start(const std::string& url, const std::string& proxy = "") {
+    HTTPRequest request;
+    request.url = url;
+    request.timeout = 10;
+    const auto task = session_->dataTask(std::move(request), [this](HTTPResult result) {
+      EXPECT_TRUE(session_->callbackQueue().isCurrent());
+      results_.push_back(std::move(result));
+    });
+    if (!proxy.empty()) task->setProxy(proxy);
+    task->resume();
+    return task;
+  }
+
+  HTTPErrorCode lastCode() const {
+    return results_.back().error ? HTTPErrorCode{results_.back().error->code} : HTTPErrorCode{};
+  }
+
+  simulated::SimulatedRuntime runtime_;
+  simulated::SimulatedHTTPSessions sessions_{runtime_};
+  simulated::ScriptedService& service_ = sessions_.service();
+  std::unique_ptr<HTTPSession> session_;
+  std::vector<HTTPResult> results_;
+};
+
+TEST_F(ScriptedSession, AnswersComeByPathAfterTheirLatency) {
+  service_.setDefaultLatency(std::chrono::seconds(1));
+  service_.on("/s", answer(200, "s", 1));
+  service_.on("/search", answer(201, "long", 3));
+  start("http://h/search?q=/s", "http://proxy:1");
+  start("http://h/s/x");
+  start("http://h");
+  runtime_.advance(std::chrono::milliseconds(999));
+  EXPECT_TRUE(results_.empty());
+  runtime_.advance(std::chrono::milliseconds(1));
+  ASSERT_EQ(results_.size(), 2u);
+  EXPECT_EQ(results_[0].response->status + results_[1].response->status, 200 + 404);
+  runtime_.advance(std::chrono::seconds(2));
+  ASSERT_EQ(results_.size(), 3u);
+  EXPECT_EQ(*results_[2].data, "long");
+  EXPECT_EQ(results_[2].response->status, 201);
+  EXPECT_EQ(results_[2].timing.total, std::chrono::seconds(3));
+  EXPECT_TRUE(results_[2].timing.proxied);
+  EXPECT_EQ(service_.requests().size(), 3u);
+  ASSERT_EQ(service_.requests("/search").size(), 1u);
+  EXPECT_EQ(service_.requests("/search")[0].proxyURL, "http://proxy:1");
+  EXPECT_EQ(service_.requests("/search")[0].session, "scripted");
+}
+
+TEST_F(ScriptedSession, FaultsLimitsAndCancellingEndATaskOnce) {
+  service_.on("/long", answer(200, "12345", 1));
+  service_.on("/slow", answer(200, "", 10));
+  service_.failNext(2, HTTPErrorCode::connectionLost);
+  const struct {
+    std::string url;
+    HTTPErrorCode code;
+  } rows[] = {{"http://h/", HTTPErrorCode::connectionLost},
+              {"http://h/long", HTTPErrorCode::connectionLost},
+              {"http://h/long", HTTPErrorCode::responseTooLarge},
+              {"http://h/slow", HTTPErrorCode::timedOut},
+              {"h/", HTTPErrorCode::badURL},
+              {"ftp://h/", HTTPErrorCode::notAllowed}};
+  for (const auto& row : rows) {
+    const auto task = start(row.url);
+    task->resume();
+    runtime_.advance(std::chrono::seconds(10));
+    task->cancel();
+    runtime_.run();
+    EXPECT_EQ(lastCode(), row.code) << row.url;
+  }
+  EXPECT_EQ(*results_[2].data, "1234");
+  EXPECT_EQ(results_.size(), std::size(rows));
+  start("http://h/slow")->cancel();
+  runtime_.advance(std::chrono::minutes(1));
+  EXPECT_EQ(lastCode(), HTTPErrorCode::cancelled);
+  EXPECT_EQ(results_.size(), std::size(rows) + 1);
+}
+
+TEST_F(ScriptedSession, AConfiguredProxyCarriesTasks) {
+  ConfiguredServiceProxy proxies;
+  const auto task = [&] {
+    HTTPRequest request;
+    request.url = "http://h/";
+    return session_->dataTask(proxies.brambleRequest(std::move(request)), nullptr);
+  };
+  const auto set = [&](std::string_view client, std::string_view json) {
+    return proxies.setConfiguration(client, *parseJSON(json, 1000)).has_value();
+  };
+  EXPECT_FALSE(proxies.enable(*task()));
+  EXPECT_TRUE(set("b", R"({"proxy": "http://b:1", "enabled": true})"));
+  EXPECT_TRUE(set("a", R"({"proxy": "http://a:1", "enabled": false})"));
+  for (const char* unusable : {R"({"enabled": true})", R"({"proxy": "a:1", "enabled": true})",
+                               R"({"proxy": "ftp://a/"})", "[]", "\"http://a:1\""}) {
+    EXPECT_FALSE(set("b", unusable)) << unusable;
+  }
+  ASSERT_TRUE(proxies.isEnabled());
+  const auto proxied = task();
+  EXPECT_TRUE(proxies.enable(*proxied));
+  proxied->resume();
+  EXPECT_EQ(service_.requests().back().proxyURL, "http://b:1");
+  EXPECT_TRUE(service_.requests().back().request.proxied);
+  EXPECT_TRUE(set("b", R"({"enabled": false})"));
+  EXPECT_FALSE(proxies.isEnabled());
+  EXPECT_TRUE(set("b", R"({"proxy": "socks5h://b:1", "enabled": true})"));
+  EXPECT_TRUE(proxies.isEnabled());
+  EXPECT_TRUE(set("b", "null"));
+  EXPECT_FALSE(proxies.isEnabled());
 }
 
 }  // namespace

@@ -1,5 +1,6 @@
 #include "platform/host/CurlMulti.h"
 
+#include <fcntl.h>
 #include <sys/epoll.h>
 #include <unistd.h>
 
@@ -22,6 +23,21 @@ int actionFor(Events events) {
 }
 
 }  // namespace
+
+class CurlMulti::Duplicate {
+ public:
+  explicit Duplicate(int original) : descriptor_(::fcntl(original, F_DUPFD_CLOEXEC, 0)) {}
+  ~Duplicate() {
+    if (descriptor_ >= 0) ::close(descriptor_);
+  }
+  Duplicate(const Duplicate&) = delete;
+  Duplicate& operator=(const Duplicate&) = delete;
+
+  int descriptor() const { return descriptor_; }
+
+ private:
+  const int descriptor_;
+};
 
 void enter(HostQueue& queue, Function<void()> work) {
   if (!queue.tryRunInline(work)) queue.async(std::move(work));
@@ -58,10 +74,12 @@ int CurlMulti::socketChanged(CURL*, curl_socket_t descriptor, int what, void* co
   auto* self = static_cast<CurlMulti*>(context);
   const bool ends = what == CURL_POLL_REMOVE;
   Socket& socket = self->socketFor(descriptor);
-  if (ends && !socket.isConnection) {
-    self->sockets_.erase(descriptor);  // the resolver's, which libcurl closes right away
+  socket.wanted = ends ? 0 : eventsFor(what);
+  // Reading is asked for only when a connection stands.
+  if (socket.isConnection && (socket.wanted & EPOLLIN) != 0) socket.isConnected = true;
+  if (ends && !socket.isConnected) {
+    self->sockets_.erase(descriptor);
   } else {
-    socket.wanted = ends ? 0 : eventsFor(what);
     self->changed_.push_back(descriptor);
   }
   return 0;
@@ -75,8 +93,11 @@ int CurlMulti::timerChanged(CURLM*, long milliseconds, void* context) {
 }
 
 int CurlMulti::socketOpened(void* context, curl_socket_t descriptor, curlsocktype) {
-  static_cast<CurlMulti*>(context)->socketFor(descriptor).isConnection = true;
-  return CURL_SOCKOPT_OK;
+  auto* self = static_cast<CurlMulti*>(context);
+  self->sockets_.erase(descriptor);  // one whose end was not told
+  Socket& socket = self->socketFor(descriptor);
+  socket.isConnection = true;
+  return socket.watch ? CURL_SOCKOPT_OK : CURL_SOCKOPT_ERROR;
 }
 
 int CurlMulti::socketClosed(void* context, curl_socket_t descriptor) {
@@ -146,7 +167,7 @@ void CurlMulti::armSockets() {
     const auto found = sockets_.find(descriptor);
     if (found == sockets_.end()) continue;
     Socket& socket = found->second;
-    if (socket.wanted != socket.armed) socket.watch->arm(socket.armed = socket.wanted);
+    if (socket.watch && socket.wanted != socket.armed) socket.watch->arm(socket.armed = socket.wanted);
   }
   changed_.clear();
 }

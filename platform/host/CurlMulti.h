@@ -24,7 +24,9 @@ void enter(HostQueue& queue, Function<void()> work);
 ///         '------ arm <------ what libcurl waits for now
 ///
 /// A connection's watch outlives the transfer, for the next one on that connection, and is not armed
-/// in between: an idle connection wakes nobody.
+/// in between: an idle connection wakes nobody. What is watched is a duplicate, for libcurl closes
+/// some descriptors, such as that of a connection in the making, before it says so; by then the
+/// number may be somebody else's.
 class CurlMulti : public std::enable_shared_from_this<CurlMulti> {
  public:
   /// Called on the queue when a transfer has ended and is out of the multi handle. It must not add
@@ -43,12 +45,15 @@ class CurlMulti : public std::enable_shared_from_this<CurlMulti> {
   void remove(CURL* easy);
 
  private:
+  class Duplicate;
   struct Socket {
     std::uint64_t id = 0;
-    std::unique_ptr<Reactor::Watch> watch;
+    std::unique_ptr<Duplicate> duplicate;
+    std::unique_ptr<Reactor::Watch> watch;  // of the duplicate; null when there is none
     Events wanted = 0;
     Events armed = 0;
-    bool isConnection = false;  // closed through socketClosed()
+    bool isConnection = false;
+    bool isConnected = false;  // from now on its end is told through socketClosed()
   };
 
   static int socketChanged(CURL*, curl_socket_t descriptor, int what, void* self, void*);
