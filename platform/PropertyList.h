@@ -11,19 +11,18 @@ namespace sable::platform {
 inline constexpr std::string_view kPropertyListErrorDomain = "PropertyListErrorDomain";
 enum class PropertyListErrorCode : std::int64_t { notEncodable = 1, malformed = 2, tooLarge = 3 };
 
-/// Property lists of more bytes are refused, and such as unfold to more than eight times as much
-/// (one string may stand in many places).
+/// Property lists of more bytes are neither written nor read, nor are such read as unfold to more
+/// than eight times as much (one string may stand in many places).
 inline constexpr std::size_t kMaximumPropertyListBytes = 8u << 20;
 
-/// Binary property lists ("bplist00"). JSON null has no counterpart there: such members are left
-/// out of objects and arrays, and null alone is not encodable. Integers from INT64_MIN to
-/// INT64_MAX, doubles, booleans, strings, arrays and objects make the round trip exactly; an
-/// integer above INT64_MAX is written as the nearest double. A string that holds a NUL or is not
-/// UTF-8 is not encodable, nor is nesting beyond kMaximumJSONDepth.
+/// Writes a binary property list ("bplist00"). JSON null has no counterpart there: such members are
+/// left out of objects and arrays, and null alone is not encodable, nor is a string that is not
+/// UTF-8, nor nesting beyond kMaximumJSONDepth. Everything else makes the round trip exactly, 64-bit
+/// integers of either sign, doubles and the order of members included.
 Expected<std::string> encodePropertyList(const Dictionary& value);
 
 /// Reads any bytes safely. Dates read as numbers (seconds since 1970), data as base64 strings
-/// (RFC 4648 section 4), UIDs as integers; integers above INT64_MAX from other writers are exact.
+/// (RFC 4648 section 4), UIDs as integers.
 ///
 ///     offset        bytes  content
 ///     0             8      "bplist00"

@@ -9,10 +9,9 @@
 
 #include "platform/PropertyList.h"
 
-// libplist writes our property lists but does not read them: it follows references recursively and
-// copies what they name, so that 600 KiB of nested arrays take its stack, and 40 small objects that
-// name each other twice unfold into 2^40. A check that rules this out has to read the whole object
-// table; it may as well keep what it reads.
+// Not libplist: its reader follows references recursively and copies what they name, so that 600 KiB
+// of nested arrays take the stack, and 40 small objects that name each other twice unfold into 2^40.
+// A check that rules this out reads the whole object table; it may as well keep what it reads.
 
 namespace sable::platform {
 

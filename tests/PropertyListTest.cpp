@@ -39,6 +39,8 @@ TEST(PropertyListTest, WhatIsWrittenReadsTheSame) {
   for (const std::string_view text : {
            R"({"version":"12","enabled":true,"z":false,"a":[1,-5,0.1,"",{"é":"naïve 😀"},[],{}]})",
            R"([9223372036854775807,-9223372036854775808,0,255,256,65536,4294967296,-1])",
+           R"([9223372036854775808,18446744073709551615])",
+           R"({"a\u0000b":"c\u0000d"})",
            R"([1.5,-0.0,1e300,17.299999999999997])",
            R"(["the same","the same",{"k":"the same"}])",
            R"("a string alone that is longer than fifteen characters")",
@@ -52,23 +54,29 @@ TEST(PropertyListTest, WhatIsWrittenReadsTheSame) {
   }
 }
 
-TEST(PropertyListTest, WhatHasNoCounterpartIsLeftOutRoundedOrRefused) {
+TEST(PropertyListTest, WhatHasNoCounterpartIsLeftOutOrRefused) {
   EXPECT_EQ(*decodePropertyList(*encodePropertyList(json(R"({"a":null,"b":[null,1]})"))),
             json(R"({"b":[1]})"));
-  const auto rounded =
-      *decodePropertyList(*encodePropertyList(json("[18446744073709551615,9223372036854775808]")));
-  EXPECT_EQ(rounded, json("[18446744073709551616.0,9223372036854775808.0]"));
-
   Dictionary deep = 1;
   for (int i = 0; i < kMaximumJSONDepth; ++i) deep = Dictionary::array({std::move(deep)});
   EXPECT_EQ(*decodePropertyList(*encodePropertyList(deep)), deep);
   deep = Dictionary::array({std::move(deep)});
-  for (const Dictionary& value :
-       {json("null"), json(R"(["a\u0000b"])"), json(R"({"a\u0000b":1})"), Dictionary("\xff"), deep}) {
+  for (const Dictionary& value : {json("null"), Dictionary("\xff"), Dictionary({{"\xff", 1}}), deep}) {
     const auto refused = encodePropertyList(value);
     ASSERT_FALSE(refused);
     EXPECT_EQ(refused.error().code, static_cast<std::int64_t>(PropertyListErrorCode::notEncodable));
   }
+}
+
+TEST(PropertyListTest, WritesTheShortestFormOfEachAndEqualStringsOnce) {
+  EXPECT_EQ(*encodePropertyList(json(R"([255,256,"é","x","x",true])")),
+            propertyList({}).substr(0, 8) + "\xA6\x01\x02\x03\x04\x04\x05" + "\x10\xFF" +
+                std::string("\x11\x01\x00", 3) + std::string("\x61\x00\xE9", 3) + "\x51x" + "\x09" +
+                "\x08\x0F\x11\x14\x17\x19" + std::string(6, '\0') + "\x01\x01" + bigEndian(6, 8) +
+                bigEndian(0, 8) + bigEndian(26, 8));
+  const Dictionary large(std::string(kMaximumPropertyListBytes, 'x'));
+  EXPECT_EQ(encodePropertyList(large).error().code,
+            static_cast<std::int64_t>(PropertyListErrorCode::tooLarge));
 }
 
 TEST(PropertyListTest, ReadsWhatOtherWritersWrite) {
