@@ -16,5 +16,5 @@ if(header_sources)
   add_library(headers OBJECT EXCLUDE_FROM_ALL ${header_sources})
   target_include_directories(headers PRIVATE ${PROJECT_SOURCE_DIR}/tools/sable-service)
   target_link_libraries(headers PRIVATE test_support CURL::libcurl SQLite::SQLite3 OpenSSL::Crypto CLI11::CLI11
-    PkgConfig::SYSTEMD PkgConfig::PLIST PkgConfig::ICU PkgConfig::TOMLPLUSPLUS PkgConfig::SIMDJSON)
+    PkgConfig::SYSTEMD PkgConfig::ICU PkgConfig::TOMLPLUSPLUS PkgConfig::SIMDJSON)
 endif()

@@ -167,6 +167,7 @@ std::vector<Availability> HostPlatform::availability() {
   auto& tallyFile = facilities_->tally.get(facilities_->folders.counters());
   return {
       {"counters", tallyFile.isPersistent(), facilities_->folders.counters().string()},
+      {"maps service", mapsService().userSessionEntity(false).has_value(), "geo_session_id of the facts"},
       facilities_->notify.get(facilities_->runtime).availability(),
       facilities_->memoryPressure.get(facilities_->runtime.reactor()).availability(),
   };
