@@ -3,6 +3,7 @@
 #include <fmt/format.h>
 
 #include <algorithm>
+#include <cmath>
 #include <nlohmann/json.hpp>
 
 #include "SableKit/SBLError.h"
@@ -116,7 +117,7 @@ Dictionary answerDocument(const Answer& answer) {
   return {{"query_id", answer.queryId},
           {"reply", answer.reply ? replyDocument(answer) : Dictionary(nullptr)},
           {"error", answer.error ? encodeErrorForJSON(*answer.error) : Dictionary(nullptr)},
-          {"milliseconds", answer.milliseconds}};
+          {"milliseconds", std::round(answer.milliseconds * 1e3) / 1e3}};
 }
 
 std::optional<std::string> sourceOf(const Answer& answer) {
@@ -132,11 +133,9 @@ std::optional<std::string> bestCompletion(const Answer& answer) {
 
 std::vector<std::string> answerLines(const Output& output, const Answer& answer) {
   std::vector<std::string> lines{headerLine(output, answer)};
-  if (answer.error) {
-    lines.push_back(output.paint(Colour::red, "error: " + printable(answer.error->description())));
-  } else if (answer.reply) {
+  if (answer.reply) {
     addData(lines, output, answer);
-  } else {
+  } else if (!answer.error) {
     lines.emplace_back("no reply: superseded, too short, or the bag does not allow it");
   }
   return lines;

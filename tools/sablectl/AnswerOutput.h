@@ -20,7 +20,7 @@ std::optional<std::string> sourceOf(const Answer& answer);
 /// The completed query of the first result set; nullopt when the reply has none.
 std::optional<std::string> bestCompletion(const Answer& answer);
 
-/// The whole answer for a person, as lines.
+/// The answer for a person, as lines; its error is told elsewhere.
 std::vector<std::string> answerLines(const Output& output, const Answer& answer);
 
 }  // namespace sable::sablectl

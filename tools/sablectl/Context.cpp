@@ -3,6 +3,7 @@
 #include <fmt/format.h>
 
 #include <nlohmann/json.hpp>
+#include <system_error>
 
 #include "SableKit/SBLConstants.h"
 #include "SableKit/SBLError.h"
@@ -21,12 +22,12 @@ ExitCode withSession(const Context& context, const std::function<ExitCode(Sessio
   if (context.output.json) context.output.document({{"error", encodeErrorForJSON(connected.error())}});
   complain(
       fmt::format("no daemon at {} ({}); start it with \"sabled\" or \"systemctl --user start {}.socket\"",
-                  context.host.socket.string(), connected.error().reason, kSBLSubsystem));
+                  context.host.socket.string(),
+                  std::generic_category().message(static_cast<int>(connected.error().code)), kSBLSubsystem));
   return kExitNoDaemon;
 }
 
-ExitCode fail(const Context& context, const Error& error) {
-  if (context.output.json) context.output.document({{"error", encodeErrorForJSON(error)}});
+ExitCode complainOf(const Context& context, const Error& error) {
   const ExitCode code = exitCodeFor(error);
   if (code == kExitTimeout) {
     complain(fmt::format("no answer within {:g} s", context.options.timeout));
@@ -34,6 +35,11 @@ ExitCode fail(const Context& context, const Error& error) {
     complain(error.description());
   }
   return code;
+}
+
+ExitCode fail(const Context& context, const Error& error) {
+  if (context.output.json) context.output.document({{"error", encodeErrorForJSON(error)}});
+  return complainOf(context, error);
 }
 
 }  // namespace sable::sablectl

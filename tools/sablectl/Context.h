@@ -32,7 +32,9 @@ using Command = std::function<ExitCode(const Context&)>;
 /// mend it.
 ExitCode withSession(const Context& context, const std::function<ExitCode(Session&)>& use);
 
-/// Prints an error, for a person on standard error; says what to exit with.
+/// Tells an error on standard error; says what to exit with.
+ExitCode complainOf(const Context& context, const Error& error);
+/// The same, and as JSON on standard output where that is asked for: all that a command has to say.
 ExitCode fail(const Context& context, const Error& error);
 
 }  // namespace sable::sablectl

@@ -12,20 +12,13 @@
 namespace sable::sablectl {
 namespace {
 
-ExitCode exitCodeOf(const Context& context, const Answer& answer) {
-  if (!answer.error) return kExitSuccess;
-  const ExitCode code = exitCodeFor(*answer.error);
-  if (code == kExitTimeout) complain(fmt::format("no answer within {:g} s", context.options.timeout));
-  return code;
-}
-
 ExitCode show(const Context& context, const Answer& answer) {
   if (context.output.json) {
     context.output.document(answerDocument(answer));
   } else {
     for (const std::string& line : answerLines(context.output, answer)) context.output.line(line);
   }
-  return exitCodeOf(context, answer);
+  return answer.error ? complainOf(context, *answer.error) : kExitSuccess;
 }
 
 /// The rows of `type`: known widths, for a row is shown as soon as its answer is there.
@@ -100,7 +93,7 @@ ExitCode runType(const Context& context, SBLSearchRequest request) {
       const Answer answer = session.request(request);
       ++request.queryId;
       rows.show(request.queryString, answer);
-      if (const ExitCode code = exitCodeOf(context, answer); code != kExitSuccess) worst = code;
+      if (answer.error) worst = exitCodeFor(*answer.error);
       if (worst == kExitTimeout) break;
     }
     rows.summarize();

@@ -1,8 +1,7 @@
-#include <fmt/chrono.h>
 #include <fmt/format.h>
 
 #include <chrono>
-#include <cmath>
+#include <cstdlib>
 #include <nlohmann/json.hpp>
 
 #include "SableKit/SBLError.h"
@@ -74,8 +73,8 @@ Dictionary placesStatus(const Host& host) {
   return places;
 }
 
-double secondsBetween(platform::WallTime from, platform::WallTime to) {
-  return std::round(platform::toSeconds(to - from));
+std::int64_t secondsBetween(platform::WallTime from, platform::WallTime to) {
+  return std::chrono::round<std::chrono::seconds>(to - from).count();
 }
 
 Dictionary bagStatus(const Host& host) {
@@ -115,8 +114,8 @@ Dictionary facilitiesStatus(const Host& host) {
 }
 
 /// "3 h 59 min", "12 s": the two largest units.
-std::string duration(double seconds) {
-  const auto whole = static_cast<long long>(std::fabs(seconds));
+std::string duration(std::int64_t seconds) {
+  const std::int64_t whole = std::abs(seconds);
   if (whole >= 86400) return fmt::format("{} d {} h", whole / 86400, whole % 86400 / 3600);
   if (whole >= 3600) return fmt::format("{} h {} min", whole / 3600, whole % 3600 / 60);
   if (whole >= 60) return fmt::format("{} min {} s", whole / 60, whole % 60);
@@ -126,8 +125,8 @@ std::string duration(double seconds) {
 std::string bagText(const Dictionary& bag) {
   if (bag.contains("error")) return "cannot be read: " + plainText(bag["error"]);
   std::string text = "version " + plainText(bag["version"]);
-  if (const auto age = numberMember(bag, "age_seconds")) text += fmt::format(", {} old", duration(*age));
-  if (const auto rest = numberMember(bag, "expires_in_seconds"))
+  if (const auto age = integerMember(bag, "age_seconds")) text += fmt::format(", {} old", duration(*age));
+  if (const auto rest = integerMember(bag, "expires_in_seconds"))
     text += *rest < 0 ? fmt::format(", expired {} ago", duration(*rest))
                       : fmt::format(", expires in {}", duration(*rest));
   return text;
