@@ -4,6 +4,7 @@
 #include <vector>
 
 #include "SableKit/SBLConstants.h"
+#include "platform/host/Allocation.h"
 #include "platform/host/ConfigurationSchema.h"
 #include "platform/host/Folders.h"
 #include "platform/host/HostLog.h"
@@ -50,6 +51,7 @@ int checkConfiguration() {
 }
 
 int run(const Options& options) {
+  sable::platform::host::shareOneHeap();
   sable::platform::host::HostLog log(options.logLevel, options.logCategories);
   sable::platform::installLogSink(&log);
   sable::platform::host::HostPlatform platform({.socketPath = options.socket});

@@ -64,16 +64,11 @@ Child::~Child() {
   ::waitpid(pid_, nullptr, 0);
 }
 
-void pin(pid_t process, int processor) {
+void useProcessor(int number) {
   cpu_set_t set;
   CPU_ZERO(&set);
-  for (int each = 0; each < CPU_SETSIZE; ++each) {
-    if (processor < 0 || each == processor) CPU_SET(static_cast<std::size_t>(each), &set);
-  }
-  const std::string tasks = fmt::format("/proc/{}/task", process == 0 ? ::getpid() : process);
-  for (const auto& task : std::filesystem::directory_iterator(tasks)) {
-    ::sched_setaffinity(std::stoi(task.path().filename()), sizeof set, &set);
-  }
+  CPU_SET(static_cast<std::size_t>(number), &set);
+  ::sched_setaffinity(0, sizeof set, &set);
 }
 
 }  // namespace sable::bench

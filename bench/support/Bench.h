@@ -126,7 +126,6 @@ class Client {
 class RawServer {
  public:
   RawServer(std::string path, Client::Sizes sizes);
-  pid_t pid() const { return process_.pid(); }
   int connect() const;
   /// One call.
   void call(int socket) const;
@@ -140,7 +139,7 @@ class RawServer {
   Child process_;
 };
 
-/// Puts all threads of a process (0: of this one) on a processor, or back on all (-1).
-void pin(pid_t process, int processor);
+/// Puts this thread, and what it starts from now on, on one processor.
+void useProcessor(int number);
 
 }  // namespace sable::bench

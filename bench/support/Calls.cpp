@@ -110,7 +110,6 @@ Client::Sizes Client::sizes(const char* text, Outcome wanted) {
   check(sd_bus_send(bus_, call, &cookie), "send");
   check(sd_bus_flush(bus_), "flush");
   const Sizes sizes{requestSize(text), waitingBytes(sd_bus_get_fd(bus_))};
-  fprintf(stderr, "sizes %zu %zu\n", sizes.request, sizes.reply);
   sd_bus_message_unref(call);
   while (sd_bus_process(bus_, nullptr) > 0) continue;
   return sizes;
