@@ -117,7 +117,7 @@ TEST_F(Requests, ZeroKeywordIsASearchWithoutAQuery) {
 
 TEST_F(Requests, ALookupTellsWhereItComesFrom) {
   const json request =
-      only("/search", {"lookup", "Schmetterling", "--context",
+      only("/search", {"lookup", "ちょうちょ", "--context",
                        "Der Schmetterling flog über die Wiese und den Garten hinweg", "--app",
                        "org.example.Reader", "--domain", "nature", "--selection", "2"});
   EXPECT_EQ(items(request), (Pairs{{"cc", "GB"},
@@ -130,8 +130,8 @@ TEST_F(Requests, ALookupTellsWhereItComesFrom) {
                                    {"locale", "en_GB"},
                                    {"ltype", "hint"},
                                    {"mode", "managed"},
-                                   {"q", "Schmetterling"},
-                                   {"qlang", "de"},
+                                   {"q", "ちょうちょ"},
+                                   {"qlang", "ja"},
                                    {"storefront", "143444"}}));
   EXPECT_EQ(headers(request), (Pairs{{"User-Agent", kAgent},
                                      {"X-Kestrel-GeoMetadata", "meta-1"},
