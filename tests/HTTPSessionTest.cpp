@@ -351,6 +351,19 @@ TEST_F(HostSession, ATaskEndsOnceWhateverIsAskedOfIt) {
                                 HTTPErrorCode::cancelled}));
 }
 
+TEST_F(HostSession, CancellingWhileConnectingHarmsNoLaterTask) {
+  server_.on("/ok", LoopbackServer::ok("x"));
+  for (int i = 0; i < 30; ++i) {
+    const auto session = this->session();
+    const auto task = session->dataTask(request("/ok"), nullptr);
+    task->resume();
+    task->cancel();
+    HTTPRequest next = request("/ok");
+    next.timeout = 10;
+    EXPECT_FALSE(load(*session, std::move(next)).error);
+  }
+}
+
 TEST_F(HostSession, ManyTasksFromManyThreadsShareAFewConnections) {
   server_.on("/n", [](const std::string& request) {
     return LoopbackServer::Reply{LoopbackServer::ok(request.substr(0, request.find(" HTTP")))};
