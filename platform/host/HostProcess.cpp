@@ -106,7 +106,10 @@ class HostProcess::Source final : public SignalSource {
   bool resumed_ = false;
 };
 
-HostProcess::HostProcess(Reactor& reactor) : reactor_(reactor) {}
+HostProcess::HostProcess(Reactor& reactor) : reactor_(reactor) {
+  // A peer that has gone is a failed write, never the end of the process.
+  ::signal(SIGPIPE, SIG_IGN);
+}
 
 HostProcess::~HostProcess() = default;
 
