@@ -67,6 +67,11 @@ toml::array tomlArray(const Dictionary& list);
 
 toml::table tomlTable(const Dictionary& object);
 
+bool isTOMLInteger(const Dictionary& value) {
+  if (value.is_number_unsigned()) return std::in_range<std::int64_t>(value.get<std::uint64_t>());
+  return value.is_number_integer();
+}
+
 /// Hands the TOML counterpart of `value` to `use`, or nothing for null.
 template <class Use>
 void withNode(const Dictionary& value, Use use) {
@@ -78,11 +83,9 @@ void withNode(const Dictionary& value, Use use) {
     use(value.get<std::string>());
   } else if (value.is_boolean()) {
     use(value.get<bool>());
-  } else if (value.is_number_unsigned() && !std::in_range<std::int64_t>(value.get<std::uint64_t>())) {
-    use(value.get<double>());
-  } else if (value.is_number_integer()) {
+  } else if (isTOMLInteger(value)) {
     use(value.get<std::int64_t>());
-  } else if (value.is_number_float()) {
+  } else if (value.is_number()) {
     use(value.get<double>());
   }
 }
@@ -98,7 +101,8 @@ toml::array tomlArray(const Dictionary& list) {
 toml::table tomlTable(const Dictionary& object) {
   toml::table table;
   for (const auto& [key, value] : object.items()) {
-    withNode(value, [&](auto&& node) { table.insert(key, std::forward<decltype(node)>(node)); });
+    withNode(value,
+             [&, &name = key](auto&& node) { table.insert(name, std::forward<decltype(node)>(node)); });
   }
   return table;
 }
@@ -128,7 +132,8 @@ std::string formatTOML(const TOMLContent& content) {
     if (entry.date) {
       table.insert(key, tomlDate(*entry.date));
     } else {
-      withNode(*entry.value, [&](auto&& node) { table.insert(key, std::forward<decltype(node)>(node)); });
+      withNode(*entry.value,
+               [&, &name = key](auto&& node) { table.insert(name, std::forward<decltype(node)>(node)); });
     }
   }
   std::ostringstream text;
