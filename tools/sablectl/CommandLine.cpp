@@ -3,7 +3,6 @@
 #include <CLI/CLI.hpp>
 #include <memory>
 
-#include "SableKit/SBLConstants.h"
 #include "SableKit/SBLRelayCoding.h"
 #include "tools/sablectl/Commands.h"
 #include "tools/sablectl/RequestRecord.h"
@@ -62,7 +61,7 @@ CLI::App& addRequest(CLI::App& app, Invocation& invocation, const char* name, co
 }
 
 void addText(CLI::App& command, const char* name, std::string& value, const char* description) {
-  command.add_option(name, value, description)->required();
+  command.add_option(name, value, description)->required()->type_name("");
 }
 
 void addSearches(CLI::App& app, Invocation& invocation) {
@@ -124,7 +123,8 @@ void addAnyRequest(CLI::App& app, Invocation& invocation) {
   const auto words = std::make_shared<Words>();
   CLI::App& command = *app.add_subcommand("request", "Send any request record");
   addText(command, "CLASS", words->className, "The record's class");
-  command.add_option("MEMBER", words->members, "Members as NAME=VALUE; queryItems.NAME=VALUE adds an item");
+  command.add_option("MEMBER", words->members, "Members as NAME=VALUE; queryItems.NAME=VALUE adds an item")
+      ->type_name("");
   command.callback([&invocation, words] {
     auto record = requestRecord(words->members);
     if (!record) throw CLI::ValidationError(record.error().reason);
@@ -160,7 +160,6 @@ void addQuestions(CLI::App& app, Invocation& invocation) {
 }
 
 void addOptions(CLI::App& app, Options& options) {
-  app.set_version_flag("--version", std::string(kSBLSabledNameVersion));
   app.add_option("--socket", options.socket, "The daemon's socket")->type_name("PATH");
   app.add_option("--identifier", options.identifier, "The client's identifier")
       ->capture_default_str()

@@ -132,7 +132,7 @@ std::string bagText(const Dictionary& bag) {
   return text;
 }
 
-std::string processText(const Dictionary& daemon) {
+std::string openerText(const Dictionary& daemon) {
   if (daemon["pid"].is_null()) return "unknown";
   const Dictionary& executable = daemon["executable"];
   return fmt::format("{} ({})", daemon["pid"].get<std::int64_t>(),
@@ -150,7 +150,7 @@ void print(const Output& output, const Dictionary& status) {
   const bool answers = daemon["answers"].get<bool>();
   section("Daemon", {{"socket", plainText(daemon["socket"])},
                      {"answers", answers ? "yes" : "no: " + plainText(daemon["error"]["reason"])},
-                     {"process", processText(daemon)}});
+                     {"opened by", openerText(daemon)}});
   section("Bag", {{"kept", bagText(status["bag"])}, {"file", plainText(status["bag"]["file"])}});
   Rows places;
   for (const Dictionary& place : status["places"]) {

@@ -1,3 +1,5 @@
+#include <cstdio>
+
 #include "platform/host/Folders.h"
 #include "platform/host/HostFileManager.h"
 #include "platform/host/HostMemoryPressure.h"
@@ -52,7 +54,10 @@ ExitCode run(const Invocation& invocation) {
       .availability = [&runtime] { return probe(runtime); },
   };
   const Output output = Output::standard(invocation.options.json);
-  return invocation.command({machine, invocation.options, output});
+  const ExitCode code = invocation.command({machine, invocation.options, output});
+  if (std::ferror(stdout) == 0) return code;
+  complain("standard output could not be written");
+  return kExitError;
 }
 
 }  // namespace
