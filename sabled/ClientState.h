@@ -18,10 +18,6 @@ class ClientSessionManager;
 class SBLBag;
 class SableUserGUIDController;
 
-/// Why a query was not sent to the service. The values leave the device in feedback: never
-/// renumber.
-enum class SkipSearchTrigger { queryTooShort = 1, bagDisabled = 2, bagFetchFailed = 3, cacheHit = 4 };
-
 /// Everything the daemon keeps for one client session identifier, shared by all connections that
 /// present it, for the life of the process; and the road of each kind of query. Operations run on
 /// the caller's queue and block it for at most the second that the first bag may take. Replies
