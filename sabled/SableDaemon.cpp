@@ -33,6 +33,7 @@ Expected<void> SableDaemon::start() {
   loadBagEarly();
   postStartup();
   installSignalHandlers();
+  logAvailability();
   return {};
 }
 
@@ -80,6 +81,15 @@ void SableDaemon::loadBagEarly() {
 void SableDaemon::postStartup() {
   assembly_.runtime.globalQueue(QualityOfService::standard).async([this] {
     assembly_.notificationCenter.post({"SBLStartup", nullptr, {}});
+  });
+}
+
+void SableDaemon::logAvailability() {
+  assembly_.runtime.globalQueue(QualityOfService::background).async([this] {
+    for (const platform::Availability& facility : platform_.availability()) {
+      SableDefaultLog().info("{} {}: {}", facility.facility, facility.available ? "available" : "not available",
+                             facility.detail);
+    }
   });
 }
 

@@ -32,6 +32,7 @@ class SableDaemon {
   void loadBagEarly();
   void postStartup();
   void installSignalHandlers();
+  void logAvailability();
 
   platform::Platform& platform_;
   Assembly assembly_;
