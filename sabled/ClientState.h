@@ -71,7 +71,7 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   bool passesGates(Query& query);
   void dispatch(const std::shared_ptr<Query>& query, std::optional<platform::HTTPRequest> request);
   void didComplete(Query& query, platform::HTTPResult result);
-  void processAnswer(const Query& query, const std::string& body, std::optional<Error>& parseError);
+  std::optional<Error> processAnswer(const Query& query, const std::string& body);
   bool routesThroughProxy(const Query& query) const;
   void enableProxy(platform::HTTPDataTask& task) const;
   void recordSearchResult(int status);

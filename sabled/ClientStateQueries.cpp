@@ -255,8 +255,7 @@ void ClientState::didComplete(Query& query, HTTPResult result) {
                        makeSBLError(SBLErrorCode::daemonSide, "invalid response class"));
   }
 
-  std::optional<Error> parseError;
-  processAnswer(query, *result.data, parseError);
+  std::optional<Error> parseError = processAnswer(query, *result.data);
   SBLReply reply;
   reply.scale = query.scale;
   reply.data = std::move(result.data);
@@ -271,20 +270,18 @@ void ClientState::didComplete(Query& query, HTTPResult result) {
   if (&query.kind == &kSearch) forceFetch(query.httpRequest);
 }
 
-void ClientState::processAnswer(const Query& query, const std::string& body,
-                                std::optional<Error>& parseError) {
+/// Takes from an answer what concerns the daemon; says why it is no JSON, if it is none.
+std::optional<Error> ClientState::processAnswer(const Query& query, const std::string& body) {
   const auto response = SearchResponse::parse(body);
-  if (response) {
-    assembly_.clientStateManager->processImagesFromResponse(*response, *query.bag);
-  } else {
-    parseError = response.error();
-  }
+  const std::optional<Error> parseError = response ? std::nullopt : std::optional(response.error());
+  if (response) assembly_.clientStateManager->processImagesFromResponse(*response, *query.bag);
   if (query.kind.expectsObject && (!response || !response->isObject)) {
     // The missing word after "for" is part of the line that log readers match.
     query.log().error(
         "Failed to deserialize card details for into a dictionary. Error: {}. Response data: \"{}\"",
         parseError ? parseError->description() : "(null)", body);
   }
+  return parseError;
 }
 
 void ClientState::recordSearchResult(int status) {

@@ -87,8 +87,8 @@ void SableDaemon::postStartup() {
 void SableDaemon::logAvailability() {
   assembly_.runtime.globalQueue(QualityOfService::background).async([this] {
     for (const platform::Availability& facility : platform_.availability()) {
-      SableDefaultLog().info("{} {}: {}", facility.facility, facility.available ? "available" : "not available",
-                             facility.detail);
+      SableDefaultLog().info("{} {}: {}", facility.facility,
+                             facility.available ? "available" : "not available", facility.detail);
     }
   });
 }
