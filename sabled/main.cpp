@@ -55,6 +55,7 @@ int run(const Options& options) {
   sable::platform::host::HostLog log(options.logLevel, options.logCategories);
   sable::platform::installLogSink(&log);
   sable::platform::host::HostPlatform platform({.socketPath = options.socket});
+  if (!platform.configurationIsReadable()) platform.process().exit(kExitUsage);
   sable::SableDaemon daemon(platform);
   if (const auto started = daemon.start(); !started) {
     std::fprintf(stderr, "sabled: %s\n", started.error().reason.c_str());

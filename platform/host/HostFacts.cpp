@@ -96,6 +96,11 @@ void HostFacts::reload() {
   }
 }
 
+bool HostFacts::areReadable() {
+  const std::lock_guard turn(reloading_);
+  return !system_.file.isDamaged() && !user_.file.isDamaged();
+}
+
 std::vector<std::string> HostFacts::answers() const {
   const auto current = facts();
   std::vector<std::string> all;

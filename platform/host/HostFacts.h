@@ -30,6 +30,9 @@ class HostFacts {
             NotificationCenter& notificationCenter);
   ~HostFacts();
 
+  /// Whether the facts files could be read when they were last looked at.
+  bool areReadable();
+
   std::optional<std::string> string(std::string_view key) const;
   std::optional<bool> boolean(std::string_view key) const;
   std::optional<std::int64_t> integer(std::string_view key) const;

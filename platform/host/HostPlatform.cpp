@@ -51,6 +51,9 @@ struct HostPlatform::Facilities {
   explicit Facilities(HostPlatformConfiguration configuration)
       : socketPath(std::move(configuration.socketPath)) {}
 
+  TOMLUserDefaults& settings() {
+    return userDefaults.get(folders, runtime, runtime.reactor(), fileManager);
+  }
   HostFacts& hostFacts() { return facts.get(folders, HostSources{}, runtime.reactor(), notificationCenter); }
 
   const std::filesystem::path socketPath;
@@ -83,6 +86,12 @@ HostPlatform::HostPlatform(HostPlatformConfiguration configuration)
 
 HostPlatform::~HostPlatform() = default;
 
+bool HostPlatform::configurationIsReadable() {
+  // Both are read, so that both are reported.
+  const bool settings = facilities_->settings().isReadable(), facts = facilities_->hostFacts().areReadable();
+  return settings && facts;
+}
+
 Runtime& HostPlatform::runtime() {
   return facilities_->runtime;
 }
@@ -107,8 +116,7 @@ Tally& HostPlatform::tally() {
 }
 
 UserDefaults& HostPlatform::userDefaults() {
-  auto& all = *facilities_;
-  return all.userDefaults.get(all.folders, all.runtime, all.runtime.reactor(), all.fileManager);
+  return facilities_->settings();
 }
 
 Notify& HostPlatform::notify() {

@@ -19,6 +19,9 @@ class HostPlatform final : public Platform {
   explicit HostPlatform(HostPlatformConfiguration configuration = {});
   ~HostPlatform() override;
 
+  /// Whether settings and facts can be read; the log tells which file cannot, and where.
+  bool configurationIsReadable();
+
   Runtime& runtime() override;
   Process& process() override;
   Tally& tally() override;

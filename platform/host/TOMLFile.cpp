@@ -150,11 +150,15 @@ Expected<std::string> readTOMLText(const std::filesystem::path& path, bool* exis
   return readWhole(*file, path, kMaximumBytes);
 }
 
+void TOMLFile::report(std::string_view problem) const {
+  platformLog().error("{}{}", problem, content_.empty() ? "" : "; its last good content stays");
+}
+
 bool TOMLFile::reload() {
   auto text = readTOMLText(path_);
   if (!text) {
     if (!std::exchange(damaged_, true)) {
-      platformLog().error("{}; its last good content stays", text.error().reason);
+      report(text.error().reason);
     }
     return false;
   }
@@ -163,7 +167,7 @@ bool TOMLFile::reload() {
   auto content = parseTOML(text_);
   damaged_ = !content.has_value();
   if (damaged_) {
-    platformLog().error("{}:{}; its last good content stays", path_.native(), content.error().reason);
+    report(fmt::format("{}:{}", path_.native(), content.error().reason));
     return false;
   }
   content_ = *std::move(content);

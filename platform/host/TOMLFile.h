@@ -50,6 +50,8 @@ class TOMLFile {
   bool isDamaged() const { return damaged_; }
 
  private:
+  void report(std::string_view problem) const;
+
   std::filesystem::path path_;
   std::string text_;  ///< as last read, good or not
   TOMLContent content_;

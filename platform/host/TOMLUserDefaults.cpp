@@ -44,6 +44,11 @@ class TOMLUserDefaults::Store : public std::enable_shared_from_this<Store> {
     reload();
   }
 
+  bool isReadable() const {
+    const std::shared_lock lock(mutex_);
+    return !profile_.isDamaged() && !user_.isDamaged();
+  }
+
   void registerDefaults(const Dictionary& object) {
     const std::unique_lock lock(mutex_);
     for (const auto& [key, value] : object.items()) {
@@ -166,6 +171,10 @@ TOMLUserDefaults::TOMLUserDefaults(const Folders& folders, Runtime& runtime, Rea
 
 TOMLUserDefaults::~TOMLUserDefaults() {
   store_->write();
+}
+
+bool TOMLUserDefaults::isReadable() const {
+  return store_->isReadable();
 }
 
 void TOMLUserDefaults::registerDefaults(const Dictionary& object) {

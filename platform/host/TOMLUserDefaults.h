@@ -19,6 +19,9 @@ class TOMLUserDefaults final : public UserDefaults {
   /// Writes what is pending.
   ~TOMLUserDefaults() override;
 
+  /// Whether a file that people write could be read when it was last looked at.
+  bool isReadable() const;
+
   void registerDefaults(const Dictionary& object) override;
 
   std::optional<bool> boolean(std::string_view key) const override;
