@@ -28,7 +28,10 @@ Expected<void> SableDaemon::start() {
   SBLTracingSetup(assembly_.userDefaults);
   registerDefaults();
   createServices();
-  if (auto opened = openListener(); !opened) return opened;
+  if (auto opened = openListener(); !opened) {
+    assembly_.clientStateManager.reset();  // and with it the endpoint that nobody will be told of
+    return opened;
+  }
   installLaunchEventHandlers();
   loadBagEarly();
   postStartup();

@@ -10,8 +10,10 @@
 
 #include <atomic>
 #include <cerrno>
+#include <filesystem>
 
 #include "platform/Log.h"
+#include "platform/UUID.h"
 #include "platform/host/RelayAcceptor.h"
 #include "platform/host/UnixSocket.h"
 
@@ -67,6 +69,7 @@ Expected<void> HostRelayListener::resume() {
   if (kind_ == Kind::named) {
     if (const auto locked = lock(); !locked) return locked;
     if (const auto removed = removeStale(); !removed) return removed;
+    removeDeadEndpoints();
   }
   auto socket = listenAt(path_);
   if (!socket) return tl::unexpected(std::move(socket.error()));
@@ -83,6 +86,7 @@ Expected<void> HostRelayListener::takeActivated(int descriptor) {
     return tl::unexpected(posixError(errno, "getsockname"));
   }
   path_ = address.sun_path;
+  removeDeadEndpoints();
   ::fcntl(socket.number(), F_SETFL, ::fcntl(socket.number(), F_GETFL) | O_NONBLOCK);
   acceptor_->start(std::move(socket));
   return {};
@@ -99,6 +103,20 @@ Expected<void> HostRelayListener::lock() {
   lock_ = Descriptor();
   if (error == EWOULDBLOCK) return heldByAnother(path_);
   return tl::unexpected(posixError(error, path));
+}
+
+/// A daemon ends without a shut-down, and the name of an endpoint's socket never comes again. One
+/// at which nobody listens belonged to a daemon that is gone.
+void HostRelayListener::removeDeadEndpoints() const {
+  std::error_code error;
+  for (std::filesystem::directory_iterator entry(folder_, error), end; !error && entry != end;
+       entry.increment(error)) {
+    const std::filesystem::path path = entry->path();
+    const auto isEndpoint = path.extension() == ".sock" && UUID::parse(path.stem().native());
+    if (!isEndpoint || !entry->is_socket(error)) continue;
+    const auto answers = connectTo(path);
+    if (!answers && answers.error().code == ECONNREFUSED) ::unlink(path.c_str());
+  }
 }
 
 /// A socket at the path is a dead daemon's when nobody answers there.

@@ -28,7 +28,7 @@ class HostRelayListener final : public RelayListener {
 
   void setAcceptHandler(AcceptHandler handler) override;
   /// A named listener takes the socket that socket activation handed to the process, where there is
-  /// one (sd_listen_fds(3)).
+  /// one (sd_listen_fds(3)). It also clears its folder of the endpoints of daemons that were killed.
   Expected<void> resume() override;
   RelayEndpoint endpoint() const override;
 
@@ -36,6 +36,7 @@ class HostRelayListener final : public RelayListener {
   Expected<void> takeActivated(int socket);
   Expected<void> lock();
   Expected<void> removeStale();
+  void removeDeadEndpoints() const;
 
   const Kind kind_;
   const std::string folder_;
