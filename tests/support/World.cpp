@@ -6,6 +6,7 @@
 #include <spawn.h>
 #include <sys/inotify.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -40,9 +41,18 @@ std::vector<std::string> environmentWith(const std::map<std::string, std::string
   return result;
 }
 
-std::string program(std::string_view name) {
-  const char* folder = std::getenv("SABLED_PROGRAMS");
-  return (std::filesystem::path(folder != nullptr ? folder : SABLED_PROGRAMS) / name).string();
+/// Whether a socket at the path takes connections, told without making one.
+bool isListening(const std::string& path) {
+  constexpr unsigned kAcceptsConnections = 0x10000;  // __SO_ACCEPTCON in the kernel's column of flags
+  std::ifstream sockets("/proc/net/unix");
+  for (std::string line; std::getline(sockets, line);) {
+    if (!line.ends_with(" " + path)) continue;
+    std::istringstream fields(line);
+    std::string number, references, protocol, flags;
+    fields >> number >> references >> protocol >> flags;
+    if ((std::stoul(flags, nullptr, 16) & kAcceptsConnections) != 0) return true;
+  }
+  return false;
 }
 
 }  // namespace
@@ -52,6 +62,12 @@ std::string readFile(const std::filesystem::path& path) {
   std::stringstream text;
   text << file.rdbuf();
   return text.str();
+}
+
+std::size_t occurrences(std::string_view text, std::string_view part) {
+  std::size_t count = 0;
+  for (std::size_t at = 0; (at = text.find(part, at)) != std::string_view::npos; at += part.size()) ++count;
+  return count;
 }
 
 void writeFile(const std::filesystem::path& path, std::string_view text) {
@@ -137,7 +153,7 @@ int Program::wait() {
   return *status_;
 }
 
-World::World(Options options) {
+World::World(Options options) : environment_(std::move(options.environment)) {
   char folder[] = "/tmp/sabled-test-XXXXXX";
   if (mkdtemp(folder) == nullptr) throw std::runtime_error("mkdtemp");
   root_ = folder;
@@ -145,9 +161,12 @@ World::World(Options options) {
     std::filesystem::create_directory(root_ / name);
     chmod((root_ / name).c_str(), 0700);
   }
-  startService(options.serviceArguments);
+  if (options.bagURL.empty()) {
+    startService(options.serviceArguments);
+    options.bagURL = serviceURL_ + "/bag";
+  }
   writeFile(root_ / "config" / "defaults.toml",
-            "SBLDefaultBagURL = \"" + serviceURL_ + "/bag\"\n" + options.settings + "\n");
+            "SBLDefaultBagURL = \"" + options.bagURL + "\"\n" + options.settings + "\n");
   writeFile(root_ / "config" / "facts.toml", options.facts);
   if (options.startDaemon) startDaemon();
 }
@@ -160,10 +179,15 @@ World::~World() {
 }
 
 std::map<std::string, std::string> World::environment() const {
-  return {{"SABLED_RUNTIME_DIR", root_ / "run"},      {"SABLED_CACHES_DIR", root_ / "caches"},
-          {"SABLED_STATE_DIR", root_ / "state"},      {"SABLED_CONFIG_DIR", root_ / "config"},
-          {"SABLED_PROFILE", root_ / "profile.toml"}, {"LC_ALL", "C.UTF-8"},
-          {"DBUS_SESSION_BUS_ADDRESS", "disabled:"}};
+  auto variables = environment_;
+  variables.merge(std::map<std::string, std::string>{{"SABLED_RUNTIME_DIR", root_ / "run"},
+                                                     {"SABLED_CACHES_DIR", root_ / "caches"},
+                                                     {"SABLED_STATE_DIR", root_ / "state"},
+                                                     {"SABLED_CONFIG_DIR", root_ / "config"},
+                                                     {"SABLED_PROFILE", root_ / "profile.toml"},
+                                                     {"LC_ALL", "C.UTF-8"},
+                                                     {"DBUS_SESSION_BUS_ADDRESS", "disabled:"}});
+  return variables;
 }
 
 void World::startService(const std::vector<std::string>& arguments) {
@@ -177,11 +201,22 @@ void World::startService(const std::vector<std::string>& arguments) {
 }
 
 void World::startDaemon(const std::vector<std::string>& arguments) {
-  std::vector<std::string> words{program("sabled"), "--log-level", "info"};
+  std::vector<std::string> words{program("sabled")};
   words.insert(words.end(), arguments.begin(), arguments.end());
-  std::filesystem::remove(socket());
-  daemon_ = std::make_unique<Program>(words, environment(), root_ / "sabled.err");
-  waitForChange(root_ / "run", [this] { return std::filesystem::exists(socket()); });
+  daemon_ = start(words);
+  waitUntilDaemonListens();
+}
+
+void World::waitUntilDaemonListens() const {
+  constexpr int kLookAgainMilliseconds = 10;  // no event tells that a socket that is there listens
+  const int ended = static_cast<int>(syscall(SYS_pidfd_open, daemon_->pid(), 0));
+  while (!isListening(socket())) {
+    pollfd descriptor{ended, POLLIN, 0};
+    if (poll(&descriptor, 1, kLookAgainMilliseconds) == 0) continue;
+    close(ended);
+    throw std::runtime_error("sabled ended: " + daemonErrors());
+  }
+  close(ended);
 }
 
 void World::killDaemon() {
@@ -190,11 +225,22 @@ void World::killDaemon() {
 }
 
 CommandResult World::run(const std::vector<std::string>& arguments) const {
+  std::filesystem::remove(root_ / "command.err");
   Program command(arguments, environment(), root_ / "command.err");
   CommandResult result;
   result.output = command.readAll();
   result.exitCode = command.wait();
+  result.errors = readFile(root_ / "command.err");
   return result;
+}
+
+std::unique_ptr<Program> World::start(const std::vector<std::string>& arguments) const {
+  return std::make_unique<Program>(arguments, environment(), root_ / "sabled.err");
+}
+
+CommandResult World::sabled(std::vector<std::string> arguments) const {
+  arguments.insert(arguments.begin(), program("sabled"));
+  return run(arguments);
 }
 
 CommandResult World::sablectl(std::vector<std::string> arguments) const {
@@ -223,6 +269,15 @@ std::vector<nlohmann::json> World::requests(std::string_view path, std::size_t c
 
 std::string World::daemonErrors() const {
   return readFile(root_ / "sabled.err");
+}
+
+void World::waitForLog(std::string_view text, std::size_t count) const {
+  waitForChange(root_, [&] { return occurrences(daemonErrors(), text) >= count; });
+}
+
+std::string World::program(std::string_view name) {
+  const char* folder = std::getenv("SABLED_PROGRAMS");
+  return (std::filesystem::path(folder != nullptr ? folder : SABLED_PROGRAMS) / name).string();
 }
 
 }  // namespace sable::test

@@ -45,6 +45,7 @@ class Program {
 struct CommandResult {
   int exitCode;
   std::string output;
+  std::string errors;
 };
 
 /// The real programs in folders of their own: sable-service, sabled and whatever talks to them.
@@ -54,6 +55,8 @@ class World {
     std::vector<std::string> serviceArguments = {};  ///< added to sable-service's
     std::string settings = {};                       ///< added to the user's defaults.toml
     std::string facts = "locale = \"en_GB\"\ncountry_code = \"GB\"\n";
+    std::string bagURL = {};  ///< of another service: sable-service is not started then
+    std::map<std::string, std::string> environment = {};  ///< set over the daemon's usual variables
     bool startDaemon = true;
   };
 
@@ -61,7 +64,8 @@ class World {
   World() : World(Options()) {}
   ~World();
 
-  void startDaemon(const std::vector<std::string>& arguments = {});
+  /// Starts it and waits until it listens; throws what it said when it ends before.
+  void startDaemon(const std::vector<std::string>& arguments = {"--log-level", "info"});
   void killDaemon();
   Program& daemon() { return *daemon_; }
 
@@ -72,24 +76,37 @@ class World {
 
   /// Runs a program to its end.
   CommandResult run(const std::vector<std::string>& arguments) const;
+  CommandResult sabled(std::vector<std::string> arguments) const;
+  /// Starts a program that writes its errors into the daemon's log.
+  std::unique_ptr<Program> start(const std::vector<std::string>& arguments) const;
   CommandResult sablectl(std::vector<std::string> arguments) const;
   /// Runs sablectl --json and reads what it prints.
   nlohmann::json sablectlJSON(std::vector<std::string> arguments) const;
 
   /// What the service has recorded for a path; waits until there are `count` of them.
   std::vector<nlohmann::json> requests(std::string_view path, std::size_t count) const;
+  /// What the daemon has logged.
   std::string daemonErrors() const;
+  /// Waits until it has logged `text`, `count` times.
+  void waitForLog(std::string_view text, std::size_t count = 1) const;
+
+  /// Where a program built with the tests stands.
+  static std::string program(std::string_view name);
 
  private:
   std::map<std::string, std::string> environment() const;
+  void waitUntilDaemonListens() const;
   void startService(const std::vector<std::string>& arguments);
 
+  const std::map<std::string, std::string> environment_;
   std::filesystem::path root_;
   std::string serviceURL_;
   std::unique_ptr<Program> service_, daemon_;
 };
 
 std::string readFile(const std::filesystem::path& path);
+/// How often `part` stands in `text`.
+std::size_t occurrences(std::string_view text, std::string_view part);
 void writeFile(const std::filesystem::path& path, std::string_view text);
 
 /// Waits until `holds` does, asking again whenever something in `folder` changes; fails the process
