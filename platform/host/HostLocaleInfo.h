@@ -1,8 +1,6 @@
 #pragma once
 
-#include <mutex>
 #include <string>
-#include <utility>
 
 #include "platform/LocaleInfo.h"
 #include "platform/host/HostFacts.h"
@@ -26,9 +24,6 @@ class HostLocaleInfo final : public LocaleInfo {
 
  private:
   const HostFacts& facts_;
-
-  mutable std::mutex mutex_;
-  mutable std::pair<std::string, std::string> hourPattern_;  ///< of a locale; costs up to 8 ms to find out
 };
 
 }  // namespace sable::platform::host
