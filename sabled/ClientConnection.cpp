@@ -106,6 +106,10 @@ bool ClientConnection::_ensureState() {
     log().fault("configuration requires identifier and agent");
     return false;
   }
+  if (agent.size() > kMaximumNameBytes) {
+    log().fault("user agent is longer than {} bytes", kMaximumNameBytes);
+    return false;
+  }
   userAgent_ = agent;
   if (state_ != nullptr) {
     if (state_->identifier() != *configuration_->identifier) log().fault("session identifier must match");

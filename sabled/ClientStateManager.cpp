@@ -55,6 +55,10 @@ std::shared_ptr<ClientState> ClientStateManager::stateForClientIdentifier(const 
     log().fault("client session identifier cannot be nil or empty");
     return nullptr;
   }
+  if (identifier.size() > kMaximumNameBytes) {
+    log().fault("client session identifier is longer than {} bytes", kMaximumNameBytes);
+    return nullptr;
+  }
   auto state = stateCacheQueue_->sync([&] {
     auto& entry = stateCache_[identifier];
     if (entry == nullptr) entry = std::make_shared<ClientState>(identifier, assembly_);

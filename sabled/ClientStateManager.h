@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstddef>
 #include <map>
 #include <memory>
 #include <set>
@@ -19,6 +20,9 @@ class ClientState;
 class SBLBag;
 struct SearchResponse;
 
+/// Of an identifier or a user agent; both are kept for good.
+inline constexpr std::size_t kMaximumNameBytes = 4096;
+
 /// Keeps one ClientState per client session identifier, for the life of the process; serves the
 /// anonymous endpoint on which clients ask follow-up requests; and remembers the hosts that answers
 /// of the service have vouched for as sources of images. Any thread.
@@ -27,7 +31,8 @@ class ClientStateManager {
   explicit ClientStateManager(Assembly& assembly);
   ~ClientStateManager();
 
-  /// The state of an identifier, made when it is new; null for an empty one.
+  /// The state of an identifier, made when it is new; null for one that is empty or longer than
+  /// kMaximumNameBytes.
   std::shared_ptr<ClientState> stateForClientIdentifier(const std::string& identifier);
 
   /// Writes the known sessions to the settings, where the user asked for that.

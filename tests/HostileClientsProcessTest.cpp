@@ -158,6 +158,15 @@ TEST_F(HostileClients, WhoNeverReadsIsHungUpOnBeforeItCostsMuch) {
   }
 }
 
+TEST_F(HostileClients, WhoIntroducesItselfAtLengthIsHungUpOn) {
+  const std::string longName(1 << 20, 'n');
+  for (const SBLSessionConfiguration& configuration :
+       {SBLSessionConfiguration{longName, "agent/1"}, {"name", longName}, {"", "agent/1"}, {"name", ""}}) {
+    TestClient client(runtime_, world_.address(), configuration);
+    EXPECT_FALSE(client.connect()) << configuration.description().substr(0, 40);
+  }
+}
+
 TEST_F(HostileClients, ExtremesOfARequestAreAnswered) {
   SBLSearchRequest search;
   for (const std::uint64_t id : {std::uint64_t{1} << 63, std::numeric_limits<std::uint64_t>::max()}) {
