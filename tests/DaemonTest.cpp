@@ -33,7 +33,7 @@ class Daemon : public testing::Test {
 
 TEST_F(Daemon, AClientIsConfiguredAndGetsTheBag) {
   device.start();
-  TestClient& client = device.client("com.kestrel.beacon", "Beacon/1");
+  VirtualClient& client = device.client("com.kestrel.beacon", "Beacon/1");
   ASSERT_TRUE(client.endpoint());
   ASSERT_EQ(client.bags().size(), 1u);
   EXPECT_EQ(client.bags()[0].raw["version"], "1");
@@ -50,7 +50,7 @@ TEST_F(Daemon, AClientIsConfiguredAndGetsTheBag) {
 TEST_F(Daemon, AFailedConfigurationClosesTheConnectionWithoutAnAnswer) {
   device.start();
   for (const auto& [identifier, agent] : {std::pair{"com.kestrel.beacon", ""}, std::pair{"", "Beacon/1"}}) {
-    TestClient& client = device.client(identifier, agent);
+    VirtualClient& client = device.client(identifier, agent);
     EXPECT_FALSE(client.endpoint());
     EXPECT_FALSE(client.isConnected());
   }
@@ -61,14 +61,14 @@ TEST_F(Daemon, AFailedConfigurationClosesTheConnectionWithoutAnAnswer) {
 
 TEST_F(Daemon, AnAgentThatIsAlreadyComposedIsNotComposedAgain) {
   device.start();
-  TestClient& client = device.client("com.kestrel.rover", "Sabled/1.0 (X; Y 1) Rover/2");
+  VirtualClient& client = device.client("com.kestrel.rover", "Sabled/1.0 (X; Y 1) Rover/2");
   EXPECT_EQ(client.bags().at(0).userAgent, "Sabled/1.0 (X; Y 1) Rover/2");
 }
 
 TEST_F(Daemon, ASilentConnectionIsClosedAfterSixtySecondsAndACallPostponesThat) {
   device.start();
-  TestClient& silent = device.connect();
-  TestClient& busy = device.client();
+  VirtualClient& silent = device.connect();
+  VirtualClient& busy = device.client();
   device.advance(59s);
   EXPECT_TRUE(silent.isConnected());
   busy.search("wea");
@@ -83,8 +83,8 @@ TEST_F(Daemon, ASilentConnectionIsClosedAfterSixtySecondsAndACallPostponesThat) 
 
 TEST_F(Daemon, SeveralConnectionsOfOneProcessAreToldOfAndKept) {
   device.start();
-  TestClient& first = device.client();
-  TestClient& second = device.client();
+  VirtualClient& first = device.client();
+  VirtualClient& second = device.client();
   EXPECT_TRUE(device.log.contains("too many connections 2 from pid 100"));
   EXPECT_EQ(device.log.count("new connection from beacon (100)"), 2u);
   EXPECT_FALSE(first.search("wea").data().empty());
@@ -163,7 +163,7 @@ TEST_F(Daemon, TheGatesAnswerWithNothing) {
   device.bag["minimum_query_length"] = 3;
   device.bag["agents"] = {{"rover", {{"enabled", false}}}};
   device.start();
-  TestClient& beacon = device.client();
+  VirtualClient& beacon = device.client();
   for (const char* tooShort : {"", "we", "🦋"}) {
     const Answer answer = beacon.search(tooShort);
     EXPECT_FALSE(answer.reply || answer.error) << tooShort;
@@ -172,7 +172,7 @@ TEST_F(Daemon, TheGatesAnswerWithNothing) {
   EXPECT_TRUE(beacon.search("🦋a").reply) << "two UTF-16 code units and one";
   EXPECT_TRUE(device.log.contains("query[2] input 'we' less than 3"));
 
-  TestClient& rover = device.client("com.kestrel.rover", "Rover/1");
+  VirtualClient& rover = device.client("com.kestrel.rover", "Rover/1");
   EXPECT_FALSE(rover.search("weather").reply);
   EXPECT_FALSE(rover.ask(SBLZeroKeywordRequest{}).error);
   EXPECT_FALSE(rover.ask(SBLLookupRequest{}).reply);
@@ -185,7 +185,7 @@ TEST_F(Daemon, TheGatesAnswerWithNothing) {
 TEST_F(Daemon, WithoutABagAQueryWaitsASecondThenFails) {
   device.service.on("/bag", answering("not found", 404));
   device.start();
-  TestClient& client = device.client();
+  VirtualClient& client = device.client();
   device.advance(2s);
   const auto start = device.platform.runtime().ticks();
   const Answer answer = client.search("wea");
@@ -203,7 +203,7 @@ TEST_F(Daemon, ABagThatArrivesWithinTheSecondServesEveryWaitingQuery) {
   device.start();
   std::vector<PendingAnswer> answers;
   for (int i = 0; i < 4; ++i) {
-    TestClient& client = device.connect(100 + i);
+    VirtualClient& client = device.connect(100 + i);
     client.configure("com.kestrel.client" + std::to_string(i), "Client/1");
     answers.push_back(client.send(searchFor("wea", 1)));
   }
@@ -215,7 +215,7 @@ TEST_F(Daemon, ABagThatArrivesWithinTheSecondServesEveryWaitingQuery) {
 
 TEST_F(Daemon, OnlyTheNewestSearchIsAnsweredWithResults) {
   device.start();
-  TestClient& client = device.client();
+  VirtualClient& client = device.client();
   const PendingAnswer first = client.send(searchFor("w", 1));
   const PendingAnswer second = client.send(searchFor("we", 5));
   const PendingAnswer stale = client.send(searchFor("wea", 4));
@@ -230,7 +230,7 @@ TEST_F(Daemon, OnlyTheNewestSearchIsAnsweredWithResults) {
 
 TEST_F(Daemon, WhateverTheServiceSaysReachesTheClient) {
   device.start();
-  TestClient& client = device.client();
+  VirtualClient& client = device.client();
   device.service.on("/search", answering("<html>no</html>", 503));
   const Answer html = client.search("wea");
   EXPECT_EQ(html.data(), "<html>no</html>");
@@ -251,7 +251,7 @@ TEST_F(Daemon, WhateverTheServiceSaysReachesTheClient) {
 
 TEST_F(Daemon, LookupsAreTriedAgainUntilTheirPageNoLongerWaits) {
   device.start();
-  TestClient& client = device.client();
+  VirtualClient& client = device.client();
   device.service.failNext(2, HTTPErrorCode::cannotConnect);
   EXPECT_TRUE(client.ask(SBLLookupRequest{}).reply);
   EXPECT_EQ(device.sent("/search"), 3u);
@@ -266,7 +266,7 @@ TEST_F(Daemon, LookupsAreTriedAgainUntilTheirPageNoLongerWaits) {
 
 TEST_F(Daemon, MoreResultsAndCardsAreServedOnTheEndpointAndNothingElseIs) {
   device.start();
-  TestClient& client = device.client();
+  VirtualClient& client = device.client();
   device.service.on("/card", answering("no object"));
   SBLMoreResultsRequest more;
   more.moreResultsURL = "https://service.test/more?page=2";

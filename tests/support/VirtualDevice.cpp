@@ -41,7 +41,8 @@ Scripted completing(const HTTPRequest& request) {
 
 }  // namespace
 
-TestClient::TestClient(VirtualDevice& device, platform::RelayEndpoint endpoint, pid_t pid) : device_(device) {
+VirtualClient::VirtualClient(VirtualDevice& device, platform::RelayEndpoint endpoint, pid_t pid)
+    : device_(device) {
   auto connected = device.platform.relay().connectAs(endpoint, {pid, 1000});
   if (!connected) throw std::runtime_error(connected.error().description());
   connection_ = std::move(*connected);
@@ -55,11 +56,11 @@ TestClient::TestClient(VirtualDevice& device, platform::RelayEndpoint endpoint, 
   connection_->resume();
 }
 
-TestClient::~TestClient() {
+VirtualClient::~VirtualClient() {
   connection_->invalidate();
 }
 
-void TestClient::configure(std::string identifier, std::string agent) {
+void VirtualClient::configure(std::string identifier, std::string agent) {
   connection_->call(kSBLDaemonRelay, SBLDaemonRelay::configure,
                     {encodeConfiguration({std::move(identifier), std::move(agent)})}, kPatience,
                     [state = state_](Expected<RelayArguments> answer) {
@@ -67,7 +68,7 @@ void TestClient::configure(std::string identifier, std::string agent) {
                     });
 }
 
-PendingAnswer TestClient::send(SBLAnyRequest request) {
+PendingAnswer VirtualClient::send(SBLAnyRequest request) {
   auto pending = std::make_shared<std::optional<Answer>>();
   connection_->call(kSBLDaemonRelay, SBLDaemonRelay::request,
                     {std::string(requestClassName(request)), encodeRequest(request)}, kPatience,
@@ -80,13 +81,13 @@ PendingAnswer TestClient::send(SBLAnyRequest request) {
   return pending;
 }
 
-Answer TestClient::ask(SBLAnyRequest request) {
+Answer VirtualClient::ask(SBLAnyRequest request) {
   const auto pending = send(std::move(request));
   device_.await(pending);
   return **pending;
 }
 
-Answer TestClient::search(std::string text) {
+Answer VirtualClient::search(std::string text) {
   SBLSearchRequest request;
   request.queryId = ++queryId_;
   request.queryString = std::move(text);
@@ -108,7 +109,7 @@ VirtualDevice::VirtualDevice(std::uint64_t seed) : platform(seed) {
 }
 
 VirtualDevice::~VirtualDevice() {
-  for (TestClient& client : clients_) client.disconnect();
+  for (VirtualClient& client : clients_) client.disconnect();
   run();
 }
 
@@ -125,12 +126,12 @@ void VirtualDevice::await(const PendingAnswer& answer) {
   }
 }
 
-TestClient& VirtualDevice::connect(pid_t pid) {
+VirtualClient& VirtualDevice::connect(pid_t pid) {
   return clients_.emplace_back(*this, "unix:path=/simulated/" + std::string(kSBLServiceName), pid);
 }
 
-TestClient& VirtualDevice::client(std::string identifier, std::string agent) {
-  TestClient& client = connect();
+VirtualClient& VirtualDevice::client(std::string identifier, std::string agent) {
+  VirtualClient& client = connect();
   client.configure(std::move(identifier), std::move(agent));
   run();
   return client;

@@ -36,10 +36,10 @@ struct Answer {
 using PendingAnswer = std::shared_ptr<std::optional<Answer>>;
 
 /// An application on the virtual device: one raw connection to the daemon.
-class TestClient {
+class VirtualClient {
  public:
-  TestClient(VirtualDevice& device, platform::RelayEndpoint endpoint, pid_t pid);
-  ~TestClient();
+  VirtualClient(VirtualDevice& device, platform::RelayEndpoint endpoint, pid_t pid);
+  ~VirtualClient();
 
   /// Sends Configure; the answer, if any, is in endpoint().
   void configure(std::string identifier = "com.kestrel.beacon", std::string agent = "Beacon/1");
@@ -100,9 +100,9 @@ class VirtualDevice {
   void await(const PendingAnswer& answer);
 
   /// A connection, not yet configured.
-  TestClient& connect(pid_t pid = 100);
+  VirtualClient& connect(pid_t pid = 100);
   /// A configured connection.
-  TestClient& client(std::string identifier = "com.kestrel.beacon", std::string agent = "Beacon/1");
+  VirtualClient& client(std::string identifier = "com.kestrel.beacon", std::string agent = "Beacon/1");
 
   std::size_t sent(std::string_view path) const { return service.requests(path).size(); }
   std::int64_t counter(const std::string& key) { return platform.tally().value("com.kestrel.sabled." + key); }
@@ -111,7 +111,7 @@ class VirtualDevice {
 
  private:
   std::unique_ptr<SableDaemon> daemon_;
-  std::deque<TestClient> clients_;
+  std::deque<VirtualClient> clients_;
 };
 
 }  // namespace sable::test
