@@ -7,20 +7,9 @@
 #include "SableKit/SBLClient.h"
 #include "platform/host/HostRelay.h"
 #include "platform/host/HostRuntime.h"
+#include "tests/support/Answer.h"
 
 namespace sable::test {
-
-/// What a request ended with.
-struct Answer {
-  std::uint64_t queryId = 0;
-  std::optional<SBLReply> reply;
-  std::optional<Error> error;
-
-  /// "" where there is none.
-  std::string data() const { return reply && reply->data ? *reply->data : std::string(); }
-  std::string reason() const { return error ? error->reason : std::string(); }
-  bool isClean() const { return reply && !error; }
-};
 
 /// An application with the client library, on real threads, that waits for what it asks.
 class TestClient {

@@ -14,6 +14,7 @@
 #include "platform/simulated/SimulatedLog.h"
 #include "platform/simulated/SimulatedPlatform.h"
 #include "sabled/SableDaemon.h"
+#include "tests/support/Answer.h"
 
 namespace sable::test {
 
@@ -25,14 +26,7 @@ class VirtualDevice;
 /// An answer for the scripted service to give.
 platform::simulated::Scripted answering(std::string body, int status = 200);
 
-/// What a call was answered with; nothing before it was.
-struct Answer {
-  std::uint64_t queryId = 0;
-  std::optional<SBLReply> reply;
-  std::optional<Error> error;
-
-  std::string data() const { return reply && reply->data ? *reply->data : std::string(); }
-};
+/// Holds an answer from the moment it is there.
 using PendingAnswer = std::shared_ptr<std::optional<Answer>>;
 
 /// An application on the virtual device: one raw connection to the daemon.
