@@ -51,9 +51,7 @@ struct HostPlatform::Facilities {
   explicit Facilities(HostPlatformConfiguration configuration)
       : socketPath(std::move(configuration.socketPath)) {}
 
-  TOMLUserDefaults& settings() {
-    return userDefaults.get(folders, runtime, runtime.reactor(), fileManager);
-  }
+  TOMLUserDefaults& settings() { return userDefaults.get(folders, runtime, runtime.reactor(), fileManager); }
   HostFacts& hostFacts() { return facts.get(folders, HostSources{}, runtime.reactor(), notificationCenter); }
 
   const std::filesystem::path socketPath;
