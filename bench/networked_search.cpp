@@ -2,6 +2,7 @@
 // same HTTP request on a kept-alive connection, made with libcurl and nothing else, and the same
 // numbers of bytes through a bare socket.
 #include <curl/curl.h>
+#include <fmt/core.h>
 #include <unistd.h>
 
 #include <sstream>
@@ -59,13 +60,15 @@ class DirectRequest {
   std::string body_;
 };
 
-void compare(const char* name, std::optional<double> bound, int argc, char** argv) {
+void compare(Placement placement, std::optional<double> bound, int argc, char** argv) {
+  placeServers(placement);
   World world;
   world.startDaemon();
   Client client(world.socket());
   const auto search = [&] { client.search(kQuery, Client::Outcome::answer); };
   const RawServer server(world.path("raw.sock"), client.sizes(kQuery, Client::Outcome::answer));
   const int socket = server.connect();
+  placeClient(placement);
   DirectRequest request(world.service().url(), world.service().lastSearch());
 
   Microseconds ignored, raw, http, daemon;
@@ -76,13 +79,15 @@ void compare(const char* name, std::optional<double> bound, int argc, char** arg
     measure(calls, round < 0 ? ignored : daemon, search);
   }
   ::close(socket);
-  report({name, "us", median(daemon), median(raw) + median(http), bound}, argc, argv);
+  report({fmt::format("networked_search{}", suffix(placement)), "us", median(daemon),
+          median(raw) + median(http), bound},
+         argc, argv);
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-  compare("networked_search", 1.35, argc, argv);
-  useProcessor(0);  // what is started from here on inherits it
-  compare("networked_search_one_cpu", std::nullopt, argc, argv);
+  compare(Placement::free, 1.35, argc, argv);
+  compare(Placement::twoProcessors, 1.35, argc, argv);
+  compare(Placement::oneProcessor, std::nullopt, argc, argv);
 }

@@ -29,8 +29,10 @@ struct Setup {
   }
 };
 
-void roundTrips(const char* name, std::optional<double> bound, int argc, char** argv) {
+void roundTrips(Placement placement, std::optional<double> bound, int argc, char** argv) {
+  placeServers(placement);
   const Setup setup;
+  placeClient(placement);
   const int socket = setup.server.connect();
   Client client(setup.world.socket());
   Microseconds ignored, raw, daemon;
@@ -40,7 +42,8 @@ void roundTrips(const char* name, std::optional<double> bound, int argc, char** 
     measure(calls, round < 0 ? ignored : daemon, [&] { client.search(kTooShort, Client::Outcome::nothing); });
   }
   ::close(socket);
-  report({name, "us", median(daemon), median(raw), bound}, argc, argv);
+  report({fmt::format("refused_search{}", suffix(placement)), "us", median(daemon), median(raw), bound}, argc,
+         argv);
 }
 
 template <class Run>
@@ -73,8 +76,8 @@ void throughput(const std::string& name, int argc, char** argv) {
 }  // namespace
 
 int main(int argc, char** argv) {
-  roundTrips("refused_search", 2.0, argc, argv);
+  roundTrips(Placement::free, 2.0, argc, argv);
   throughput(fmt::format("refused_search_{}_clients", kClients), argc, argv);
-  useProcessor(0);  // what is started from here on inherits it
-  roundTrips("refused_search_one_cpu", std::nullopt, argc, argv);
+  roundTrips(Placement::twoProcessors, 2.0, argc, argv);
+  roundTrips(Placement::oneProcessor, std::nullopt, argc, argv);
 }

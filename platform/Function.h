@@ -48,7 +48,10 @@ class Function<Result(Args...)> {
   explicit operator bool() const noexcept { return operations_ != nullptr; }
 
   /// Calls the callable; calling an empty Function is a programming error.
-  Result operator()(Args... args) { return operations_->call(&storage_, std::forward<Args>(args)...); }
+  Result operator()(Args... args) {
+    // NOLINTNEXTLINE(clang-analyzer-core.NullDereference): as said
+    return operations_->call(&storage_, std::forward<Args>(args)...);
+  }
 
  private:
   struct Operations {

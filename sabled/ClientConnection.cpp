@@ -100,17 +100,14 @@ bool ClientConnection::_ensureState() {
     log().fault("configuration must not be nil");
     return false;
   }
-  const std::string agent =
-      composeUserAgent(configuration_->userAgent.value_or(""), assembly_.platform.deviceInfo());
-  if (!configuration_->identifier || agent.empty()) {
+  if (!configuration_->identifier || userAgent_.empty()) {
     log().fault("configuration requires identifier and agent");
     return false;
   }
-  if (agent.size() > kMaximumNameBytes) {
+  if (userAgent_.size() > kMaximumNameBytes) {
     log().fault("user agent is longer than {} bytes", kMaximumNameBytes);
     return false;
   }
-  userAgent_ = agent;
   if (state_ != nullptr) {
     if (state_->identifier() != *configuration_->identifier) log().fault("session identifier must match");
     return true;
@@ -123,16 +120,17 @@ bool ClientConnection::_ensureState() {
 void ClientConnection::configure(SBLSessionConfiguration configuration, platform::RelayReply reply) {
   log().standard("client configuration {}", configuration.description());
   configuration_ = std::move(configuration);
+  userAgent_ = composeUserAgent(configuration_->userAgent.value_or(""), assembly_.platform.deviceInfo());
   if (!_ensureState()) {
     reply.forget();
     return failConfiguration();
   }
   // Answered first: the client need not wait for the bag.
   reply(assembly_.clientStateManager->endpoint());
-  state_->bag(userAgent_,
-              [weak = weak_from_this()](std::shared_ptr<const SBLBag> bag, std::optional<Error> error) {
-                if (const auto self = weak.lock()) self->startServing(bag, error);
-              });
+  state_->bag(userAgent_, [weak = weak_from_this()](const std::shared_ptr<const SBLBag>& bag,
+                                                    const std::optional<Error>& error) {
+    if (const auto self = weak.lock()) self->startServing(bag, error);
+  });
 }
 
 void ClientConnection::failConfiguration() {
@@ -179,8 +177,8 @@ void ClientConnection::pushBag(const SBLBag* bag, const std::optional<Error>& er
 
 void ClientConnection::bag(platform::RelayReply reply) {
   if (!_ensureState()) return reply.forget();
-  state_->bag(userAgent_, [reply = std::move(reply)](std::shared_ptr<const SBLBag> bag,
-                                                     std::optional<Error> error) mutable {
+  state_->bag(userAgent_, [reply = std::move(reply)](const std::shared_ptr<const SBLBag>& bag,
+                                                     const std::optional<Error>& error) mutable {
     reply(bag == nullptr ? std::string() : compactJSON(*bag->rawBag()),
           bag == nullptr ? std::string() : bag->userAgent(), encodeError(error));
   });
@@ -209,25 +207,21 @@ void ClientConnection::request(platform::RelayCall& call) {
   struct Router {
     ClientConnection& self;
     SBLReplyHandler& reply;
-    void operator()(SBLSearchRequest& request) { self.search(std::move(request), std::move(reply)); }
-    void operator()(SBLMoreResultsRequest& request) {
-      self.state_->moreResults(std::move(request), std::move(reply));
-    }
+    void operator()(SBLSearchRequest& request) { self.search(request, std::move(reply)); }
+    void operator()(SBLMoreResultsRequest& request) { self.state_->moreResults(request, std::move(reply)); }
     void operator()(SBLCardRequest& request) {
       SBLTracePoint(kTraceCard);
-      self.state_->card(std::move(request), std::move(reply));
+      self.state_->card(request, std::move(reply));
     }
-    void operator()(SBLZeroKeywordRequest& request) {
-      self.state_->zeroKeyword(std::move(request), std::move(reply));
-    }
-    void operator()(SBLLookupRequest& request) { self.state_->lookup(std::move(request), std::move(reply)); }
+    void operator()(SBLZeroKeywordRequest& request) { self.state_->zeroKeyword(request, std::move(reply)); }
+    void operator()(SBLLookupRequest& request) { self.state_->lookup(request, std::move(reply)); }
     void operator()(SBLFlightLookupRequest& request) { self.state_->flightLookup(request, std::move(reply)); }
     void operator()(SBLFlightSearchRequest& request) { self.state_->flightSearch(request, std::move(reply)); }
   };
   std::visit(Router{*this, reply}, *decoded);
 }
 
-void ClientConnection::search(SBLSearchRequest request, SBLReplyHandler reply) {
+void ClientConnection::search(const SBLSearchRequest& request, SBLReplyHandler reply) {
   SBLTracePoint(kTraceSearchStart);
   const std::uint64_t queryId = request.queryId;
   std::uint64_t current = currentQueryId_.load();
@@ -236,7 +230,7 @@ void ClientConnection::search(SBLSearchRequest request, SBLReplyHandler reply) {
     SBLTracePoint(kTraceSearchEnd);
     return;
   }
-  state_->search(std::move(request),
+  state_->search(request,
                  [self = shared_from_this(), reply = std::move(reply)](
                      std::uint64_t id, std::optional<SBLReply> answer, std::optional<Error> error) mutable {
                    if (self->currentQueryId_.load() > id) {

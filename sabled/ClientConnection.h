@@ -61,7 +61,7 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
 
   void request(platform::RelayCall& call);
   void fillDefaults(SBLRequest& request) const;
-  void search(SBLSearchRequest request, SBLReplyHandler reply);
+  void search(const SBLSearchRequest& request, SBLReplyHandler reply);
   void reportEvent(platform::RelayCall& call);
   void feedback(platform::RelayReply reply);
   void listSessions(platform::RelayReply reply);

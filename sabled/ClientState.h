@@ -47,11 +47,11 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
 
   // Each replies exactly once. Its gates, in order: a bag, a bag that enables the service for this
   // agent, and for searches enough text; a refused query is answered with neither reply nor error.
-  void search(SBLSearchRequest request, SBLReplyHandler reply);
-  void zeroKeyword(SBLZeroKeywordRequest request, SBLReplyHandler reply);
-  void lookup(SBLLookupRequest request, SBLReplyHandler reply);
-  void moreResults(SBLMoreResultsRequest request, SBLReplyHandler reply);
-  void card(SBLCardRequest request, SBLReplyHandler reply);
+  void search(const SBLSearchRequest& request, SBLReplyHandler reply);
+  void zeroKeyword(const SBLZeroKeywordRequest& request, SBLReplyHandler reply);
+  void lookup(const SBLLookupRequest& request, SBLReplyHandler reply);
+  void moreResults(const SBLMoreResultsRequest& request, SBLReplyHandler reply);
+  void card(const SBLCardRequest& request, SBLReplyHandler reply);
   /// Accepted, and answered at once with nothing.
   void flightSearch(const SBLFlightSearchRequest& request, SBLReplyHandler reply);
   void flightLookup(const SBLFlightLookupRequest& request, SBLReplyHandler reply);

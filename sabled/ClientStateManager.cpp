@@ -139,11 +139,11 @@ void ClientStateManager::handleEndpointCall(platform::RelayCall call) {
   auto request =
       decodeRequest(std::get<std::string>(call.arguments[0]), std::get<RelayRecord>(call.arguments[1]));
   if (!request) return call.reply.forget();
-  this->request(std::move(*request), decodeConfiguration(std::get<RelayRecord>(call.arguments[2])),
+  this->request(*request, decodeConfiguration(std::get<RelayRecord>(call.arguments[2])),
                 std::move(call.reply));
 }
 
-void ClientStateManager::request(SBLAnyRequest request, const SBLSessionConfiguration& configuration,
+void ClientStateManager::request(const SBLAnyRequest& request, const SBLSessionConfiguration& configuration,
                                  platform::RelayReply reply) {
   const auto state = stateForClientIdentifier(configuration.identifier.value_or(""));
   if (state == nullptr) {
@@ -153,10 +153,10 @@ void ClientStateManager::request(SBLAnyRequest request, const SBLSessionConfigur
         makeSBLError(SBLErrorCode::daemonSide, "invalid configuration " + configuration.description()));
     return;
   }
-  if (auto* moreResults = std::get_if<SBLMoreResultsRequest>(&request)) {
-    state->moreResults(std::move(*moreResults), replyHandler(std::move(reply)));
-  } else if (auto* card = std::get_if<SBLCardRequest>(&request)) {
-    state->card(std::move(*card), replyHandler(std::move(reply)));
+  if (const auto* moreResults = std::get_if<SBLMoreResultsRequest>(&request)) {
+    state->moreResults(*moreResults, replyHandler(std::move(reply)));
+  } else if (const auto* card = std::get_if<SBLCardRequest>(&request)) {
+    state->card(*card, replyHandler(std::move(reply)));
   } else {
     reply.forget();
   }

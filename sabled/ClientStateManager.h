@@ -50,7 +50,7 @@ class ClientStateManager {
 
   /// Follow-up requests: more results and cards. Any other request is dropped: its caller's call
   /// never completes.
-  void request(SBLAnyRequest request, const SBLSessionConfiguration& configuration,
+  void request(const SBLAnyRequest& request, const SBLSessionConfiguration& configuration,
                platform::RelayReply reply);
 
   /// Adds the hosts of an answer's images to those from which images may be loaded.

@@ -157,7 +157,7 @@ bool ClientState::passesGates(Query& query) {
   return true;
 }
 
-void ClientState::search(SBLSearchRequest request, SBLReplyHandler reply) {
+void ClientState::search(const SBLSearchRequest& request, SBLReplyHandler reply) {
   const auto query = begin(kSearch, request, request.queryString, std::move(reply));
   count("keystrokes");
   if (!passesGates(*query)) return;
@@ -172,14 +172,14 @@ void ClientState::search(SBLSearchRequest request, SBLReplyHandler reply) {
   assembly_.tally.add(kSBLSearchCounterKey, 1);
 }
 
-void ClientState::zeroKeyword(SBLZeroKeywordRequest request, SBLReplyHandler reply) {
+void ClientState::zeroKeyword(const SBLZeroKeywordRequest& request, SBLReplyHandler reply) {
   const auto query = begin(kZeroKeyword, request, "", std::move(reply));
   if (!passesGates(*query)) return;
   dispatch(query, assembly_.requestFactory->zeroKeywordRequest(
                       request, *query->bag, guidController_->currentUserGUID(), query->fieldMask));
 }
 
-void ClientState::lookup(SBLLookupRequest request, SBLReplyHandler reply) {
+void ClientState::lookup(const SBLLookupRequest& request, SBLReplyHandler reply) {
   const auto query = begin(kLookup, request, request.queryString, std::move(reply));
   if (!passesGates(*query)) return;
   query->expire = assembly_.runtime.now() + platform::fromSeconds(query->bag->searchRenderTimeout());
@@ -187,14 +187,14 @@ void ClientState::lookup(SBLLookupRequest request, SBLReplyHandler reply) {
            assembly_.requestFactory->lookupRequest(request, *query->bag, guidController_->currentUserGUID()));
 }
 
-void ClientState::moreResults(SBLMoreResultsRequest request, SBLReplyHandler reply) {
+void ClientState::moreResults(const SBLMoreResultsRequest& request, SBLReplyHandler reply) {
   const auto query = begin(kMoreResults, request, "", std::move(reply));
   if (!passesGates(*query)) return;
   dispatch(query, assembly_.requestFactory->moreResultsRequest(
                       request, *query->bag, guidController_->currentUserGUID(), query->fieldMask));
 }
 
-void ClientState::card(SBLCardRequest request, SBLReplyHandler reply) {
+void ClientState::card(const SBLCardRequest& request, SBLReplyHandler reply) {
   const auto query = begin(kCard, request, "", std::move(reply));
   if (!passesGates(*query)) return;
   dispatch(query,
@@ -273,7 +273,7 @@ void ClientState::didComplete(Query& query, HTTPResult result) {
 /// Takes from an answer what concerns the daemon; says why it is no JSON, if it is none.
 std::optional<Error> ClientState::processAnswer(const Query& query, const std::string& body) {
   const auto response = SearchResponse::parse(body);
-  const std::optional<Error> parseError = response ? std::nullopt : std::optional(response.error());
+  std::optional<Error> parseError = response ? std::nullopt : std::optional(response.error());
   if (response) assembly_.clientStateManager->processImagesFromResponse(*response, *query.bag);
   if (query.kind.expectsObject && (!response || !response->isObject)) {
     // The missing word after "for" is part of the line that log readers match.

@@ -18,8 +18,8 @@ inline void sendRequestReply(platform::RelayReply& relayReply, std::uint64_t que
 
 /// The handler that answers a Request call with what a query ends with.
 inline SBLReplyHandler replyHandler(platform::RelayReply relayReply) {
-  return [relayReply = std::move(relayReply)](std::uint64_t queryId, std::optional<SBLReply> reply,
-                                              std::optional<Error> error) mutable {
+  return [relayReply = std::move(relayReply)](std::uint64_t queryId, const std::optional<SBLReply>& reply,
+                                              const std::optional<Error>& error) mutable {
     sendRequestReply(relayReply, queryId, reply, error);
   };
 }

@@ -10,7 +10,7 @@ using platform::HTTPSession;
 using platform::Runtime;
 
 std::shared_ptr<HTTPDataTask> dataTaskWithRetryableRequest(
-    Runtime& runtime, HTTPSession& session, std::shared_ptr<const SBLRetryableNetworkRequest> request,
+    Runtime& runtime, HTTPSession& session, const std::shared_ptr<const SBLRetryableNetworkRequest>& request,
     unsigned attempt, unsigned retriesRemaining, HTTPSession::Completion completion,
     std::function<void(HTTPDataTask&)> prepare) {
   auto finish = [&runtime, &session, request, attempt, retriesRemaining, completion = std::move(completion),

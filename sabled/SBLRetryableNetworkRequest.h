@@ -27,8 +27,8 @@ inline constexpr platform::Duration kSBLRetryDelay = std::chrono::milliseconds(1
 /// each task before it is resumed or returned, for routing.
 std::shared_ptr<platform::HTTPDataTask> dataTaskWithRetryableRequest(
     platform::Runtime& runtime, platform::HTTPSession& session,
-    std::shared_ptr<const SBLRetryableNetworkRequest> request, unsigned attempt, unsigned retriesRemaining,
-    platform::HTTPSession::Completion completion,
+    const std::shared_ptr<const SBLRetryableNetworkRequest>& request, unsigned attempt,
+    unsigned retriesRemaining, platform::HTTPSession::Completion completion,
     std::function<void(platform::HTTPDataTask&)> prepare = nullptr);
 
 /// A count of monotonic ticks in whole milliseconds.

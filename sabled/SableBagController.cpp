@@ -13,6 +13,7 @@
 #include "platform/URL.h"
 #include "platform/UserDefaults.h"
 #include "sabled/Assembly.h"
+#include "sabled/ClientNames.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SBLRetryableNetworkRequest.h"
 #include "sabled/SableLogging.h"
@@ -99,13 +100,14 @@ SableBagController::~SableBagController() = default;
 
 std::string SableBagController::bagFetchURLWithCountry(std::string_view countryCode) const {
   const auto& defaults = assembly_.userDefaults;
-  const std::string chosen = defaults.string("SBLBagURL").value_or("");
+  std::string chosen = defaults.string("SBLBagURL").value_or("");
   if (!chosen.empty()) {
     if (platform::URL::parse(chosen)) return chosen;
     log().error("Malformed sable bag URL in user defaults key {}", "SBLBagURL");
   }
-  const bool china = countryCode == "CN" || countryCode == "cn" || countryCode == "Cn" || countryCode == "cN";
-  if (china) return defaults.string("SBLDefaultBagURLCN").value_or("https://search-cn.kestrel.invalid/bag");
+  if (lowercasedASCII(countryCode) == "cn") {
+    return defaults.string("SBLDefaultBagURLCN").value_or("https://search-cn.kestrel.invalid/bag");
+  }
   return defaults.string("SBLDefaultBagURL").value_or("https://search.kestrel.invalid/bag");
 }
 
@@ -220,7 +222,7 @@ void SableBagController::_fetchBagStateWithVersion(const std::string& version) {
   request->delayOnFail = true;
   log().standard("Initiating bag fetch attempt with request {} header {}", request->httpRequest.url,
                  request->httpRequest.headers.description());
-  auto completion = [this, transaction = std::move(transaction)](HTTPResult result) {
+  auto completion = [this, transaction = std::move(transaction)](const HTTPResult& result) {
     fetchDidComplete(userAgent_, result);
   };
   dataTaskWithRetryableRequest(assembly_.runtime, assembly_.bagSession(), std::move(request), 1,

@@ -64,11 +64,34 @@ Child::~Child() {
   ::waitpid(pid_, nullptr, 0);
 }
 
+const char* suffix(Placement placement) {
+  switch (placement) {
+    case Placement::twoProcessors:
+      return "_two_cpus";
+    case Placement::oneProcessor:
+      return "_one_cpu";
+    default:
+      return "";
+  }
+}
+
+namespace {
+
 void useProcessor(int number) {
   cpu_set_t set;
   CPU_ZERO(&set);
   CPU_SET(static_cast<std::size_t>(number), &set);
   ::sched_setaffinity(0, sizeof set, &set);
+}
+
+}  // namespace
+
+void placeServers(Placement placement) {
+  if (placement != Placement::free) useProcessor(placement == Placement::twoProcessors ? 1 : 0);
+}
+
+void placeClient(Placement placement) {
+  if (placement != Placement::free) useProcessor(0);
 }
 
 }  // namespace sable::bench

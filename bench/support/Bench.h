@@ -139,7 +139,14 @@ class RawServer {
   Child process_;
 };
 
-/// Puts this thread, and what it starts from now on, on one processor.
-void useProcessor(int number);
+/// Where the two sides of a call run. Left to the scheduler they may share a processor or not, which
+/// changes a call's time sixfold and is not the same for daemon and floor: so it is fixed, too.
+enum class Placement { free, twoProcessors, oneProcessor };
+/// "", "_two_cpus", "_one_cpu", behind a measure's name.
+const char* suffix(Placement placement);
+/// For what is started from now on.
+void placeServers(Placement placement);
+/// For this thread, once the servers are there.
+void placeClient(Placement placement);
 
 }  // namespace sable::bench

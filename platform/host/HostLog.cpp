@@ -48,6 +48,11 @@ bool mayForge(UChar32 character) {
   return (U_MASK(u_charType(character)) & (U_GC_CC_MASK | U_GC_CF_MASK | U_GC_ZL_MASK | U_GC_ZP_MASK)) != 0;
 }
 
+/// What stands for itself: printable ASCII, which nearly all of a log is.
+bool isPlain(char byte) {
+  return byte >= ' ' && byte <= '~';
+}
+
 /// The character at `next`, which moves past it; negative for bytes that are no UTF-8.
 UChar32 takeCharacter(std::string_view text, std::int64_t& next) {
   const char* bytes = text.data();
@@ -66,6 +71,9 @@ void appendEscaped(fmt::memory_buffer& line, std::string_view text) {
   const auto length = static_cast<std::int64_t>(text.size());
   for (std::int64_t next = 0; next < length;) {
     const std::int64_t start = next;
+    while (next < length && isPlain(bytes[next])) ++next;
+    line.append(bytes + start, bytes + next);
+    if (next > start) continue;
     const UChar32 character = takeCharacter(text, next);
     if (character == '\n') {
       fmt::format_to(out, "\\n");

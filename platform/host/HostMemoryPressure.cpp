@@ -109,6 +109,9 @@ class HostMemoryPressure::Sensors : public std::enable_shared_from_this<Sensors>
 class HostMemoryPressure::Listeners : public std::enable_shared_from_this<Listeners> {
  public:
   struct Listener {
+    Listener(std::shared_ptr<SerialQueue> onQueue, std::function<void()> handle)
+        : queue(std::move(onQueue)), handler(std::move(handle)) {}
+
     std::shared_ptr<SerialQueue> queue;
     std::function<void()> handler;
     std::atomic<bool> alive = true;

@@ -11,6 +11,9 @@
 namespace sable::platform::host {
 
 struct HostNotify::Bus {
+  Bus(HostReactor& itsReactor, std::string itsAddress)
+      : reactor(itsReactor), address(std::move(itsAddress)) {}
+
   HostReactor& reactor;
   const std::string address;
   std::atomic<bool> failureLogged = false;

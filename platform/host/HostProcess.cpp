@@ -29,6 +29,8 @@ sigset_t setOf(TerminationSignal signal) {
 class HostProcess::Signal {
  public:
   struct Listener {
+    Listener(Queue& onQueue, std::function<void()> handle) : queue(onQueue), handler(std::move(handle)) {}
+
     Queue& queue;
     std::function<void()> handler;
     std::atomic<bool> alive = true;

@@ -64,11 +64,11 @@ Expected<void> HostRelayListener::resume() {
     if (const int activated = takeActivationSocket(); activated >= 0) return takeActivated(activated);
   }
   if (!folder_.empty() && path_.starts_with(folder_ + "/")) {
-    if (const auto made = makePrivateFolder(folder_); !made) return made;
+    if (auto made = makePrivateFolder(folder_); !made) return made;
   }
   if (kind_ == Kind::named) {
-    if (const auto locked = lock(); !locked) return locked;
-    if (const auto removed = removeStale(); !removed) return removed;
+    if (auto locked = lock(); !locked) return locked;
+    if (auto removed = removeStale(); !removed) return removed;
     removeDeadEndpoints();
   }
   auto socket = listenAt(path_);

@@ -123,7 +123,7 @@ std::string parentOf(const std::string& bundle) {
 std::string calendarOf(const std::string& localeIdentifier) {
   const icu::Locale locale(localeIdentifier.c_str());
   UErrorCode status = U_ZERO_ERROR;
-  const auto wish = locale.getKeywordValue<std::string>("calendar", status);
+  auto wish = locale.getKeywordValue<std::string>("calendar", status);
   if (U_SUCCESS(status) && !wish.empty() && Resource("root").at({"calendar", wish.c_str()}).exists())
     return wish;
   return ofRegion(Resource("supplementalData").at({"calendarPreferenceData"}), regionOf(locale))

@@ -3,7 +3,7 @@
 #include <string>
 
 /// What CLDR says of a locale's conventions, looked up in ICU's data. ICU's formatters would tell the
-/// same, but making one of each keeps 4 MiB of them mapped and takes 10 ms of the first search.
+/// same, but making one of each keeps 3.6 MiB more of them in memory for good.
 /// Identifiers are POSIX ("de_DE@mu=fahrenhe") or BCP 47 with Unicode extensions.
 namespace sable::platform::host {
 

@@ -36,7 +36,7 @@ bool isUTF8(const std::string& text) {
 }
 
 bool isWireText(const std::string& text) {
-  if (std::memchr(text.data(), 0, text.size()) != nullptr) return false;
+  if (text.find('\0') != std::string::npos) return false;
   return isPlainASCII(text) || isUTF8(text);
 }
 

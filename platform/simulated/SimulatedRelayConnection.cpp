@@ -158,7 +158,7 @@ void SimulatedRelayConnection::call(const RelayInterface& interface, std::size_t
 }
 
 void SimulatedRelayConnection::post(std::uint64_t cookie, const RelayInterface& interface,
-                                    const RelayMethod& method, RelayArguments arguments) {
+                                    const RelayMethod& method, const RelayArguments& arguments) {
   requireRelaySignature(arguments, method.in, method.name);
   const auto other = other_.lock();
   if (!other || hasEnded()) return;

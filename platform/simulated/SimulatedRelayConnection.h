@@ -48,7 +48,7 @@ class SimulatedRelayConnection final : public RelayConnection,
   };
 
   void post(std::uint64_t cookie, const RelayInterface& interface, const RelayMethod& method,
-            RelayArguments arguments);
+            const RelayArguments& arguments);
   void receive(Message message);
   void enqueue(Message message);
   void dispatch(const RelayInterface& interface, std::string_view method, RelayArguments arguments,
