@@ -139,8 +139,9 @@ class RawServer {
   Child process_;
 };
 
-/// Where the two sides of a call run. Left to the scheduler they may share a processor or not, which
-/// changes a call's time sixfold and is not the same for daemon and floor: so it is fixed, too.
+/// Where the two sides of a call run. Left to the scheduler, the floor's may share a processor while the
+/// daemon's do not, or the other way round, which changes a call's time sixfold: a bound is held where
+/// both have the same places, client and servers on a processor each.
 enum class Placement { free, twoProcessors, oneProcessor };
 /// "", "_two_cpus", "_one_cpu", behind a measure's name.
 const char* suffix(Placement placement);

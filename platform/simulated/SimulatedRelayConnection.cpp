@@ -135,7 +135,7 @@ void SimulatedRelayConnection::invalidate() {
 
 void SimulatedRelayConnection::send(const RelayInterface& interface, std::size_t method,
                                     RelayArguments arguments) {
-  post(0, interface, interface.methods[method], std::move(arguments));
+  post(0, interface, interface.methods[method], arguments);
 }
 
 void SimulatedRelayConnection::call(const RelayInterface& interface, std::size_t method,
@@ -154,7 +154,7 @@ void SimulatedRelayConnection::call(const RelayInterface& interface, std::size_t
     });
     pending_.emplace(cookie, PendingCall{&description, std::move(handler), std::move(timer)});
   }
-  post(cookie, interface, description, std::move(arguments));
+  post(cookie, interface, description, arguments);
 }
 
 void SimulatedRelayConnection::post(std::uint64_t cookie, const RelayInterface& interface,
