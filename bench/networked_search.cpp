@@ -87,7 +87,7 @@ void compare(Placement placement, std::optional<double> bound, int argc, char** 
 }  // namespace
 
 int main(int argc, char** argv) {
-  compare(Placement::free, std::nullopt, argc, argv);
+  compare(Placement::free, 1.35, argc, argv);
   compare(Placement::twoProcessors, 1.35, argc, argv);
   compare(Placement::oneProcessor, std::nullopt, argc, argv);
 }

@@ -76,7 +76,7 @@ void throughput(const std::string& name, int argc, char** argv) {
 }  // namespace
 
 int main(int argc, char** argv) {
-  roundTrips(Placement::free, std::nullopt, argc, argv);
+  roundTrips(Placement::free, 2.0, argc, argv);
   throughput(fmt::format("refused_search_{}_clients", kClients), argc, argv);
   roundTrips(Placement::twoProcessors, 2.0, argc, argv);
   roundTrips(Placement::oneProcessor, std::nullopt, argc, argv);

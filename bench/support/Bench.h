@@ -140,8 +140,8 @@ class RawServer {
 };
 
 /// Where the two sides of a call run. Left to the scheduler, the floor's may share a processor while the
-/// daemon's do not, or the other way round, which changes a call's time sixfold: a bound is held where
-/// both have the same places, client and servers on a processor each.
+/// daemon's do not, or the other way round, which changes a call's time sixfold: so both are measured with
+/// the same places as well, client and servers on a processor each.
 enum class Placement { free, twoProcessors, oneProcessor };
 /// "", "_two_cpus", "_one_cpu", behind a measure's name.
 const char* suffix(Placement placement);
