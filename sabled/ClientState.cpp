@@ -8,8 +8,10 @@
 #include "SableKit/SBLError.h"
 #include "platform/NetworkServiceProxy.h"
 #include "platform/Tally.h"
+#include "platform/UserDefaults.h"
 #include "sabled/Assembly.h"
 #include "sabled/ClientNames.h"
+#include "sabled/QueryCache.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SableBagController.h"
 #include "sabled/SableLogging.h"
@@ -40,6 +42,10 @@ ClientState::ClientState(std::string identifier, Assembly& assembly)
       clientShortName_(shortName(identifier_)),
       queue_(assembly.runtime.serialQueue("com.kestrel.sabled.clientState")),
       bagFetchSemaphore_(assembly.runtime.semaphore(0)) {
+  if (!assembly_.userDefaults.boolean("SBLNoQueryCache").value_or(false)) {
+    queryCache_ = std::make_unique<QueryCache>(assembly_);
+  }
+  log().standard("query cache {} for {}", queryCache_ == nullptr ? "OFF" : "ON", identifier_);
   if (assembly_.sharedSession) {
     log().standard("Sable is using shared instance of guid controller");
     guidController_ = assembly_.guidController.get();
@@ -71,13 +77,16 @@ std::shared_ptr<const SBLBag> ClientState::heldBag() const {
 }
 
 void ClientState::bag(const std::string& userAgent, BagReply reply) {
+  bool isNew = false;
   const bool hasAgent = queue_->sync([&] {
-    if (!userAgent.empty() && userAgent_ != userAgent) {
+    isNew = !userAgent.empty() && userAgent_ != userAgent;
+    if (isNew) {
       userAgent_ = userAgent;
       if (bag_ != nullptr) bag_ = std::make_shared<const SBLBag>(bag_->rawBag(), userAgent);
     }
     return userAgent_.has_value();
   });
+  if (isNew && queryCache_ != nullptr) queryCache_->removeAllObjects();
   if (!hasAgent) return reply(nullptr, makeSBLError(SBLErrorCode::bagMissing, "no UserAgent"));
   if (!_ensureBag()) return reply(heldBag(), makeSBLError(SBLErrorCode::bagMissing, "timeout"));
   reply(heldBag(), std::nullopt);

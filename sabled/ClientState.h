@@ -15,8 +15,10 @@ namespace sable {
 
 class Assembly;
 class ClientSessionManager;
+class QueryCache;
 class SBLBag;
 class SableUserGUIDController;
+struct SearchResponse;
 
 /// Everything the daemon keeps for one client session identifier, shared by all connections that
 /// present it, for the life of the process; and the road of each kind of query. Operations run on
@@ -30,6 +32,8 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   const std::string& identifier() const { return identifier_; }
   /// The first known product that the identifier names ("rover"), for counters; or none.
   const std::optional<std::string>& clientShortName() const { return clientShortName_; }
+  /// Null when the setting "SBLNoQueryCache" turned it off.
+  QueryCache* queryCache() const { return queryCache_.get(); }
   /// Null when the daemon records no sessions.
   ClientSessionManager* sessionManager() const { return sessionManager_; }
 
@@ -38,8 +42,8 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   void setConfiguration(SBLSessionConfiguration configuration);
 
   using BagReply = platform::Function<void(std::shared_ptr<const SBLBag>, std::optional<Error>)>;
-  /// The bag as `userAgent` sees it; a new agent rebuilds it. Waits up to 1 s for the first bag,
-  /// then answers with an error.
+  /// The bag as `userAgent` sees it; a new agent rebuilds it and empties the query cache. Waits up
+  /// to 1 s for the first bag, then answers with an error.
   void bag(const std::string& userAgent, BagReply reply);
 
   /// Opens a connection to the service ahead of a search, unless one was used within 30 s.
@@ -47,6 +51,7 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
 
   // Each replies exactly once. Its gates, in order: a bag, a bag that enables the service for this
   // agent, and for searches enough text; a refused query is answered with neither reply nor error.
+  // A search without forced query items may be answered from the query cache.
   void search(const SBLSearchRequest& request, SBLReplyHandler reply);
   void zeroKeyword(const SBLZeroKeywordRequest& request, SBLReplyHandler reply);
   void lookup(const SBLLookupRequest& request, SBLReplyHandler reply);
@@ -71,7 +76,10 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   bool passesGates(Query& query);
   void dispatch(const std::shared_ptr<Query>& query, std::optional<platform::HTTPRequest> request);
   void didComplete(Query& query, platform::HTTPResult result);
-  std::optional<Error> processAnswer(const Query& query, const std::string& body);
+  std::optional<Error> processAnswer(const Query& query, const Data& data);
+  bool answerFromCache(Query& query, const SBLSearchRequest& request);
+  void _cacheResponse(const SearchResponse& response, const Query& query, const Data& data, const UUID& uuid);
+  SBLReply replyWith(const Query& query, Data data) const;
   bool routesThroughProxy(const Query& query) const;
   void enableProxy(platform::HTTPDataTask& task) const;
   void recordSearchResult(int status);
@@ -83,6 +91,7 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   const std::optional<std::string> clientShortName_;
   const std::shared_ptr<platform::SerialQueue> queue_;
   const std::unique_ptr<platform::Semaphore> bagFetchSemaphore_;
+  std::unique_ptr<QueryCache> queryCache_;
   std::unique_ptr<SableUserGUIDController> ownGUIDController_;
   SableUserGUIDController* guidController_;
   ClientSessionManager* sessionManager_;

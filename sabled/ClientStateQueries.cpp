@@ -10,9 +10,11 @@
 #include "platform/NetworkServiceProxy.h"
 #include "platform/Tally.h"
 #include "sabled/Assembly.h"
+#include "sabled/CachedResultSet.h"
 #include "sabled/ClientNames.h"
 #include "sabled/ClientState.h"
 #include "sabled/ClientStateManager.h"
+#include "sabled/QueryCache.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SBLRetryableNetworkRequest.h"
 #include "sabled/SableBagController.h"
@@ -167,6 +169,7 @@ void ClientState::search(const SBLSearchRequest& request, SBLReplyHandler reply)
     query->reply(query->queryId, std::nullopt, std::nullopt);
     return;
   }
+  if (answerFromCache(*query, request)) return;
   dispatch(query, assembly_.requestFactory->searchRequest(
                       request, *query->bag, guidController_->currentUserGUID(), query->fieldMask));
   assembly_.tally.add(kSBLSearchCounterKey, 1);
@@ -255,13 +258,8 @@ void ClientState::didComplete(Query& query, HTTPResult result) {
                        makeSBLError(SBLErrorCode::daemonSide, "invalid response class"));
   }
 
-  std::optional<Error> parseError = processAnswer(query, *result.data);
-  SBLReply reply;
-  reply.scale = query.scale;
-  reply.data = std::move(result.data);
-  if (const auto entity = assembly_.requestFactory->getMapsUserSessionEntityAndReset(false)) {
-    reply.geoSessionEntityString = entity->entityString;
-  }
+  std::optional<Error> parseError = processAnswer(query, result.data);
+  SBLReply reply = replyWith(query, std::move(result.data));
   if (query.verboseReply) {
     reply.httpRequest = query.httpRequest;
     reply.httpResponse = std::move(result.response);
@@ -271,17 +269,52 @@ void ClientState::didComplete(Query& query, HTTPResult result) {
 }
 
 /// Takes from an answer what concerns the daemon; says why it is no JSON, if it is none.
-std::optional<Error> ClientState::processAnswer(const Query& query, const std::string& body) {
-  const auto response = SearchResponse::parse(body);
+std::optional<Error> ClientState::processAnswer(const Query& query, const Data& data) {
+  const auto response = SearchResponse::parse(*data);
   std::optional<Error> parseError = response ? std::nullopt : std::optional(response.error());
-  if (response) assembly_.clientStateManager->processImagesFromResponse(*response, *query.bag);
+  if (response) {
+    assembly_.clientStateManager->processImagesFromResponse(*response, *query.bag);
+    if (&query.kind == &kSearch) _cacheResponse(*response, query, data, assembly_.runtime.uuid());
+  }
   if (query.kind.expectsObject && (!response || !response->isObject)) {
     // The missing word after "for" is part of the line that log readers match.
     query.log().error(
         "Failed to deserialize card details for into a dictionary. Error: {}. Response data: \"{}\"",
-        parseError ? parseError->description() : "(null)", body);
+        parseError ? parseError->description() : "(null)", *data);
   }
   return parseError;
+}
+
+/// Answers a search from what the service said to an earlier one, if it can.
+bool ClientState::answerFromCache(Query& query, const SBLSearchRequest& request) {
+  if (queryCache_ == nullptr) return false;
+  const auto hit = queryCache_->getRequest(request);
+  // Whoever forces query items wants to know what the service makes of them.
+  if (hit == nullptr || !request.queryItems.empty()) return false;
+  query.reply(query.queryId, replyWith(query, hit->data), std::nullopt);
+  count("ondevicecachehits");
+  return true;
+}
+
+void ClientState::_cacheResponse(const SearchResponse& response, const Query& query, const Data& data,
+                                 const UUID& uuid) {
+  if (queryCache_ == nullptr) return;
+  const platform::WallTime now = assembly_.runtime.now();
+  for (const SearchResponse::ResultSet& set : response.resultSets) {
+    if (set.status == "ERROR") continue;
+    queryCache_->set(
+        std::make_shared<const CachedResultSet>(query.input, query.httpRequest, set, uuid, data, now));
+  }
+}
+
+SBLReply ClientState::replyWith(const Query& query, Data data) const {
+  SBLReply reply;
+  reply.scale = query.scale;
+  reply.data = std::move(data);
+  if (const auto entity = assembly_.requestFactory->getMapsUserSessionEntityAndReset(false)) {
+    reply.geoSessionEntityString = entity->entityString;
+  }
+  return reply;
 }
 
 void ClientState::recordSearchResult(int status) {

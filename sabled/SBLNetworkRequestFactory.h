@@ -25,6 +25,9 @@ class SableURLRequestBuilder;
 /// depends.
 inline constexpr std::string_view kSBLBagRefreshRequired = "SBLBagRefreshRequired";
 
+/// The scale of the client's screen, with one decimal.
+inline constexpr std::string_view kUIScaleHeader = "X-Kestrel-UI-Scale";
+
 /// Bit 0 of a field mask: nothing that tells where the device is, and no privacy proxy.
 inline constexpr unsigned kSBLFieldMaskNoLocation = 1;
 

@@ -176,7 +176,7 @@ void SBLNetworkRequestFactory::_addHttpRequestUserAgent(Builder& builder, std::s
 
 void SBLNetworkRequestFactory::_addHttpRequestUIScale(Builder& builder, double scale) const {
   contextAccessQueue_->assertIsCurrent();
-  if (scale > 0) builder.defaultHttpHeaderWithName("X-Kestrel-UI-Scale", fmt::format("{:.1f}", scale));
+  if (scale > 0) builder.defaultHttpHeaderWithName(kUIScaleHeader, fmt::format("{:.1f}", scale));
 }
 
 void SBLNetworkRequestFactory::_addHttpRequestPreferredLanguages(Builder& builder) const {

@@ -25,7 +25,7 @@ struct SearchResponse {
   };
 
   bool isObject = false;
-  std::vector<ResultSet> resultSets;  ///< empty unless the answer is an array
+  std::vector<ResultSet> resultSets;  ///< the objects of an answer that is an array
   /// Found under "image" and "images" at up to 64 levels.
   std::vector<ImageDescription> images;
 
