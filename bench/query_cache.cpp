@@ -22,6 +22,7 @@
 #include "sabled/CachedResultSet.h"
 #include "sabled/CritbitTree.h"
 #include "sabled/QueryCache.h"
+#include "sabled/SBLNetworkRequestFactory.h"
 
 namespace {
 
@@ -152,7 +153,7 @@ void measureLookups(const std::vector<std::string>& keys, const std::vector<std:
   sable::Assembly assembly(device);
   sable::QueryCache cache(assembly);
   sable::platform::HTTPRequest sent;
-  sent.headers.set("X-Kestrel-UI-Scale", "2.0");
+  sent.headers.set(sable::kUIScaleHeader, "2.0");
   const auto data = sable::makeData(std::string("[]"));
   for (const std::string& key : keys) {
     const double score = static_cast<double>(key.size() % 7) / 10;
