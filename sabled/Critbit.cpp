@@ -1,5 +1,6 @@
 #include "sabled/Critbit.h"
 
+#include <cstdint>
 #include <cstdlib>
 #include <cstring>
 #include <memory_resource>
@@ -10,9 +11,9 @@
 namespace sable {
 namespace {
 
-using Reference = std::uintptr_t;
+using Reference = char*;
 
-constexpr Reference kInternalTag = 1;
+constexpr std::uintptr_t kInternalTag = 1;
 
 struct InternalNode {
   Reference child[2];
@@ -29,7 +30,7 @@ struct ExternalNode {
 static_assert(sizeof(ExternalNode) + 1 == kCritbitExternalNodeBytes);
 
 bool isInternal(Reference reference) {
-  return (reference & kInternalTag) != 0;
+  return (reinterpret_cast<std::uintptr_t>(reference) & kInternalTag) != 0;
 }
 InternalNode* internalNode(Reference reference) {
   return reinterpret_cast<InternalNode*>(reference - kInternalTag);
@@ -38,7 +39,7 @@ ExternalNode* externalNode(Reference reference) {
   return reinterpret_cast<ExternalNode*>(reference);
 }
 Reference referenceTo(InternalNode* node) {
-  return reinterpret_cast<Reference>(node) | kInternalTag;
+  return reinterpret_cast<Reference>(node) + kInternalTag;
 }
 
 unsigned direction(std::uint8_t otherBits, char byte) {
@@ -50,7 +51,7 @@ unsigned direction(const InternalNode& node, std::string_view key) {
   return direction(node.otherBits, node.byte < key.size() ? key[node.byte] : '\0');
 }
 
-/// The one external node that may hold `key`, below a reference that is not 0.
+/// The one external node that may hold `key`, below a reference that is not null.
 ExternalNode* find_next_external_node(Reference reference, std::string_view key) {
   while (isInternal(reference)) {
     const InternalNode& node = *internalNode(reference);
@@ -123,7 +124,7 @@ int insertBeside(critbit_tree* tree, char* neighbour, std::size_t at, std::strin
   return 2;
 }
 
-/// Frees everything below a reference that is not 0. Turns the tree until its first key hangs from
+/// Frees everything below a reference that is not null. Turns the tree until its first key hangs from
 /// the top, takes that off, and goes on: deep trees cost time, no stack.
 void traverse(const critbit_tree& tree, Reference top) {
   while (isInternal(top)) {
@@ -144,11 +145,11 @@ void traverse(const critbit_tree& tree, Reference top) {
   std::free(externalNode(top));
 }
 
-/// Visits everything below a reference that is not 0, child 0 first. What is still to come is on the
+/// Visits everything below a reference that is not null, child 0 first. What is still to come is on the
 /// heap only where a hostile choice of keys makes the tree deep.
 void allprefixed_traverse(Reference top, prefix_callback callback, void* context) {
   constexpr std::size_t kUsualDepth = 64;
-  std::byte room[kUsualDepth * sizeof(Reference)];
+  alignas(Reference) std::byte room[kUsualDepth * sizeof(Reference)];
   std::pmr::monotonic_buffer_resource memory(room, sizeof room);
   std::pmr::vector<Reference> pending(&memory);
   pending.reserve(kUsualDepth);
@@ -168,7 +169,7 @@ void allprefixed_traverse(Reference top, prefix_callback callback, void* context
 }  // namespace
 
 bool critbit_contains(const critbit_tree* tree, const char* key, void** value) {
-  if (tree->root == 0) return false;
+  if (tree->root == nullptr) return false;
   ExternalNode* node = find_next_external_node(tree->root, key);
   if (std::strcmp(node->key(), key) != 0) return false;
   if (value != nullptr) *value = node->value;
@@ -178,7 +179,7 @@ bool critbit_contains(const critbit_tree* tree, const char* key, void** value) {
 int critbit_insert(critbit_tree* tree, const char* text, void* value, bool replace) {
   const std::string_view key = text;
   if (key.size() >= UINT32_MAX) return 0;
-  if (tree->root == 0) return insertFirst(tree, key, value);
+  if (tree->root == nullptr) return insertFirst(tree, key, value);
   ExternalNode* closest = find_next_external_node(tree->root, key);
   for (std::size_t i = 0; i <= key.size(); ++i) {
     if (closest->key()[i] != text[i]) return insertBeside(tree, closest->key(), i, key, value);
@@ -192,7 +193,7 @@ int critbit_insert(critbit_tree* tree, const char* text, void* value, bool repla
 }
 
 bool critbit_delete(critbit_tree* tree, const char* text) {
-  if (tree->root == 0) return false;
+  if (tree->root == nullptr) return false;
   const std::string_view key = text;
   Reference* place = &tree->root;
   Reference* parentsPlace = nullptr;
@@ -206,7 +207,7 @@ bool critbit_delete(critbit_tree* tree, const char* text) {
   ExternalNode* found = externalNode(*place);
   if (std::strcmp(found->key(), text) != 0) return false;
   if (parentsPlace == nullptr) {
-    tree->root = 0;
+    tree->root = nullptr;
   } else {
     InternalNode* parent = internalNode(*parentsPlace);
     *parentsPlace = parent->child[1 - side];
@@ -219,14 +220,14 @@ bool critbit_delete(critbit_tree* tree, const char* text) {
 }
 
 void critbit_clear(critbit_tree* tree) {
-  if (tree->root != 0) traverse(*tree, tree->root);
-  tree->root = 0;
+  if (tree->root != nullptr) traverse(*tree, tree->root);
+  tree->root = nullptr;
   tree->count = 0;
 }
 
 void critbit_allprefixed(const critbit_tree* tree, const char* text, prefix_callback callback,
                          void* context) {
-  if (tree->root == 0) return;
+  if (tree->root == nullptr) return;
   const std::string_view prefix = text;
   Reference top = tree->root, reached = top;
   while (isInternal(reached)) {

@@ -1,7 +1,6 @@
 #pragma once
 
 #include <cstddef>
-#include <cstdint>
 
 /// A crit-bit tree: a map from C strings to pointers that keeps its keys in the order of their bytes
 /// and finds all that begin alike in one walk. A binary tree in which every internal node names the
@@ -11,16 +10,16 @@
 ///   internal node   child 0 (8) | child 1 (8) | byte index (4) | other bits (1) | padding (3)
 ///   external node   value (8) | key | 0
 ///
-/// "Other bits" is the complement of the one bit that counts within its byte. References to
-/// internal nodes have their lowest bit set, which alignment leaves free. A tree of n keys has n
-/// external and n - 1 internal nodes, so a key costs its length and 33 bytes.
+/// "Other bits" is the complement of the one bit that counts within its byte. A reference is a
+/// node's address; for internal nodes the lowest bit, which alignment leaves free, is set. A tree of n keys
+/// has n external and n - 1 internal nodes, so a key costs its length and 33 bytes.
 ///
 /// Any bytes but zero may stand in a key, which ends at the first zero; keys may be prefixes of one
 /// another, and one of 4 GiB is refused. However deep the tree, nothing recurses. No locking.
 namespace sable {
 
 struct critbit_tree {
-  std::uintptr_t root = 0;  ///< 0: empty
+  char* root = nullptr;  ///< a reference; null: empty
   std::size_t count = 0;
   /// Called with a value that is replaced or removed; may be null. Must not touch the tree.
   void (*value_release)(void* value) = nullptr;
