@@ -107,14 +107,15 @@ void SBLClient::connect(platform::Function<void(Expected<platform::RelayEndpoint
   });
 }
 
-void SBLClient::call(std::size_t method, RelayArguments arguments, ResultHandler handler) {
+void SBLClient::call(const platform::RelayInterface& interface, std::size_t method, RelayArguments arguments,
+                     ResultHandler handler) {
   const auto connection = queue_->sync([this] { return ensureConnection(); });
   if (!connection) {
     return callbackQueue_->async([handler = std::move(handler), error = connection.error()]() mutable {
       handler(tl::unexpected(error));
     });
   }
-  (*connection)->call(kSBLDaemonRelay, method, std::move(arguments), timeout_, std::move(handler));
+  (*connection)->call(interface, method, std::move(arguments), timeout_, std::move(handler));
 }
 
 void SBLClient::request(const SBLAnyRequest& request, SBLReplyHandler handler) {
@@ -123,7 +124,7 @@ void SBLClient::request(const SBLAnyRequest& request, SBLReplyHandler handler) {
 
 void SBLClient::request(std::string className, RelayRecord record, SBLReplyHandler handler) {
   const std::uint64_t queryId = record.unsignedInteger("queryId").value_or(0);
-  call(SBLDaemonRelay::request, {std::move(className), std::move(record)},
+  call(kSBLDaemonRelay, SBLDaemonRelay::request, {std::move(className), std::move(record)},
        [queryId, handler = std::move(handler)](Expected<RelayArguments> result) mutable {
          if (!result) return handler(queryId, std::nullopt, result.error());
          handler(std::get<std::uint64_t>((*result)[0]), decodeReply(std::get<RelayRecord>((*result)[1])),
@@ -132,11 +133,12 @@ void SBLClient::request(std::string className, RelayRecord record, SBLReplyHandl
 }
 
 void SBLClient::bag(platform::Function<void(std::string, std::string, std::optional<Error>)> handler) {
-  call(SBLDaemonRelay::bag, {}, [handler = std::move(handler)](Expected<RelayArguments> result) mutable {
-    if (!result) return handler({}, {}, result.error());
-    handler(std::get<std::string>((*result)[0]), std::get<std::string>((*result)[1]),
-            decodeError(std::get<RelayRecord>((*result)[2])));
-  });
+  call(kSBLDaemonRelay, SBLDaemonRelay::bag, {},
+       [handler = std::move(handler)](Expected<RelayArguments> result) mutable {
+         if (!result) return handler({}, {}, result.error());
+         handler(std::get<std::string>((*result)[0]), std::get<std::string>((*result)[1]),
+                 decodeError(std::get<RelayRecord>((*result)[2])));
+       });
 }
 
 void SBLClient::disconnect() {

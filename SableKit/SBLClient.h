@@ -44,8 +44,10 @@ class SBLClient : public std::enable_shared_from_this<SBLClient> {
   void request(std::string className, platform::RelayRecord record, SBLReplyHandler handler);
   void bag(platform::Function<void(std::string rawBag, std::string userAgent, std::optional<Error>)> handler);
 
-  /// Any method of SBLDaemonRelay, with its arguments and results as they travel.
-  void call(std::size_t method, platform::RelayArguments arguments, ResultHandler handler);
+  /// Any method that the daemon exports on a client's connection, with its arguments and results as
+  /// they travel.
+  void call(const platform::RelayInterface& interface, std::size_t method, platform::RelayArguments arguments,
+            ResultHandler handler);
 
   /// Ends the connection.
   void disconnect();

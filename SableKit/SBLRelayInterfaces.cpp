@@ -19,6 +19,10 @@ constexpr std::array kDaemonMethods{
     RelayMethod{"FileHandleAndAttributesForResource", "s", "aha{sv}a{sv}"},
 };
 
+constexpr std::array kDiagnosticsMethods{
+    RelayMethod{"Explain", "sa{sv}", "s"},
+};
+
 constexpr std::array kClientMethods{
     RelayMethod{"BagDidLoad", "ssa{sv}", ""},
 };
@@ -32,6 +36,8 @@ constexpr std::array kEndpointMethods{
 
 const platform::RelayInterface kSBLDaemonRelay{"com.kestrel.SBLDaemonRelay", "/com/kestrel/sabled",
                                                kDaemonMethods};
+const platform::RelayInterface kSBLDiagnosticsRelay{"com.kestrel.SBLDiagnosticsRelay",
+                                                    "/com/kestrel/diagnostics", kDiagnosticsMethods};
 const platform::RelayInterface kSBLClientRelay{"com.kestrel.SBLClientRelay", "/com/kestrel/client",
                                                kClientMethods};
 const platform::RelayInterface kSBLEndpointRelay{"com.kestrel.SBLEndpointRelay", "/com/kestrel/endpoint",

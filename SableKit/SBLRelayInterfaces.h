@@ -24,6 +24,14 @@ struct SBLDaemonRelay {
   };
 };
 
+/// Exported beside it, for those who look into the daemon.
+extern const platform::RelayInterface kSBLDiagnosticsRelay;
+struct SBLDiagnosticsRelay {
+  enum Method : std::size_t {
+    explain,  ///< s class, a{sv} record -> s JSON: what the request would do, and why
+  };
+};
+
 /// Implemented by clients: the daemon pushes bags.
 extern const platform::RelayInterface kSBLClientRelay;
 struct SBLClientRelay {

@@ -15,9 +15,9 @@ using platform::HTTPCachePolicy;
 using platform::HTTPRequest;
 
 template <class Steps>
-HTTPRequest SBLNetworkRequestFactory::build(std::string_view url, Steps steps) {
+HTTPRequest SBLNetworkRequestFactory::build(std::string_view url, Steps steps, RequestTrace* trace) {
   return contextAccessQueue_->sync([&] {
-    auto builder = Builder::requestBuilderWithURL(url);
+    auto builder = Builder::requestBuilderWithURL(url, trace);
     if (!builder) {
       // A request that nobody can send: its task ends with the error that says so.
       HTTPRequest unusable;
@@ -79,15 +79,17 @@ HTTPRequest SBLNetworkRequestFactory::bagCacheRequest(const SableBagController& 
 
 std::optional<HTTPRequest> SBLNetworkRequestFactory::searchRequest(const SBLSearchRequest& input,
                                                                    const SBLBag& bag, const UUID& userGuid,
-                                                                   unsigned fieldMask) {
+                                                                   unsigned fieldMask, RequestTrace* trace) {
   if (!bag.searchURL()) return std::nullopt;
   const bool withLocation = (fieldMask & kSBLFieldMaskNoLocation) == 0;
-  HTTPRequest request = build(*bag.searchURL(), [&](Builder& builder) {
+  const auto steps = [&](Builder& builder) {
+    builder.beginStep("query");
     builder.forceQueryItemWithName("q", input.queryString);
     constexpr std::int64_t kSuggestionTapped = 8, kSuggestionTyped = 10;
     if (input.triggerEvent == kSuggestionTapped || input.triggerEvent == kSuggestionTyped) {
       builder.forceQueryItemWithName("qtype", "suggested");
     }
+    builder.beginStep("client's items");
     builder.forceQueryItemsFromArray(input.queryItems);
     _addDebugQueryItems(builder);
     _addSecretKeyQueryItem(builder);
@@ -117,7 +119,8 @@ std::optional<HTTPRequest> SBLNetworkRequestFactory::searchRequest(const SBLSear
     _addHttpRequestUIScale(builder, input.scale);
     _addHttpMapsEnvironmentName(builder, bag);
     _addHttpRequestMapsSessionId(builder);
-  });
+  };
+  HTTPRequest request = build(*bag.searchURL(), steps, trace);
   request.timeout = bag.timeoutIntervalForRequest();
   return withLocation ? proxiedIfEnabled(std::move(request)) : std::move(request);
 }

@@ -17,6 +17,7 @@
 namespace sable {
 
 class Assembly;
+class RequestTrace;
 class SBLBag;
 class SableBagController;
 class SableURLRequestBuilder;
@@ -48,9 +49,10 @@ class SBLNetworkRequestFactory {
   platform::HTTPRequest bagCacheRequest(const SableBagController& bagController, std::string_view userAgent,
                                         std::string_view version);
 
-  // nullopt when the bag has no search URL.
+  // nullopt when the bag has no search URL. A `trace` is told how the request came about.
   std::optional<platform::HTTPRequest> searchRequest(const SBLSearchRequest& input, const SBLBag& bag,
-                                                     const UUID& userGuid, unsigned fieldMask = 0);
+                                                     const UUID& userGuid, unsigned fieldMask = 0,
+                                                     RequestTrace* trace = nullptr);
   std::optional<platform::HTTPRequest> zeroKeywordRequest(const SBLZeroKeywordRequest& input,
                                                           const SBLBag& bag, const UUID& userGuid,
                                                           unsigned fieldMask = 0);
@@ -104,10 +106,11 @@ class SBLNetworkRequestFactory {
   };
 
   template <class Steps>
-  platform::HTTPRequest build(std::string_view url, Steps steps);
+  platform::HTTPRequest build(std::string_view url, Steps steps, RequestTrace* trace = nullptr);
   platform::HTTPRequest proxiedIfEnabled(platform::HTTPRequest request) const;
 
   // Steps of a request, on the context queue; each adds one item or header as its name says.
+  void beginStep(Builder& builder, const char* name) const;
   void _addSecretKeyQueryItem(Builder& builder) const;
   void _addLocaleQueryItem(Builder& builder) const;
   void _addDiagnosticsAndUsageQueryItem(Builder& builder) const;

@@ -11,6 +11,8 @@
 
 namespace sable {
 
+class RequestTrace;
+
 /// Collects the query items and headers of one request. "Force" sets one and replaces what was
 /// there; "default" sets it only where nothing of that name is: so the order of calls decides what
 /// wins, while on the wire the items always stand in the order of their names. One thread at a
@@ -18,8 +20,13 @@ namespace sable {
 class SableURLRequestBuilder {
  public:
   /// Starts from a URL, whose own query items count as forced: of two with one name the later one
-  /// stays. nullopt when `url` is no absolute URL.
-  static std::optional<SableURLRequestBuilder> requestBuilderWithURL(std::string_view url);
+  /// stays. nullopt when `url` is no absolute URL. A `trace`, which must outlive the builder, is told
+  /// of everything that is added.
+  static std::optional<SableURLRequestBuilder> requestBuilderWithURL(std::string_view url,
+                                                                     RequestTrace* trace = nullptr);
+
+  /// Names the step that what is added next belongs to, for the trace.
+  void beginStep(std::string_view step);
 
   bool containsQueryItemWithName(std::string_view name) const;
   void forceQueryItem(platform::URLQueryItem item);
@@ -37,9 +44,13 @@ class SableURLRequestBuilder {
   platform::HTTPRequest createMutableUrlRequest() const;
 
  private:
-  explicit SableURLRequestBuilder(platform::URL url);
+  SableURLRequestBuilder(platform::URL url, RequestTrace* trace);
+
+  std::optional<std::string> queryItemValue(std::string_view name) const;
+  std::optional<std::string> headerValue(std::string_view name) const;
 
   platform::URL urlComponents_;
+  RequestTrace* trace_;
   std::map<std::string, platform::URLQueryItem, std::less<>> queryItems_;
   platform::HTTPHeaders httpHeaders_;
 };

@@ -75,6 +75,12 @@ void addSearches(CLI::App& app, Invocation& invocation) {
   addRequestOptions(type, *typed);
   addText(type, "TEXT", typed->queryString, "What to type");
 
+  const auto explained = std::make_shared<SBLSearchRequest>();
+  CLI::App& explain = add(app, invocation, "explain", "Say what a search would do, and why",
+                          [explained](const Context& context) { return runExplain(context, *explained); });
+  addRequestOptions(explain, *explained);
+  addText(explain, "TEXT", explained->queryString, "What would be searched");
+
   addRequest(app, invocation, "zkw", "Ask what to offer before anything is typed",
              std::make_shared<SBLZeroKeywordRequest>());
 

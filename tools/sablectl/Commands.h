@@ -16,6 +16,8 @@ ExitCode runRequest(const Context& context, const std::string& className,
 ExitCode runType(const Context& context, SBLSearchRequest request);
 
 // What the daemon tells.
+/// What a search would do, and why: nothing is asked of the service.
+ExitCode runExplain(const Context& context, const SBLSearchRequest& request);
 ExitCode runBag(const Context& context);
 ExitCode runSessions(const Context& context);
 ExitCode runFeedback(const Context& context);

@@ -74,7 +74,7 @@ ExitCode runBag(const Context& context) {
 
 ExitCode runSessions(const Context& context) {
   return withSession(context, [&](Session& session) {
-    const auto result = session.call(SBLDaemonRelay::listSessions, {});
+    const auto result = session.call(kSBLDaemonRelay, SBLDaemonRelay::listSessions, {});
     if (!result) return fail(context, result.error());
     const Dictionary sessions = recordDocuments(std::get<platform::RelayRecords>((*result)[0]));
     if (context.output.json) {
@@ -88,7 +88,7 @@ ExitCode runSessions(const Context& context) {
 
 ExitCode runFeedback(const Context& context) {
   return withSession(context, [&](Session& session) {
-    const auto result = session.call(SBLDaemonRelay::feedback, {});
+    const auto result = session.call(kSBLDaemonRelay, SBLDaemonRelay::feedback, {});
     if (!result) return fail(context, result.error());
     if (const auto error = decodeError(std::get<RelayRecord>((*result)[1]))) return fail(context, *error);
     Dictionary entries = Dictionary::array();
@@ -109,7 +109,8 @@ ExitCode runFeedback(const Context& context) {
 ExitCode runResource(const Context& context, const std::string& identifier,
                      const std::optional<std::filesystem::path>& save) {
   return withSession(context, [&](Session& session) {
-    const auto result = session.call(SBLDaemonRelay::fileHandleAndAttributesForResource, {identifier});
+    const auto result =
+        session.call(kSBLDaemonRelay, SBLDaemonRelay::fileHandleAndAttributesForResource, {identifier});
     if (!result) return fail(context, result.error());
     if (const auto error = decodeError(std::get<RelayRecord>((*result)[2]))) return fail(context, *error);
     const auto& file = std::get<platform::RelayFile>((*result)[0]);

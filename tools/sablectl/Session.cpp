@@ -82,9 +82,10 @@ Expected<Bag> Session::bag() {
   return std::move(*bag);
 }
 
-Expected<RelayArguments> Session::call(std::size_t method, RelayArguments arguments) {
+Expected<RelayArguments> Session::call(const platform::RelayInterface& interface, std::size_t method,
+                                       RelayArguments arguments) {
   auto result = await<Expected<RelayArguments>>(
-      [&](auto done) { client_->call(method, std::move(arguments), std::move(done)); });
+      [&](auto done) { client_->call(interface, method, std::move(arguments), std::move(done)); });
   if (!result) return platform::relayTimedOut();
   return std::move(*result);
 }

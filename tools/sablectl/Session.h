@@ -36,8 +36,9 @@ class Session {
   Answer request(const SBLAnyRequest& request);
   Answer request(const std::string& className, const platform::RelayRecord& record);
   Expected<Bag> bag();
-  /// Any other method of SBLDaemonRelay.
-  Expected<platform::RelayArguments> call(std::size_t method, platform::RelayArguments arguments);
+  /// Any other method that the daemon exports.
+  Expected<platform::RelayArguments> call(const platform::RelayInterface& interface, std::size_t method,
+                                          platform::RelayArguments arguments);
 
  private:
   template <class Result, class Start>

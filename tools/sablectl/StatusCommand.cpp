@@ -30,7 +30,7 @@ Dictionary openSessions(const Context& context, ExitCode& code, Dictionary& prob
     const bool nobody = connected.error().domain == kPOSIXErrorDomain;
     return fault(connected.error(), nobody ? kExitNoDaemon : exitCodeFor(connected.error()));
   }
-  const auto sessions = session.call(SBLDaemonRelay::listSessions, {});
+  const auto sessions = session.call(kSBLDaemonRelay, SBLDaemonRelay::listSessions, {});
   if (!sessions) return fault(sessions.error(), exitCodeFor(sessions.error()));
   return recordDocuments(std::get<platform::RelayRecords>((*sessions)[0]));
 }
