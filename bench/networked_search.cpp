@@ -63,7 +63,7 @@ class DirectRequest {
 
 void compare(Placement placement, std::optional<double> bound, int argc, char** argv) {
   placeServers(placement);
-  World world;
+  World world(World::QueryCache::off);
   world.startDaemon();
   Client client(world.socket());
   const auto search = [&] { client.search(kQuery, Client::Outcome::answer); };

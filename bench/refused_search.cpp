@@ -4,8 +4,6 @@
 #include <fmt/core.h>
 #include <unistd.h>
 
-#include <thread>
-
 #include "bench/support/Bench.h"
 
 namespace {
@@ -46,26 +44,16 @@ void roundTrips(Placement placement, std::optional<double> bound, int argc, char
          argv);
 }
 
-template <class Run>
-double callsPerSecond(Run run) {
-  const auto start = std::chrono::steady_clock::now();
-  std::vector<std::thread> threads;
-  for (int i = 0; i < kClients; ++i) threads.emplace_back(run);
-  for (auto& thread : threads) thread.join();
-  const std::chrono::duration<double> time = std::chrono::steady_clock::now() - start;
-  return kClients * kCallsInARound / time.count();
-}
-
 void throughput(const std::string& name, int argc, char** argv) {
   const Setup setup;
   std::vector<double> raw, daemon;
   for (int round = 0; round < kRounds / 4; ++round) {
-    raw.push_back(callsPerSecond([&] {
+    raw.push_back(callsPerSecond(kClients, kCallsInARound, [&] {
       const int socket = setup.server.connect();
       for (int i = 0; i < kCallsInARound; ++i) setup.server.call(socket);
       ::close(socket);
     }));
-    daemon.push_back(callsPerSecond([&] {
+    daemon.push_back(callsPerSecond(kClients, kCallsInARound, [&] {
       Client client(setup.world.socket());
       for (int i = 0; i < kCallsInARound; ++i) client.search(kTooShort, Client::Outcome::nothing);
     }));

@@ -11,6 +11,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <string_view>
+#include <thread>
 
 namespace sable::bench {
 
@@ -25,11 +26,20 @@ double median(std::vector<double> values) {
   return *middle;
 }
 
+double callsPerSecond(int clients, int calls, const std::function<void()>& run) {
+  const auto start = std::chrono::steady_clock::now();
+  std::vector<std::thread> threads;
+  for (int i = 0; i < clients; ++i) threads.emplace_back(run);
+  for (auto& thread : threads) thread.join();
+  const std::chrono::duration<double> time = std::chrono::steady_clock::now() - start;
+  return clients * calls / time.count();
+}
+
 void report(const Measure& measure, int argc, char** argv) {
   const auto ratio = measure.floor ? std::optional(measure.median / *measure.floor) : std::nullopt;
-  const char* verdict = !measure.bound                                     ? "-"
-                        : ratio.value_or(measure.median) <= *measure.bound ? "ok"
-                                                                           : "short";
+  const char* verdict = !measure.bound                                                              ? "-"
+                        : measure.moreIsBetter == (ratio.value_or(measure.median) > *measure.bound) ? "ok"
+                                                                                                    : "short";
   const auto number = [](std::optional<double> value, const char* absent) {
     return value ? fmt::format("{:.2f}", *value) : std::string(absent);
   };

@@ -33,11 +33,16 @@ void measure(int count, Microseconds& times, Call call) {
   }
 }
 
-/// With a floor the bound is one of the ratio, else of the median.
+/// Calls per second of all of `clients` threads together, each of which makes `calls` calls.
+double callsPerSecond(int clients, int calls, const std::function<void()>& run);
+
+/// With a floor the bound is one of the ratio, else of the median: the most that it may be, or the
+/// least where more is better.
 struct Measure {
   std::string name, unit;
   double median;
   std::optional<double> floor, bound;
+  bool moreIsBetter = false;
 };
 /// Prints `name  median  floor  ratio  bound  ok|short`; with "--json" among the arguments as JSON.
 void report(const Measure& measure, int argc, char** argv);
@@ -68,6 +73,7 @@ class Service {
   const std::string& url() const { return url_; }
   /// The head of the last search request.
   std::string lastSearch() const;
+  int searches() const;  ///< so far
 
  private:
   struct Shared;
@@ -79,7 +85,8 @@ class Service {
 /// sabled and its service.
 class World {
  public:
-  World();
+  enum class QueryCache { on, off };
+  explicit World(QueryCache queryCache = QueryCache::on);
   ~World();
   World(const World&) = delete;
   World& operator=(const World&) = delete;
@@ -97,13 +104,31 @@ class World {
   Child daemon_;
 };
 
-/// A connection to the daemon with the D-Bus library alone.
+/// The rival of a call: the same call and an answer with as much data, through a message bus.
+class BusServer {
+ public:
+  static constexpr const char* kName = "com.kestrel.sabled";
+
+  /// `folder` ends in '/'.
+  BusServer(const std::string& folder, std::size_t answerBytes);
+  const std::string& address() const { return address_; }
+
+ private:
+  void serve(std::string body, int ready) const;
+  static void awaitLine(int descriptor);
+
+  std::string address_;
+  Child bus_, server_;
+};
+
+/// A connection to the daemon, or to its rival, with the D-Bus library alone.
 class Client {
  public:
   enum class Outcome { nothing, answer };
 
   /// Returns when Configure is answered.
   explicit Client(const std::string& socket);
+  explicit Client(const BusServer& rival);
   ~Client();
   Client(const Client&) = delete;
   Client& operator=(const Client&) = delete;
@@ -117,7 +142,10 @@ class Client {
   Sizes sizes(const char* text, Outcome wanted);
 
  private:
+  void configure();
+
   sd_bus* bus_ = nullptr;
+  const char* destination_ = nullptr;
   std::uint64_t queryId_ = 0;
 };
 

@@ -23,9 +23,9 @@ void check(int result, const char* what) {
   if (result < 0) fail(std::string(what) + ": " + std::strerror(-result));
 }
 
-sd_bus_message* searchCall(sd_bus* bus, std::uint64_t queryId, const char* text) {
+sd_bus_message* searchCall(sd_bus* bus, const char* destination, std::uint64_t queryId, const char* text) {
   sd_bus_message* call = nullptr;
-  check(sd_bus_message_new_method_call(bus, &call, nullptr, kPath, kInterface, "Request"), "Request");
+  check(sd_bus_message_new_method_call(bus, &call, destination, kPath, kInterface, "Request"), "Request");
   check(sd_bus_message_append(call, "sa{sv}", "SBLSearchRequest", 2, "queryId", "t", queryId, "queryString",
                               "s", text),
         "Request");
@@ -63,7 +63,7 @@ std::size_t requestSize(const char* text) {
     check(sd_bus_process(client, nullptr), "client");
     check(sd_bus_process(server, nullptr), "server");
   }
-  sd_bus_message* call = searchCall(client, 1, text);
+  sd_bus_message* call = searchCall(client, nullptr, 1, text);
   std::uint64_t cookie = 0;  // asking for it asks for a reply
   check(sd_bus_send(client, call, &cookie), "send");
   check(sd_bus_flush(client), "flush");
@@ -80,7 +80,19 @@ Client::Client(const std::string& socket) {
   sd_bus_new(&bus_);
   check(sd_bus_set_address(bus_, ("unix:path=" + socket).c_str()), "address");
   check(sd_bus_start(bus_), "connect");
-  check(sd_bus_call_method(bus_, nullptr, kPath, kInterface, "Configure", nullptr, nullptr, "a{sv}", 2,
+  configure();
+}
+
+Client::Client(const BusServer& rival) : destination_(BusServer::kName) {
+  sd_bus_new(&bus_);
+  check(sd_bus_set_address(bus_, rival.address().c_str()), "address");
+  sd_bus_set_bus_client(bus_, 1);
+  check(sd_bus_start(bus_), "connect");
+  configure();
+}
+
+void Client::configure() {
+  check(sd_bus_call_method(bus_, destination_, kPath, kInterface, "Configure", nullptr, nullptr, "a{sv}", 2,
                            "identifier", "s", "bench", "userAgent", "s", "bench/1.0"),
         "Configure");
 }
@@ -90,7 +102,7 @@ Client::~Client() {
 }
 
 void Client::search(const char* text, Outcome wanted) {
-  sd_bus_message* call = searchCall(bus_, ++queryId_, text);
+  sd_bus_message* call = searchCall(bus_, destination_, ++queryId_, text);
   sd_bus_message* reply = nullptr;
   check(sd_bus_call(bus_, call, 0, nullptr, &reply), "Request");
   check(sd_bus_message_skip(reply, "t"), "Request");
@@ -105,7 +117,7 @@ Client::Sizes Client::sizes(const char* text, Outcome wanted) {
   // The daemon also tells its clients of the bag: by the second reply that is done.
   for (int i = 0; i < 2; ++i) search(text, wanted);
   while (sd_bus_process(bus_, nullptr) > 0) continue;
-  sd_bus_message* call = searchCall(bus_, ++queryId_, text);
+  sd_bus_message* call = searchCall(bus_, destination_, ++queryId_, text);
   std::uint64_t cookie = 0;
   check(sd_bus_send(bus_, call, &cookie), "send");
   check(sd_bus_flush(bus_), "flush");

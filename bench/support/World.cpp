@@ -43,6 +43,7 @@ std::string response(const std::string& body) {
 
 struct Service::Shared {
   char head[8192];
+  int searches;
 };
 
 Service::Service() {
@@ -71,7 +72,10 @@ Service::Service() {
       request.append(buffer, static_cast<std::size_t>(count));
       if (!request.ends_with("\r\n\r\n")) continue;
       const bool isSearch = request.starts_with("GET /search");
-      if (isSearch) std::strncpy(shared_->head, request.c_str(), sizeof shared_->head - 1);
+      if (isSearch) {
+        std::strncpy(shared_->head, request.c_str(), sizeof shared_->head - 1);
+        ++shared_->searches;
+      }
       const std::string& answer = isSearch ? search : bag;
       if (::send(connection, answer.data(), answer.size(), MSG_NOSIGNAL) < 0) return;
       request.clear();
@@ -96,7 +100,11 @@ std::string Service::lastSearch() const {
   return shared_->head;
 }
 
-World::World() {
+int Service::searches() const {
+  return shared_->searches;
+}
+
+World::World(QueryCache queryCache) {
   char folder[] = "/tmp/sabled-bench-XXXXXX";
   if (::mkdtemp(folder) == nullptr) fail("mkdtemp");
   root_ = folder;
@@ -105,7 +113,8 @@ World::World() {
     std::filesystem::permissions(root_ / name, std::filesystem::perms::owner_all);
   }
   std::ofstream(root_ / "config" / "defaults.toml")
-      << "SBLDefaultBagURL = \"" << service_.url() << "/bag\"\n";
+      << "SBLDefaultBagURL = \"" << service_.url() << "/bag\"\n"
+      << "SBLNoQueryCache = " << (queryCache == QueryCache::on ? "false" : "true") << "\n";
 }
 
 World::~World() {
