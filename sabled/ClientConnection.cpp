@@ -1,5 +1,7 @@
 #include "sabled/ClientConnection.h"
 
+#include <fmt/format.h>
+
 #include <nlohmann/json.hpp>
 #include <utility>
 
@@ -17,6 +19,7 @@
 #include "sabled/RequestReply.h"
 #include "sabled/SableBagController.h"
 #include "sabled/SableLogging.h"
+#include "sabled/SearchExplanation.h"
 #include "sabled/UserAgent.h"
 
 namespace sable {
@@ -48,6 +51,9 @@ ClientConnection::~ClientConnection() = default;
 void ClientConnection::start() {
   connection_->exportObject(kSBLDaemonRelay, [weak = weak_from_this()](platform::RelayCall call) {
     if (const auto self = weak.lock()) self->handleInvocation(std::move(call));
+  });
+  connection_->exportObject(kSBLDiagnosticsRelay, [weak = weak_from_this()](platform::RelayCall call) {
+    if (const auto self = weak.lock()) self->explain(call);
   });
   armIdleTimer(kClientIdleTimeout);
   connection_->resume();
@@ -219,6 +225,24 @@ void ClientConnection::request(platform::RelayCall& call) {
     void operator()(SBLFlightSearchRequest& request) { self.state_->flightSearch(request, std::move(reply)); }
   };
   std::visit(Router{*this, reply}, *decoded);
+}
+
+void ClientConnection::explain(platform::RelayCall& call) {
+  lastCall_ = assembly_.runtime.ticks();
+  auto decoded =
+      decodeRequest(std::get<std::string>(call.arguments[0]), std::get<RelayRecord>(call.arguments[1]));
+  auto* request = decoded ? std::get_if<SBLSearchRequest>(&*decoded) : nullptr;
+  if (request == nullptr || !_ensureState()) {
+    return call.reply.fail("org.freedesktop.DBus.Error.InvalidArgs",
+                           "explains a SBLSearchRequest, after Configure");
+  }
+  fillDefaults(*request);
+  SearchExplanation why;
+  const std::uint64_t newest = currentQueryId_.load();
+  const bool isNewer = why.gate("query id", fmt::format("{}", request->queryId),
+                                fmt::format("greater than {}", newest), request->queryId > newest);
+  if (isNewer) state_->explain(*request, why);
+  call.reply(why.json());
 }
 
 void ClientConnection::search(const SBLSearchRequest& request, SBLReplyHandler reply) {

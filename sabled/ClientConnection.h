@@ -60,6 +60,7 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void pushBag(const SBLBag* bag, const std::optional<Error>& error);
 
   void request(platform::RelayCall& call);
+  void explain(platform::RelayCall& call);
   void fillDefaults(SBLRequest& request) const;
   void search(const SBLSearchRequest& request, SBLReplyHandler reply);
   void reportEvent(platform::RelayCall& call);

@@ -14,10 +14,13 @@
 namespace sable {
 
 class Assembly;
+class CachedResultSet;
 class ClientSessionManager;
 class QueryCache;
+class RequestTrace;
 class SBLBag;
 class SableUserGUIDController;
+struct SearchExplanation;
 struct SearchResponse;
 
 /// Everything the daemon keeps for one client session identifier, shared by all connections that
@@ -61,6 +64,9 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   void flightSearch(const SBLFlightSearchRequest& request, SBLReplyHandler reply);
   void flightLookup(const SBLFlightLookupRequest& request, SBLReplyHandler reply);
 
+  /// Adds to `why` what search() would do with the request; nothing is asked, replied or counted.
+  void explain(const SBLSearchRequest& request, SearchExplanation& why);
+
  private:
   struct QueryKind;
   struct Query;
@@ -71,13 +77,26 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   void _markNetworkRequest();
   std::shared_ptr<const SBLBag> heldBag() const;
 
+  /// What the gates say of a query.
+  enum class Verdict { bagMissing, bagDisabled, inputTooShort, passes };
+
+  Query makeQuery(const QueryKind& kind, const SBLRequest& request, const std::string& input,
+                  SBLReplyHandler reply) const;
   std::shared_ptr<Query> begin(const QueryKind& kind, const SBLRequest& request, const std::string& input,
                                SBLReplyHandler reply);
-  bool passesGates(Query& query);
+  /// Gives the query the bag that it is asked with. Notes each gate in `why`, if there is one.
+  Verdict judge(Query& query, SearchExplanation* why);
+  /// Answers a query that does not pass the gates.
+  bool refuses(Query& query);
+  /// nullptr: the cache has no answer, or it is not to be used.
+  std::shared_ptr<const CachedResultSet> cachedAnswer(const SBLSearchRequest& request,
+                                                      SearchExplanation* why) const;
+  void answerFromCache(Query& query, const CachedResultSet& hit);
+  std::optional<platform::HTTPRequest> searchRequest(const Query& query, const SBLSearchRequest& request,
+                                                     RequestTrace* trace) const;
   void dispatch(const std::shared_ptr<Query>& query, std::optional<platform::HTTPRequest> request);
   void didComplete(Query& query, platform::HTTPResult result);
   std::optional<Error> processAnswer(const Query& query, const Data& data);
-  bool answerFromCache(Query& query, const SBLSearchRequest& request);
   void _cacheResponse(const SearchResponse& response, const Query& query, const Data& data, const UUID& uuid);
   SBLReply replyWith(const Query& query, Data data) const;
   bool routesThroughProxy(const Query& query) const;

@@ -1,6 +1,9 @@
 #include "sabled/SearchExplanation.h"
 
+#include <fmt/format.h>
+
 #include <nlohmann/json.hpp>
+#include <string>
 
 #include "platform/Dictionary.h"
 #include "sabled/CachedResultSet.h"
@@ -59,17 +62,22 @@ Dictionary gatesDocument(const std::vector<SearchExplanation::Gate>& gates) {
   return rows;
 }
 
+/// The number that reads as the float does, not as the double that stands for it.
+double asItReads(float number) {
+  return std::stod(fmt::format("{}", number));
+}
+
 Dictionary candidatesDocument(const QueryCacheDecision& decision) {
   Dictionary rows = Dictionary::array();
   for (const auto& [candidate, outcome] : decision.rows) {
     Dictionary expires = nullptr;
-    if (candidate->expireTime()) {
-      expires = platform::toSeconds(*candidate->expireTime() - decision.question.now);
+    if (candidate->expireTime) {
+      expires = platform::toSeconds(*candidate->expireTime - decision.question.now);
     }
-    rows.push_back({{"query", candidate->query()},
-                    {"input", candidate->input()},
-                    {"score", candidate->completionScore()},
-                    {"scale", candidate->uiScale()},
+    rows.push_back({{"query", candidate->query},
+                    {"input", candidate->input},
+                    {"score", asItReads(candidate->completionScore)},
+                    {"scale", asItReads(candidate->uiScale)},
                     {"expires_in", std::move(expires)},
                     {"outcome", std::string(queryCacheOutcomeText(outcome))}});
   }

@@ -109,17 +109,18 @@ TEST(AnswerLines, TellWhatIsNoListOfResults) {
   EXPECT_TRUE(none.at(1).starts_with("no reply")) << none[1];
 }
 
-TEST(Completion, IsTheFirstResultSetsQuery) {
+TEST(Completion, IsTheFirstQueryThatBeginsWithWhatIsTyped) {
   const struct {
     const char* data;
     std::optional<std::string> completion;
   } cases[] = {{R"([{"query":"a"},{"query":"b"}])", "a"},
+               {R"([{"query":"wear"},{"query":"Weather"},{"query":"weather radar"}])", "Weather"},
                {R"([{"query":1}])", std::nullopt},
                {R"([])", std::nullopt},
                {R"({"query":"a"})", std::nullopt},
                {"[", std::nullopt}};
   for (const auto& [data, completion] : cases)
-    EXPECT_EQ(bestCompletion(answerWith(data, true)), completion) << data;
+    EXPECT_EQ(bestCompletion(answerWith(data, true), "weat"), completion) << data;
 }
 
 TEST(RequestRecord, GivesEachMemberItsType) {

@@ -7,6 +7,7 @@
 #include <nlohmann/json.hpp>
 
 #include "SableKit/SBLError.h"
+#include "platform/Lowercase.h"
 #include "tools/sablectl/Text.h"
 
 namespace sable::sablectl {
@@ -125,10 +126,15 @@ std::optional<std::string> sourceOf(const Answer& answer) {
   return answer.reply->httpRequest ? "network" : "cache";
 }
 
-std::optional<std::string> bestCompletion(const Answer& answer) {
+std::optional<std::string> bestCompletion(const Answer& answer, std::string_view input) {
   const auto data = parsedData(answer);
   if (!data || !data->is_array() || data->empty()) return std::nullopt;
-  return stringMember(data->front(), "query");
+  const std::string typed = platform::lowercased(input);
+  const auto completes = [&](const Dictionary& set) {
+    return platform::lowercased(stringMember(set, "query").value_or("")).starts_with(typed);
+  };
+  const auto best = std::ranges::find_if(*data, completes);
+  return stringMember(best == data->end() ? data->front() : *best, "query");
 }
 
 std::vector<std::string> answerLines(const Output& output, const Answer& answer) {

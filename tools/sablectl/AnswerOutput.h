@@ -17,8 +17,9 @@ Dictionary answerDocument(const Answer& answer);
 /// request did not ask.
 std::optional<std::string> sourceOf(const Answer& answer);
 
-/// The completed query of the first result set; nullopt when the reply has none.
-std::optional<std::string> bestCompletion(const Answer& answer);
+/// The completed query of the first result set that completes `input`, else of the first; nullopt when
+/// the reply has none. An answer from the cache was made for less than what is typed now.
+std::optional<std::string> bestCompletion(const Answer& answer, std::string_view input);
 
 /// The answer for a person, as lines; its error is told elsewhere.
 std::vector<std::string> answerLines(const Output& output, const Answer& answer);

@@ -31,7 +31,8 @@ class TypedRows {
     ++counts_[source];
     milliseconds_.push_back(answer.milliseconds);
     if (output_.json) return streamed(input, answer);
-    const std::string told = answer.error ? answer.error->description() : bestCompletion(answer).value_or("");
+    const std::string told =
+        answer.error ? answer.error->description() : bestCompletion(answer, input).value_or("");
     const std::string time = fmt::format("{:>9.1f} ms", answer.milliseconds);
     const std::size_t taken = inputWidth_ + kSourceWidth + time.size() + 6;
     const std::size_t left = output_.width > taken ? output_.width - taken : kSourceWidth;
