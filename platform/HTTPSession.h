@@ -47,6 +47,10 @@ struct HTTPRequest {
   HTTPCachePolicy cachePolicy = HTTPCachePolicy::useProtocol;
   double timeout = 60;   ///< seconds without a byte of progress, and to connect
   bool proxied = false;  ///< asks for the privacy proxy (NetworkServiceProxy)
+  /// Without, a redirect (RFC 9110 section 15.4) is the answer, for the caller to judge.
+  bool followsRedirects = true;
+  /// Of the decoded body, where that is less than the session allows.
+  std::size_t maximumResponseBytes = SIZE_MAX;
 };
 
 struct HTTPResponse {

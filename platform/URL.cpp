@@ -110,6 +110,16 @@ std::optional<URL> URL::parse(std::string_view text) {
   return URL(std::move(copy));
 }
 
+std::optional<URL> URL::resolve(std::string_view reference) const {
+  if (reference.empty()) return *this;
+  const Handle handle = handleFor(text_);
+  const std::string copy(reference);
+  if (curl_url_set(handle.get(), CURLUPART_URL, copy.c_str(), CURLU_NON_SUPPORT_SCHEME) != CURLUE_OK) {
+    return std::nullopt;
+  }
+  return parse(part(handle.get(), CURLUPART_URL));
+}
+
 std::string URL::scheme() const {
   return lowercase(text_.substr(0, text_.find(':')));
 }

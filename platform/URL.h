@@ -23,6 +23,9 @@ class URL {
   /// Reads an absolute URL; nullopt when it is none.
   static std::optional<URL> parse(std::string_view text);
 
+  /// What a reference in a document at this URL means (RFC 3986 section 5.2): its Location, say.
+  std::optional<URL> resolve(std::string_view reference) const;
+
   std::string scheme() const;  ///< lower case
   std::string host() const;    ///< lower case, without brackets
 

@@ -274,6 +274,26 @@ TEST_F(HostSession, RedirectsAreFollowedAndTimed) {
   EXPECT_GT(result.timing.redirect, Duration{});
 }
 
+TEST_F(HostSession, ATaskMayTakeARedirectItselfAndLessThanTheSessionAllows) {
+  server_.on("/from", "HTTP/1.1 302 F\r\nLocation: /to\r\nContent-Length: 4\r\n\r\nskip");
+  server_.on("/large", LoopbackServer::ok(std::string(1 << 20, 'x')));
+  const auto session = this->session();
+  HTTPRequest from = request("/from");
+  from.followsRedirects = false;
+  const auto redirect = load(*session, from);
+  ASSERT_FALSE(redirect.error);
+  EXPECT_EQ(redirect.response->status, 302);
+  EXPECT_EQ(*redirect.response->headers.find("Location"), "/to");
+  EXPECT_EQ(server_.requests().size(), 1u);
+
+  HTTPRequest large = request("/large");
+  large.maximumResponseBytes = 1000;
+  const auto cut = load(*session, large);
+  ASSERT_TRUE(cut.error);
+  EXPECT_EQ(cut.error->code, std::int64_t(HTTPErrorCode::responseTooLarge));
+  EXPECT_EQ(cut.data->size(), 1000u);
+}
+
 TEST_F(HostSession, TimingTellsWhatHappened) {
   server_.on("/t", LoopbackServer::ok("12345"));
   const auto session = this->session();

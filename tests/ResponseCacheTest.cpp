@@ -46,7 +46,7 @@ TEST(CacheRules, WhatMayBeStored) {
       {200, {}, {}, false},
       {200, {}, fresh, true},
       {203, {}, fresh, true},
-      {301, {}, fresh, true},
+      {301, {}, fresh, false},
       {404, {}, fresh, true},
       {410, {}, fresh, true},
       {204, {}, fresh, false},

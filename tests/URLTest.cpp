@@ -57,6 +57,30 @@ TEST(URL, SchemeAndHostAreLowerCase) {
   EXPECT_EQ(URL::parse("http://[2001:DB8::1]:80/")->host(), "2001:db8::1");
 }
 
+TEST(URL, ReferencesAreResolved) {
+  const struct {
+    const char *reference, *target;  // null: none
+  } cases[] = {
+      {"http://other/x", "http://other/x"},
+      {"//other/x", "https://other/x"},
+      {"/x?y", "https://h:81/x?y"},
+      {"x", "https://h:81/a/x"},
+      {"../x", "https://h:81/x"},
+      {"?y", "https://h:81/a/b?y"},
+      {"", "https://h:81/a/b?q"},
+      {"ftp://h/", "ftp://h/"},
+      {"file:///etc", nullptr},
+      {"http://[::", nullptr},
+      {"a b", nullptr},
+      {"\x01", nullptr},
+  };
+  const auto base = URL::parse("https://h:81/a/b?q");
+  for (const auto& [reference, target] : cases) {
+    const auto resolved = base->resolve(reference);
+    EXPECT_EQ(resolved ? resolved->string() : "", target == nullptr ? "" : target) << reference;
+  }
+}
+
 TEST(URL, QueryItemsAreDecodedInOrder) {
   const struct {
     std::string_view query;

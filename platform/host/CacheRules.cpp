@@ -142,7 +142,8 @@ bool isCacheable(const HTTPRequest& request) {
 }
 
 bool isStorable(const HTTPRequest& request, int status, const HTTPHeaders& headers) {
-  static constexpr std::array kStatuses{200, 203, 301, 404, 410};
+  // No redirect: one request wants it followed, another wants to see it.
+  static constexpr std::array kStatuses{200, 203, 404, 410};
   if (std::find(kStatuses.begin(), kStatuses.end(), status) == kStatuses.end()) return false;
   const Directives response = directives(headers);
   if (response.noStore || directives(request.headers).noStore || variesByEverything(headers)) return false;

@@ -25,7 +25,8 @@ CurlTransfer::CurlTransfer(const Runtime& runtime, const HTTPSessionConfiguratio
       request_(request),
       conditions_(std::move(conditions)),
       proxyURL_(std::move(proxyURL)),
-      timeout_(fromSeconds(std::clamp(request_.timeout, 0.001, kLongestTimeout))) {}
+      timeout_(fromSeconds(std::clamp(request_.timeout, 0.001, kLongestTimeout))),
+      maximumBytes_(std::min(configuration_.maximumResponseBytes, request_.maximumResponseBytes)) {}
 
 void CurlTransfer::prepare(CurlEasy easy) {
   easy_ = std::move(easy);
@@ -43,7 +44,7 @@ void CurlTransfer::setTransport() {
   curl_easy_setopt(easy, CURLOPT_QUICK_EXIT, 1L);  // cancelling does not wait for a name lookup
   curl_easy_setopt(easy, CURLOPT_PROTOCOLS_STR, "http,https");
   curl_easy_setopt(easy, CURLOPT_REDIR_PROTOCOLS_STR, "http,https");
-  curl_easy_setopt(easy, CURLOPT_FOLLOWLOCATION, 1L);
+  curl_easy_setopt(easy, CURLOPT_FOLLOWLOCATION, request_.followsRedirects ? 1L : 0L);
   curl_easy_setopt(easy, CURLOPT_MAXREDIRS, static_cast<long>(configuration_.maximumRedirects));
   curl_easy_setopt(easy, CURLOPT_HTTP_VERSION, CURL_HTTP_VERSION_2TLS);
   curl_easy_setopt(easy, CURLOPT_SSLVERSION, CURL_SSLVERSION_TLSv1_2);
@@ -132,13 +133,13 @@ std::size_t CurlTransfer::takeBody(const char* bytes, std::size_t count) {
     bodyBegun_ = true;
     curl_off_t announced = -1;
     curl_easy_getinfo(easy_.get(), CURLINFO_CONTENT_LENGTH_DOWNLOAD_T, &announced);
-    const auto limit = static_cast<curl_off_t>(configuration_.maximumResponseBytes);
+    const auto limit = static_cast<curl_off_t>(maximumBytes_);
     if (announced > 0) body_.reserve(static_cast<std::size_t>(std::min(announced, limit)));
   }
-  const std::size_t room = configuration_.maximumResponseBytes - body_.size();
+  const std::size_t room = maximumBytes_ - body_.size();
   body_.append(bytes, std::min(count, room));
   if (count <= room) return count;
-  refusal_ = "body is larger than the session allows";
+  refusal_ = "body is larger than allowed";
   return 0;
 }
 

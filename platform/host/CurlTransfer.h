@@ -65,6 +65,7 @@ class CurlTransfer {
   const HTTPHeaders conditions_;
   const std::string proxyURL_;
   const Duration timeout_;
+  const std::size_t maximumBytes_;
 
   CurlEasy easy_;
   std::unique_ptr<curl_slist, ListDeleter> headerLines_;

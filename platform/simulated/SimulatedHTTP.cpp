@@ -73,7 +73,8 @@ class SimulatedTask final : public HTTPDataTask, public std::enable_shared_from_
   }
 
   void deliver(HTTPResult& result) {
-    const std::size_t limit = shared_->configuration.maximumResponseBytes;
+    const std::size_t limit =
+        std::min(shared_->configuration.maximumResponseBytes, request_.maximumResponseBytes);
     const std::size_t size = answer_.body.size();
     result.timing.responseStart = result.timing.total;
     result.timing.responseBodyBytes = static_cast<std::int64_t>(std::min(size, limit));
@@ -82,7 +83,7 @@ class SimulatedTask final : public HTTPDataTask, public std::enable_shared_from_
     result.response = HTTPResponse{request_.url, answer_.status, answer_.headers, false};
     result.data = makeData(answer_.body.substr(0, limit));
     if (size > limit) {
-      result.error = httpError(HTTPErrorCode::responseTooLarge, "body is larger than the session allows");
+      result.error = httpError(HTTPErrorCode::responseTooLarge, "body is larger than allowed");
     }
   }
 

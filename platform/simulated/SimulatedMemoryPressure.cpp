@@ -1,5 +1,6 @@
 #include "platform/simulated/SimulatedMemoryPressure.h"
 
+#include <algorithm>
 #include <utility>
 
 namespace sable::platform::simulated {
@@ -22,6 +23,11 @@ std::unique_ptr<MemoryPressure::Source> SimulatedMemoryPressure::onCritical(
   auto listener = std::make_shared<Listener>(Listener{std::move(queue), std::move(handler)});
   listeners_.push_back(listener);
   return std::make_unique<ListeningSource>(std::move(listener));
+}
+
+std::size_t SimulatedMemoryPressure::sources() const {
+  return static_cast<std::size_t>(
+      std::ranges::count_if(listeners_, [](const auto& weak) { return !weak.expired(); }));
 }
 
 void SimulatedMemoryPressure::fireCritical() {

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstddef>
 #include <functional>
 #include <memory>
 #include <vector>
@@ -15,6 +16,8 @@ class SimulatedMemoryPressure final : public MemoryPressure {
                                                    std::function<void()> handler) override;
 
   void fireCritical();
+  /// Sources that somebody holds.
+  std::size_t sources() const;
 
  private:
   struct Listener;
