@@ -1,5 +1,7 @@
 #include "SableKit/SBLClient.h"
 
+#include <algorithm>
+#include <iterator>
 #include <utility>
 
 #include "SableKit/SBLRelayCoding.h"
@@ -12,6 +14,9 @@ using platform::RelayArguments;
 using platform::RelayConnection;
 using platform::RelayRecord;
 
+/// What a call may wait for images, whatever deadline it is given.
+constexpr platform::Duration kLongestWait = std::chrono::hours(24);
+
 std::shared_ptr<SBLClient> SBLClient::create(platform::Runtime& runtime, platform::Relay& relay,
                                              platform::RelayEndpoint daemon,
                                              SBLSessionConfiguration configuration) {
@@ -20,7 +25,8 @@ std::shared_ptr<SBLClient> SBLClient::create(platform::Runtime& runtime, platfor
 
 SBLClient::SBLClient(Key, platform::Runtime& runtime, platform::Relay& relay, platform::RelayEndpoint daemon,
                      SBLSessionConfiguration configuration)
-    : relay_(relay),
+    : runtime_(runtime),
+      relay_(relay),
       daemon_(std::move(daemon)),
       configuration_(std::move(configuration)),
       queue_(runtime.serialQueue("com.kestrel.sable.client")),
@@ -139,6 +145,32 @@ void SBLClient::bag(platform::Function<void(std::string, std::string, std::optio
          handler(std::get<std::string>((*result)[0]), std::get<std::string>((*result)[1]),
                  decodeError(std::get<RelayRecord>((*result)[2])));
        });
+}
+
+void SBLClient::loadImages(const std::vector<SBLImageDescription>& descriptions,
+                           platform::MonotonicTime deadline,
+                           platform::Function<void(Expected<Images>)> handler) {
+  const platform::MonotonicTime now = runtime_.ticks();
+  const auto nanoseconds = static_cast<std::uint64_t>(std::max(deadline.time_since_epoch().count(), 0L));
+  RelayArguments arguments{encodeImageDescriptions(descriptions), nanoseconds};
+  const auto timeout = timeout_ + std::clamp(deadline - now, platform::Duration{}, kLongestWait);
+  connect([self = shared_from_this(), arguments = std::move(arguments), timeout,
+           handler = std::move(handler)](Expected<platform::RelayEndpoint> endpoint) mutable {
+    if (!endpoint) return handler(tl::unexpected(endpoint.error()));
+    const auto connected = self->relay_.connect(*endpoint);
+    if (!connected) return handler(tl::unexpected(connected.error()));
+    const std::shared_ptr<RelayConnection>& connection = *connected;
+    connection->setInvalidationHandler([] {});
+    connection->resume();
+    connection->call(
+        kSBLEndpointRelay, SBLEndpointRelay::loadImages, std::move(arguments), timeout,
+        [connection, handler = std::move(handler)](Expected<RelayArguments> result) mutable {
+          connection->invalidate();
+          if (!result) return handler(tl::unexpected(result.error()));
+          auto& entries = std::get<platform::RelayDataMap>((*result)[0]).entries;
+          handler(Images(std::move_iterator(entries.begin()), std::move_iterator(entries.end())));
+        });
+  });
 }
 
 void SBLClient::disconnect() {

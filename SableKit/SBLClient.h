@@ -1,11 +1,13 @@
 #pragma once
 
 #include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "SableKit/SBLImageDescription.h"
 #include "SableKit/SBLReply.h"
 #include "SableKit/SBLRequest.h"
 #include "SableKit/SBLSessionConfiguration.h"
@@ -44,6 +46,14 @@ class SBLClient : public std::enable_shared_from_this<SBLClient> {
   void request(std::string className, platform::RelayRecord record, SBLReplyHandler handler);
   void bag(platform::Function<void(std::string rawBag, std::string userAgent, std::optional<Error>)> handler);
 
+  /// By the URL of their description, or by its id where there is none at the URL.
+  using Images = std::map<std::string, Data>;
+  /// Loads images whose hosts the service's answers have vouched for; what has not arrived at
+  /// `deadline` (of the runtime's monotonic time; the past: no waiting at all) is left out. On a
+  /// connection of its own, which ends with it: the daemon serves ten of them at one time.
+  void loadImages(const std::vector<SBLImageDescription>& descriptions, platform::MonotonicTime deadline,
+                  platform::Function<void(Expected<Images>)> handler);
+
   /// Any method that the daemon exports on a client's connection, with its arguments and results as
   /// they travel.
   void call(const platform::RelayInterface& interface, std::size_t method, platform::RelayArguments arguments,
@@ -68,6 +78,7 @@ class SBLClient : public std::enable_shared_from_this<SBLClient> {
   void dropConnection(const Error& reason);
   void finishConnecting(const Expected<platform::RelayEndpoint>& result);
 
+  platform::Runtime& runtime_;
   platform::Relay& relay_;
   const platform::RelayEndpoint daemon_;
   const SBLSessionConfiguration configuration_;

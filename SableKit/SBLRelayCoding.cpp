@@ -178,6 +178,24 @@ std::optional<SBLAnyRequest> decodeRequest(std::string_view className, const Rel
   return decodeAs(className, record);
 }
 
+platform::RelayRecords encodeImageDescriptions(const std::vector<SBLImageDescription>& descriptions) {
+  platform::RelayRecords records;
+  for (const SBLImageDescription& description : descriptions) {
+    RelayRecord& record = records.emplace_back();
+    add(record, "url", description.url);
+    add(record, "id", description.id);
+  }
+  return records;
+}
+
+std::vector<SBLImageDescription> decodeImageDescriptions(const platform::RelayRecords& records) {
+  std::vector<SBLImageDescription> descriptions;
+  for (const RelayRecord& record : records) {
+    descriptions.push_back({record.string("url"), record.string("id")});
+  }
+  return descriptions;
+}
+
 RelayRecord encodeError(const std::optional<Error>& error) {
   RelayRecord record;
   if (!error) return record;

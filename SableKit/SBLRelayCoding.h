@@ -3,7 +3,9 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
+#include "SableKit/SBLImageDescription.h"
 #include "SableKit/SBLReply.h"
 #include "SableKit/SBLRequest.h"
 #include "SableKit/SBLSessionConfiguration.h"
@@ -20,6 +22,10 @@ std::string_view requestClassName(const SBLAnyRequest& request);
 platform::RelayRecord encodeRequest(const SBLAnyRequest& request);
 /// The request of a class; nullopt for a class that is no request's.
 std::optional<SBLAnyRequest> decodeRequest(std::string_view className, const platform::RelayRecord& record);
+
+platform::RelayRecords encodeImageDescriptions(const std::vector<SBLImageDescription>& descriptions);
+/// One for each record; a member of another type than string is absent.
+std::vector<SBLImageDescription> decodeImageDescriptions(const platform::RelayRecords& records);
 
 platform::RelayRecord encodeError(const std::optional<Error>& error);
 std::optional<Error> decodeError(const platform::RelayRecord& record);

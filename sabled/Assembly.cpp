@@ -7,6 +7,7 @@
 #include "platform/Tally.h"
 #include "platform/UserDefaults.h"
 #include "sabled/ClientStateManager.h"
+#include "sabled/ImageFetcher.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SableBagController.h"
 #include "sabled/SableUserGUIDController.h"

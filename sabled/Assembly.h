@@ -13,6 +13,7 @@ namespace sable {
 
 class ClientSessionManager;
 class ClientStateManager;
+class ImageFetcher;
 class SBLNetworkRequestFactory;
 class SableBagController;
 class SableUserGUIDController;
@@ -40,6 +41,7 @@ class Assembly {
   std::unique_ptr<SBLNetworkRequestFactory> requestFactory;
   std::unique_ptr<SableUserGUIDController> guidController;
   ClientSessionManager* clientSessionManager = nullptr;  ///< null: sessions are not recorded
+  std::unique_ptr<ImageFetcher> imageFetcher;
   std::unique_ptr<SableBagController> bagController;
   std::unique_ptr<ClientStateManager> clientStateManager;
 

@@ -1,5 +1,6 @@
 #include "sabled/ClientStateManager.h"
 
+#include <algorithm>
 #include <nlohmann/json.hpp>
 #include <utility>
 
@@ -7,11 +8,13 @@
 #include "SableKit/SBLError.h"
 #include "SableKit/SBLRelayCoding.h"
 #include "SableKit/SBLRelayInterfaces.h"
-#include "platform/URL.h"
 #include "platform/UserDefaults.h"
 #include "sabled/Assembly.h"
 #include "sabled/ClientState.h"
+#include "sabled/ImageLoad.h"
 #include "sabled/RequestReply.h"
+#include "sabled/ResponseImages.h"
+#include "sabled/SableBagController.h"
 #include "sabled/SableLogging.h"
 #include "sabled/SearchResponse.h"
 
@@ -27,6 +30,11 @@ constexpr platform::Duration kConnectWait = std::chrono::milliseconds(100);
 
 const platform::LogHandle& log() {
   return SableLogForCategory(SableLoggingCategoryConnection);
+}
+
+platform::MonotonicTime monotonicTime(std::uint64_t nanoseconds) {
+  constexpr auto kEnd = static_cast<std::uint64_t>(platform::Duration::max().count());
+  return platform::MonotonicTime(platform::Duration(std::min(nanoseconds, kEnd)));
 }
 
 }  // namespace
@@ -132,9 +140,13 @@ bool ClientStateManager::acceptEndpointConnection(const std::shared_ptr<RelayCon
 
 void ClientStateManager::handleEndpointCall(platform::RelayCall call) {
   using platform::RelayRecord;
-  if (call.method != SBLEndpointRelay::request) {
-    call.reply.fail("org.freedesktop.DBus.Error.NotSupported", "this daemon does not load images");
-    return;
+  if (call.method == SBLEndpointRelay::loadImages) {
+    return loadImages(decodeImageDescriptions(std::get<platform::RelayRecords>(call.arguments[0])),
+                      std::get<std::uint64_t>(call.arguments[1]), [&](Images images) {
+                        platform::RelayDataMap map;
+                        for (auto& [name, image] : images) map.entries.emplace_back(name, std::move(image));
+                        call.reply(std::move(map));
+                      });
   }
   auto request =
       decodeRequest(std::get<std::string>(call.arguments[0]), std::get<RelayRecord>(call.arguments[1]));
@@ -162,19 +174,38 @@ void ClientStateManager::request(const SBLAnyRequest& request, const SBLSessionC
   }
 }
 
+void ClientStateManager::loadImages(std::vector<SBLImageDescription> descriptions, std::uint64_t deadline,
+                                    platform::Function<void(Images)> completion) {
+  const auto bag = assembly_.bagController->currentBag();
+  if (bag == nullptr) return completion({});
+  if (descriptions.size() > kMaximumImagesPerCall) {
+    SableLogForCategory(SableLoggingCategoryImages)
+        .error("{} images asked for at once, {} are not looked at", descriptions.size(),
+               descriptions.size() - kMaximumImagesPerCall);
+    descriptions.resize(kMaximumImagesPerCall);
+  }
+  const auto load = std::make_shared<ImageLoad>(assembly_, bag);
+  load->start(descriptions, validImageHosts());
+  load->wait(monotonicTime(deadline));
+  completion(load->images(descriptions));
+}
+
 void ClientStateManager::processImagesFromResponse(const SearchResponse& response, const SBLBag& bag) {
   std::set<std::string> hosts;
-  const auto addHost = [&](const std::optional<std::string>& text) {
-    const auto url = text ? platform::URL::parse(*text) : std::nullopt;
-    if (url) hosts.insert(url->host());
-  };
-  for (const ImageDescription& image : response.images) {
-    addHost(image.url);
-    if (image.id) addHost(bag.urlForIdentifier(*image.id));
-  }
+  enumerateImagesInResponse(response, bag, [&](const platform::URL& url) { hosts.insert(imageHost(url)); });
   if (hosts.empty()) return;
-  imageHostsQueue_->barrierAsync(
-      [this, hosts = std::move(hosts)]() mutable { validImageHosts_.merge(hosts); });
+  imageHostsQueue_->barrierAsync([this, hosts = std::move(hosts)] { addImageHosts(hosts); });
+}
+
+void ClientStateManager::addImageHosts(const std::set<std::string>& hosts) {
+  for (const std::string& host : hosts) {
+    if (validImageHosts_.size() < kMaximumImageHosts) {
+      validImageHosts_.insert(host);
+    } else if (!validImageHosts_.contains(host) && !std::exchange(tooManyImageHosts_, true)) {
+      SableLogForCategory(SableLoggingCategoryImages)
+          .error("answers named more than {} hosts of images; no more are added", kMaximumImageHosts);
+    }
+  }
 }
 
 std::set<std::string> ClientStateManager::validImageHosts() const {

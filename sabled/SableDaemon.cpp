@@ -9,6 +9,7 @@
 #include "platform/Tally.h"
 #include "platform/UserDefaults.h"
 #include "sabled/ClientStateManager.h"
+#include "sabled/ImageFetcher.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SableBagController.h"
 #include "sabled/SableLogging.h"
@@ -53,6 +54,7 @@ void SableDaemon::createServices() {
   // The order is part of the design: a service may use in its constructor what stands before it.
   assembly_.requestFactory = std::make_unique<SBLNetworkRequestFactory>(assembly_);
   assembly_.tally.add("com.kestrel.sabled.launch", 1);
+  assembly_.imageFetcher = std::make_unique<ImageFetcher>(assembly_);
   assembly_.bagController = std::make_unique<SableBagController>(assembly_);
   assembly_.clientStateManager = std::make_unique<ClientStateManager>(assembly_);
   service_ = std::make_unique<SableService>(assembly_);

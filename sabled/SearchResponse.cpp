@@ -24,14 +24,14 @@ double number(const object& parent, std::string_view key) {
   return parent[key].get(value) == simdjson::SUCCESS ? value : 0;
 }
 
-void addImage(const element& description, std::vector<ImageDescription>& images) {
+void addImage(const element& description, std::vector<SBLImageDescription>& images) {
   object members;
   if (description.get(members) != simdjson::SUCCESS) return;
-  ImageDescription image{string(members, "url"), string(members, "id")};
+  SBLImageDescription image{string(members, "url"), string(members, "id")};
   if (image.url || image.id) images.push_back(std::move(image));
 }
 
-void collectImages(const element& value, int depth, std::vector<ImageDescription>& images) {
+void collectImages(const element& value, int depth, std::vector<SBLImageDescription>& images) {
   if (depth > kMaximumImageDepth) return;
   if (value.type() == element_type::ARRAY) {
     for (const element item : value.get_array()) collectImages(item, depth + 1, images);

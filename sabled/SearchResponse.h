@@ -1,19 +1,13 @@
 #pragma once
 
-#include <optional>
 #include <string>
 #include <vector>
 
+#include "SableKit/SBLImageDescription.h"
 #include "platform/Data.h"
 #include "platform/Error.h"
 
 namespace sable {
-
-/// Where an image is: at a URL, or under an identifier of the bag, or both.
-struct ImageDescription {
-  std::optional<std::string> url;
-  std::optional<std::string> id;
-};
 
 /// What the daemon itself reads in an answer of the service. Clients get the raw bytes.
 struct SearchResponse {
@@ -27,7 +21,7 @@ struct SearchResponse {
   bool isObject = false;
   std::vector<ResultSet> resultSets;  ///< the objects of an answer that is an array
   /// Found under "image" and "images" at up to 64 levels.
-  std::vector<ImageDescription> images;
+  std::vector<SBLImageDescription> images;
 
   /// Reads RFC 8259 text nested at most kMaximumJSONDepth deep; the error's reason is the parser's.
   static Expected<SearchResponse> parse(const std::string& text);
