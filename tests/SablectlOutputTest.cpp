@@ -2,7 +2,9 @@
 
 #include <nlohmann/json.hpp>
 
+#include "tests/support/TemporaryFolder.h"
 #include "tools/sablectl/AnswerOutput.h"
+#include "tools/sablectl/ImageFile.h"
 #include "tools/sablectl/RecordDocument.h"
 #include "tools/sablectl/RequestRecord.h"
 #include "tools/sablectl/Text.h"
@@ -45,6 +47,41 @@ TEST(Text, IsMeasuredAndCutInColumns) {
   EXPECT_EQ(aligned({{"日", "b"}, {"long", "c"}, {"x", ""}}),
             (std::vector<std::string>{"日    b", "long  c", "x"}));
   EXPECT_EQ(characters("ae\u0301日"), (std::vector<std::string>{"a", "e\u0301", "日"}));
+}
+
+TEST(ImageFile, TypesAreToldByTheFirstBytes) {
+  const std::pair<std::string_view, std::string_view> cases[] = {
+      {"\x89PNG\r\n\x1a\n...", "png"},
+      {"\xff\xd8\xff\xe0", "jpeg"},
+      {"GIF89a", "gif"},
+      {"RIFF____WEBPVP8 ", "webp"},
+      {std::string_view("\0\0\0 ftypavif", 12), "avif"},
+      {"<html>", "?"},
+      {"RIFF", "?"},
+      {"", "?"}};
+  for (const auto& [bytes, type] : cases) EXPECT_EQ(imageType(bytes), type) << bytes;
+}
+
+TEST(ImageFile, NamesArePlainAndNothingIsOverwritten) {
+  const std::pair<std::string, std::string> cases[] = {{"http://h/a/b.png", "b.png"},
+                                                       {"http://h/x?y=/etc/passwd", "x"},
+                                                       {"http://h/", "image"},
+                                                       {"http://h/..", "image"},
+                                                       {"http://h/.bashrc", "bashrc"},
+                                                       {"http://h/a%2fb\\c d", "a_2fb_c_d"},
+                                                       {"section.noun", "section.noun"},
+                                                       {"\x1b[31m", "__31m"},
+                                                       {std::string(300, 'x'), std::string(100, 'x')}};
+  for (const auto& [text, name] : cases) EXPECT_EQ(imageFileName(text), name) << text;
+
+  const TemporaryFolder folder;
+  const auto outside = folder / "outside", save = folder / "save";
+  EXPECT_EQ(saveImage(save, "a.png", "first"), save / "a.png");
+  EXPECT_EQ(saveImage(save, "a.png", "second"), save / "a-2.png");
+  std::filesystem::create_symlink(outside, save / "link");
+  EXPECT_EQ(saveImage(save, "link", "third"), save / "link-2");
+  EXPECT_FALSE(std::filesystem::exists(outside));
+  EXPECT_FALSE(saveImage(folder / "no" / "such", "a.png", "x"));
 }
 
 Answer answerWith(std::string data, bool fromNetwork) {

@@ -71,7 +71,7 @@ TEST(URL, ReferencesAreResolved) {
       {"ftp://h/", "ftp://h/"},
       {"file:///etc", nullptr},
       {"http://[::", nullptr},
-      {"a b", nullptr},
+      {"a b", "https://h:81/a/a%20b"},
       {"\x01", nullptr},
   };
   const auto base = URL::parse("https://h:81/a/b?q");

@@ -4,6 +4,7 @@
 
 #include <algorithm>
 #include <cctype>
+#include <charconv>
 #include <cstdint>
 #include <vector>
 
@@ -13,6 +14,7 @@ namespace {
 
 constexpr uint32_t kSide = 64;
 constexpr uint32_t kTile = 8;
+constexpr size_t kLargest = size_t{256} << 20;
 
 void putBigEndian(std::string& out, uint32_t value) {
   for (int shift = 24; shift >= 0; shift -= 8) out += static_cast<char>(value >> shift);
@@ -79,7 +81,20 @@ std::string drawImage(const std::string& name) {
 Answer imageAnswer(const Request& request) {
   const std::string name = request.path.substr(std::string_view("/images/").size());
   if (!isName(name)) return Answer::error(404, "there is no such image");
-  return Answer::tagged(request, "image/png", drawImage(name), "public, max-age=86400");
+  if (const auto target = request.item("to"); target && name == "redirect") {
+    Answer answer = Answer::empty(302);
+    answer.headers.emplace_back("Location", *target);
+    return answer;
+  }
+  std::string image = drawImage(name);
+  if (const auto text = request.item("bytes")) {
+    size_t length = 0;
+    const auto [end, error] = std::from_chars(text->data(), text->data() + text->size(), length);
+    const bool isNumber = error == std::errc() && end == text->data() + text->size();
+    if (!isNumber || length < image.size() || length > kLargest) return Answer::error(400, "bytes is wrong");
+    image.resize(length);
+  }
+  return Answer::tagged(request, "image/png", std::move(image), "public, max-age=86400");
 }
 
 }  // namespace service

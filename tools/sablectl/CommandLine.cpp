@@ -120,6 +120,30 @@ void addLookups(CLI::App& app, Invocation& invocation) {
   flight.add_flag("--lookup", *lookUp, "As the lookup of a flight, not as its search");
 }
 
+void addImages(CLI::App& app, Invocation& invocation) {
+  const auto options = std::make_shared<ImageOptions>();
+  CLI::App& command = *app.add_subcommand("images", "Load images that answers have named");
+  const auto collect = [&](auto member) {
+    return [options, member](const std::vector<std::string>& words) {
+      for (const std::string& word : words) (options->descriptions.emplace_back().*member) = word;
+    };
+  };
+  command
+      .add_option_function<std::vector<std::string>>("URL", collect(&SBLImageDescription::url),
+                                                     "Where images are")
+      ->type_name("");
+  command
+      .add_option_function<std::vector<std::string>>("--id", collect(&SBLImageDescription::id),
+                                                     "The bag's name of an image (repeatable)")
+      ->type_name("ID")
+      ->allow_extra_args(false);
+  command.add_option("--save", options->save, "Write the images into this folder")->type_name("DIR");
+  command.callback([&invocation, options] {
+    if (options->descriptions.empty()) throw CLI::RequiredError("a URL or --id");
+    invocation.command = [options](const Context& context) { return runImages(context, *options); };
+  });
+}
+
 void addAnyRequest(CLI::App& app, Invocation& invocation) {
   struct Words {
     std::string className;
@@ -188,6 +212,7 @@ std::variant<Invocation, ExitCode> readCommandLine(int argc, const char* const* 
   addOptions(app, invocation.options);
   addSearches(app, invocation);
   addLookups(app, invocation);
+  addImages(app, invocation);
   addAnyRequest(app, invocation);
   addQuestions(app, invocation);
   try {

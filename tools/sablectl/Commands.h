@@ -3,7 +3,9 @@
 #include <filesystem>
 #include <optional>
 #include <string>
+#include <vector>
 
+#include "SableKit/SBLImageDescription.h"
 #include "tools/sablectl/Context.h"
 
 /// What the tool does, a function a command. Each prints its result and says what to exit with.
@@ -14,6 +16,12 @@ ExitCode runRequest(const Context& context, const std::string& className,
                     const platform::RelayRecord& record);
 /// Asks for "t", "te", "tex", "text" one after the other; query ids ascend from the request's.
 ExitCode runType(const Context& context, SBLSearchRequest request);
+
+struct ImageOptions {
+  std::vector<SBLImageDescription> descriptions;
+  std::filesystem::path save;  ///< folder for the images; empty: none
+};
+ExitCode runImages(const Context& context, const ImageOptions& options);
 
 // What the daemon tells.
 /// What a search would do, and why: nothing is asked of the service.

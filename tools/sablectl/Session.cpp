@@ -25,14 +25,14 @@ Session::~Session() {
 
 /// Starts something and waits for what it calls back with; nullopt when that took too long.
 template <class Result, class Start>
-std::optional<Result> Session::await(Start start) {
+std::optional<Result> Session::await(Start start, platform::Duration grace) {
   // The handler may come after the waiting has ended.
   struct State {
     std::unique_ptr<platform::Semaphore> done;
     std::optional<Result> result;
   };
   const auto state = std::make_shared<State>(State{runtime_.semaphore(0), std::nullopt});
-  const auto deadline = runtime_.ticks() + timeout_;
+  const auto deadline = runtime_.ticks() + timeout_ + grace;
   start([state](Result result) {
     state->result = std::move(result);
     state->done->signal();
@@ -80,6 +80,14 @@ Expected<Bag> Session::bag() {
   });
   if (!bag) return platform::relayTimedOut();
   return std::move(*bag);
+}
+
+Expected<SBLClient::Images> Session::loadImages(const std::vector<SBLImageDescription>& descriptions) {
+  auto images = await<Expected<SBLClient::Images>>(
+      [&](auto done) { client_->loadImages(descriptions, runtime_.ticks() + timeout_, std::move(done)); },
+      std::chrono::seconds(1));
+  if (!images) return platform::relayTimedOut();
+  return std::move(*images);
 }
 
 Expected<RelayArguments> Session::call(const platform::RelayInterface& interface, std::size_t method,

@@ -3,6 +3,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "SableKit/SBLClient.h"
 #include "tools/sablectl/Host.h"
@@ -36,13 +37,15 @@ class Session {
   Answer request(const SBLAnyRequest& request);
   Answer request(const std::string& className, const platform::RelayRecord& record);
   Expected<Bag> bag();
+  /// Loads images; the daemon has the time-out to do so, and a second more to say what has come.
+  Expected<SBLClient::Images> loadImages(const std::vector<SBLImageDescription>& descriptions);
   /// Any other method that the daemon exports.
   Expected<platform::RelayArguments> call(const platform::RelayInterface& interface, std::size_t method,
                                           platform::RelayArguments arguments);
 
  private:
   template <class Result, class Start>
-  std::optional<Result> await(Start start);
+  std::optional<Result> await(Start start, platform::Duration grace = {});
 
   platform::Runtime& runtime_;
   const platform::Duration timeout_;
