@@ -151,7 +151,8 @@ void SBLClient::loadImages(const std::vector<SBLImageDescription>& descriptions,
                            platform::MonotonicTime deadline,
                            platform::Function<void(Expected<Images>)> handler) {
   const platform::MonotonicTime now = runtime_.ticks();
-  const auto nanoseconds = static_cast<std::uint64_t>(std::max(deadline.time_since_epoch().count(), 0L));
+  const auto nanoseconds =
+      static_cast<std::uint64_t>(std::max<std::int64_t>(deadline.time_since_epoch().count(), 0));
   RelayArguments arguments{encodeImageDescriptions(descriptions), nanoseconds};
   const auto timeout = timeout_ + std::clamp(deadline - now, platform::Duration{}, kLongestWait);
   connect([self = shared_from_this(), arguments = std::move(arguments), timeout,
