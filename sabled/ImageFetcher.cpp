@@ -60,6 +60,7 @@ struct ImageFetcher::Fetch {
   std::vector<Reply> replies;
   std::string current;  ///< after redirects
   int redirects = 0;
+  std::list<FetchPointer>::iterator place;  ///< in waiting_, until it runs
   bool running = false;
   bool ended = false;
   std::shared_ptr<platform::HTTPDataTask> task;
@@ -102,7 +103,7 @@ void ImageFetcher::enqueue(const std::string& url, const std::string& host, doub
     if (const auto late = weak.lock())
       end(late, tl::unexpected(httpError(HTTPErrorCode::timedOut, "no image in time")));
   });
-  waiting_.push_back(fetch);
+  fetch->place = waiting_.insert(waiting_.end(), fetch);
   startWaiting();
 }
 
@@ -187,13 +188,13 @@ void ImageFetcher::end(const FetchPointer& fetch, const Expected<Data>& outcome)
     const auto ofHost = runningByHost_.find(fetch->host);
     if (--ofHost->second == 0) runningByHost_.erase(ofHost);
   } else {
-    waiting_.remove(fetch);
+    waiting_.erase(fetch->place);
   }
   if (const auto task = std::exchange(fetch->task, nullptr)) task->cancel();
   if (!outcome) log().info("no image from {}: {}", fetch->asked, outcome.error().description());
   repliesOwed_ -= fetch->replies.size();
   for (Reply& reply : std::exchange(fetch->replies, {})) reply(outcome);
-  startWaiting();
+  if (fetch->running) startWaiting();
 }
 
 }  // namespace sable
