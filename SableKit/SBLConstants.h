@@ -30,4 +30,9 @@ inline constexpr std::string_view kSBLSessionSizeLimit = "SBLSessionSizeLimit";
 inline constexpr std::string_view kSBLSessionMaxAge = "SBLSessionMaxAge";
 inline constexpr std::string_view kSBLUseBramble = "SBLUseBramble";
 
+// Settings that the daemon writes: whether the bag lets the service answer the messages client (its
+// search for images by hashtag) and the news client, for these to show or hide what depends on it.
+inline constexpr std::string_view kSBLHashtagImagesVisible = "SBLHashtagImagesVisible";
+inline constexpr std::string_view kSBLNewsVisible = "SBLNewsVisible";
+
 }  // namespace sable

@@ -2,8 +2,11 @@
 
 #include <optional>
 #include <string>
+#include <string_view>
 
 namespace sable::platform {
+
+inline constexpr std::string_view kMapsServiceDidChangeNotification = "MapsServiceDidChange";
 
 /// The maps application's session, so that a search and a later map request can be told to belong
 /// together without naming the user.

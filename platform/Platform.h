@@ -14,6 +14,7 @@ class HTTPSessions;
 class InputModes;
 class LanguageTagger;
 class LocaleInfo;
+class LocationService;
 class ManagedConfiguration;
 class MapsService;
 class MemoryPressure;
@@ -48,6 +49,7 @@ class Platform {
   virtual LocaleInfo& localeInfo() = 0;
   virtual InputModes& inputModes() = 0;
   virtual CountryConfiguration& countryConfiguration() = 0;
+  virtual LocationService& locationService() = 0;
   virtual ManagedConfiguration& managedConfiguration() = 0;
   virtual AccountStore& accountStore() = 0;
   virtual MapsService& mapsService() = 0;

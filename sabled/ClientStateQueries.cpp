@@ -91,6 +91,7 @@ void ClientState::search(const SBLSearchRequest& request, SBLReplyHandler reply)
   if (const auto hit = cachedAnswer(request, nullptr)) return answerFromCache(*query, *hit);
   dispatch(query, searchRequest(*query, request, nullptr));
   assembly_.tally.add(kSBLSearchCounterKey, 1);
+  assembly_.requestFactory->setPerformedSearch();
 }
 
 std::optional<HTTPRequest> ClientState::searchRequest(const Query& query, const SBLSearchRequest& request,

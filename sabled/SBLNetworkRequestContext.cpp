@@ -10,6 +10,7 @@
 #include "platform/LocaleInfo.h"
 #include "platform/ManagedConfiguration.h"
 #include "platform/NetworkServiceProxy.h"
+#include "platform/Transaction.h"
 #include "platform/UserDefaults.h"
 #include "sabled/Assembly.h"
 #include "sabled/SBLNetworkRequestFactory.h"
@@ -49,6 +50,13 @@ std::vector<std::string> split(std::string_view text, char separator) {
   }
 }
 
+constexpr std::size_t kMaximumSubscriptionBytes = 64u << 10;
+
+/// Whether the service answers a client, where that client's application finds it without asking.
+void keepVisibility(platform::UserDefaults& defaults, std::string_view key, const SBLBag& clientsBag) {
+  if (defaults.boolean(key) != clientsBag.isEnabled()) defaults.set(key, clientsBag.isEnabled());
+}
+
 bool isRestricted(const platform::ManagedConfiguration& configuration) {
   return configuration.bookstoreAllowed() == platform::ManagedConfiguration::Effective::no ||
          !configuration.mediaStoreAllowed() || !configuration.appInstallationAllowed();
@@ -59,12 +67,15 @@ bool isRestricted(const platform::ManagedConfiguration& configuration) {
 SBLNetworkRequestFactory::SBLNetworkRequestFactory(Assembly& assembly)
     : assembly_(assembly),
       contextAccessQueue_(assembly.runtime.serialQueue("com.kestrel.sabled.contextaccess")),
+      locationQueue_(assembly.runtime.serialQueue("com.kestrel.sabled.location")),
       sabledUserAgent_(sable::sabledUserAgent(assembly.platform.deviceInfo())) {
   _updateLocaleContexts(false);
   _updateDeviceCountryCode(false);
   _updateTimeZoneName();
   _updateDeviceRestrictions();
-  _updateAccount();
+  _updateIsManagedAccount();
+  _updateStoreFrontIdentifier();
+  _updateMapsClientMetadata();
   _setupDebuggingQueryItems();
   observeContextChanges();
 }
@@ -80,10 +91,14 @@ void SBLNetworkRequestFactory::observeContextChanges() {
   on(platform::kCountryCodeDidChangeNotification, [this] { _updateDeviceCountryCode(true); });
   on(platform::kSystemTimeZoneDidChangeNotification, [this] { _updateTimeZoneName(); });
   on(platform::kEffectiveSettingsDidChangeNotification, [this] { _updateDeviceRestrictions(); });
-  on(platform::kAccountStoreDidChangeNotification, [this] { _updateAccount(); });
+  on(platform::kAccountStoreDidChangeNotification, [this] {
+    _updateIsManagedAccount();
+    _updateStoreFrontIdentifier();
+  });
+  on(platform::kMapsServiceDidChangeNotification, [this] { _updateMapsClientMetadata(); });
   observations_.push_back(assembly_.notificationCenter.observe(
       std::string(kSBLBagChangeNotification), [this](const platform::Notification& notification) {
-        if (const auto bag = bagFromNotification(notification)) _didGetBag(*bag);
+        if (const auto bag = bagFromNotification(notification)) _didGetBag(bag);
       }));
 }
 
@@ -93,27 +108,31 @@ void SBLNetworkRequestFactory::_updateLocaleContexts(bool notifyBagRefreshRequir
     context_.localeIdentifier = locale.localeIdentifier();
     context_.preferredLanguages = firstThreeAsJSON(locale.preferredLanguages());
     context_.effectiveSystemLanguage = locale.systemLanguage();
-    context_.conventions.reset();
+    context_.conventions.areCurrent = false;
     if (notifyBagRefreshRequired) _notifyBagRefreshRequired();
   });
 }
 
 const SBLNetworkRequestFactory::LocaleConventions& SBLNetworkRequestFactory::conventions() {
   contextAccessQueue_->assertIsCurrent();
-  if (!context_.conventions) {
-    const auto& locale = assembly_.platform.localeInfo();
-    LocaleConventions& made = context_.conventions.emplace(LocaleConventions{});
-    made.localeCalendarIdentifier = locale.calendarIdentifier();
-    made.localeMeasurementSystem = unitsName(locale.measurementSystem());
-    made.tempUnits = locale.temperatureUnit().value_or("").substr(0, 1);
-    made.is24hDateFormat = locale.hourPattern().find("HH") != std::string::npos;
-  }
-  return *context_.conventions;
+  LocaleConventions& known = context_.conventions;
+  if (known.areCurrent) return known;
+  const auto& locale = assembly_.platform.localeInfo();
+  known.localeCalendarIdentifier = locale.calendarIdentifier();
+  known.localeMeasurementSystem = unitsName(locale.measurementSystem());
+  if (const auto unit = locale.temperatureUnit()) known.tempUnits = unit->substr(0, 1);
+  known.is24hDateFormat = locale.hourPattern().find("HH") != std::string::npos;
+  known.areCurrent = true;
+  return known;
+}
+
+std::string SBLNetworkRequestFactory::getDeviceCountryCode(const platform::CountryConfiguration& country) {
+  return country.countryCode();
 }
 
 void SBLNetworkRequestFactory::_updateDeviceCountryCode(bool notifyBagRefreshRequired) {
   contextAccessQueue_->async([this, notifyBagRefreshRequired] {
-    context_.geoDeviceCountryCode = assembly_.platform.countryConfiguration().countryCode();
+    context_.geoDeviceCountryCode = getDeviceCountryCode(assembly_.platform.countryConfiguration());
     if (notifyBagRefreshRequired) _notifyBagRefreshRequired();
   });
 }
@@ -134,14 +153,37 @@ void SBLNetworkRequestFactory::_updateDeviceRestrictions() {
   });
 }
 
-void SBLNetworkRequestFactory::_updateAccount() {
+void SBLNetworkRequestFactory::_updateIsManagedAccount() {
   contextAccessQueue_->async([this] {
-    const auto& accounts = assembly_.platform.accountStore();
-    context_.storeFrontIdentifier = accounts.storeFrontIdentifier().value_or("");
-    const bool managed = accounts.primaryAccountIsManaged();
+    const bool managed = assembly_.platform.accountStore().primaryAccountIsManaged();
     if (managed == context_.isManagedAccount) return;
     context_.isManagedAccount = managed;
     log().standard("updating managed account status to: {:d}", managed);
+  });
+}
+
+void SBLNetworkRequestFactory::_updateStoreFrontIdentifier() {
+  contextAccessQueue_->async([this] {
+    context_.storeFrontIdentifier = assembly_.platform.accountStore().storeFrontIdentifier().value_or("");
+  });
+}
+
+void SBLNetworkRequestFactory::_updateMapsClientMetadata() {
+  contextAccessQueue_->async(
+      [this] { context_.geoClientMetadata = assembly_.platform.mapsService().clientMetadata(); });
+}
+
+void SBLNetworkRequestFactory::setSubscriptionInfo(std::optional<std::string> json) {
+  contextAccessQueue_->async([this, json = std::move(json)] {
+    context_.subscriptionInfo.reset();
+    if (!json) return;
+    // Written anew, so that a header holds one line of it.
+    const auto list = parseJSON(*json, kMaximumSubscriptionBytes);
+    if (list && list->is_array()) {
+      context_.subscriptionInfo = compactJSON(*list);
+    } else {
+      log().error("subscriptions are not told: {}", list ? "no array" : list.error().reason);
+    }
   });
 }
 
@@ -169,10 +211,27 @@ void SBLNetworkRequestFactory::_notifyBagRefreshRequired() {
   });
 }
 
-void SBLNetworkRequestFactory::_didGetBag(const SBLBag& bag) {
+void SBLNetworkRequestFactory::_didGetBag(const std::shared_ptr<const SBLBag>& bag) {
+  contextAccessQueue_->async([this, bag] {
+    context_.supportedGeoLocationSources = bag->supportedGeoLocationSources();
+    if (!std::exchange(context_.hadBag, true)) _setupLocationServices();
+  });
+  assembly_.runtime.globalQueue(platform::QualityOfService::background)
+      .async([this, bag, transaction = assembly_.platform.transactions().open("updatePC")] {
+        updateHashtagImagesVisibility(*bag);
+        updateNewsVisibility(*bag);
+      });
   const auto configured =
-      assembly_.platform.networkServiceProxy().setConfiguration("sabled", bag.brambleConfiguration());
+      assembly_.platform.networkServiceProxy().setConfiguration("sabled", bag->brambleConfiguration());
   if (!configured) log().error("PXS configuration failed.");
+}
+
+void SBLNetworkRequestFactory::updateHashtagImagesVisibility(const SBLBag& bag) {
+  keepVisibility(assembly_.userDefaults, kSBLHashtagImagesVisible, SBLBag(bag.rawBag(), "messages/1.0"));
+}
+
+void SBLNetworkRequestFactory::updateNewsVisibility(const SBLBag& bag) {
+  keepVisibility(assembly_.userDefaults, kSBLNewsVisible, SBLBag(bag.rawBag(), "news/1.0"));
 }
 
 std::optional<platform::MapsService::SessionEntity>

@@ -83,6 +83,8 @@ std::optional<HTTPRequest> SBLNetworkRequestFactory::searchRequest(const SBLSear
   if (!bag.searchURL()) return std::nullopt;
   const bool withLocation = (fieldMask & kSBLFieldMaskNoLocation) == 0;
   const auto steps = [&](Builder& builder) {
+    // Whoever only wants to know how the request comes about need not be located for it.
+    if (trace == nullptr) _startUpdatingLocation();
     builder.beginStep("query");
     builder.forceQueryItemWithName("q", input.queryString);
     constexpr std::int64_t kSuggestionTapped = 8, kSuggestionTyped = 10;
@@ -131,6 +133,7 @@ std::optional<HTTPRequest> SBLNetworkRequestFactory::zeroKeywordRequest(const SB
                                                                         unsigned fieldMask) {
   if (!bag.searchURL()) return std::nullopt;
   HTTPRequest request = build(*bag.searchURL(), [&](Builder& builder) {
+    _startUpdatingLocation();
     builder.forceQueryItemWithName("qtype", "zkw");
     builder.forceQueryItemsFromArray(input.queryItems);
     _addDebugQueryItems(builder);
@@ -168,6 +171,7 @@ HTTPRequest SBLNetworkRequestFactory::moreResultsRequest(const SBLMoreResultsReq
                                                          unsigned fieldMask) {
   const bool withLocation = (fieldMask & kSBLFieldMaskNoLocation) == 0;
   HTTPRequest request = build(input.moreResultsURL, [&](Builder& builder) {
+    if (!builder.containsQueryItemWithName("latlng")) _startUpdatingLocation();
     builder.forceQueryItemsFromArray(input.queryItems);
     _addDebugQueryItems(builder);
     _addSecretKeyQueryItem(builder);
@@ -194,6 +198,7 @@ std::optional<HTTPRequest> SBLNetworkRequestFactory::lookupRequest(const SBLLook
                                                                    const SBLBag& bag, const UUID& userGuid) {
   if (!bag.searchURL()) return std::nullopt;
   HTTPRequest request = build(*bag.searchURL(), [&](Builder& builder) {
+    _startUpdatingLocation();
     builder.forceQueryItemWithName("q", input.queryString);
     builder.forceQueryItemsFromArray(input.queryItems);
     _addDebugQueryItems(builder);

@@ -2,19 +2,26 @@
 
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <string_view>
 #include <vector>
 
 #include "SableKit/SBLRequest.h"
 #include "platform/HTTPSession.h"
+#include "platform/LocationService.h"
 #include "platform/MapsService.h"
 #include "platform/NotificationCenter.h"
 #include "platform/Runtime.h"
 #include "platform/URL.h"
 #include "platform/UUID.h"
+#include "sabled/CoarseLocation.h"
 
 namespace sable {
+
+namespace platform {
+class CountryConfiguration;
+}
 
 class Assembly;
 class RequestTrace;
@@ -33,8 +40,8 @@ inline constexpr std::string_view kUIScaleHeader = "X-Kestrel-UI-Scale";
 inline constexpr unsigned kSBLFieldMaskNoLocation = 1;
 
 /// Builds every request that the daemon sends, from what the client asked, the bag and the context
-/// of the device (locale, country, time zone, restrictions), which it keeps current. Any thread:
-/// each entry point builds synchronously on the context queue, so that one request sees one
+/// of the device (locale, location, country, time zone, restrictions), which it keeps current. Any
+/// thread: each entry point builds synchronously on the context queue, so that one request sees one
 /// context. docs/service.md lists every item and header.
 class SBLNetworkRequestFactory {
  public:
@@ -71,8 +78,15 @@ class SBLNetworkRequestFactory {
   /// A product token such as "Beacon/1" as a full user agent; "" for an empty token.
   std::string createUserAgentString(std::string_view product) const;
 
-  /// The map session that searches and later map requests share.
+  /// The map session that searches and later map requests share; `reset` begins a new one first.
   std::optional<platform::MapsService::SessionEntity> getMapsUserSessionEntityAndReset(bool reset);
+
+  /// A search was sent: downloads for lookups may from now on tell where the device is now.
+  void setPerformedSearch();
+
+  /// What requests say about the user's video subscriptions: a JSON array, or nothing. Text that is
+  /// no JSON array counts as nothing.
+  void setSubscriptionInfo(std::optional<std::string> json);
 
  private:
   using Builder = SableURLRequestBuilder;
@@ -80,6 +94,7 @@ class SBLNetworkRequestFactory {
   /// What the locale's conventions make of numbers and dates. Working them out loads locale data,
   /// so that waits for the first request that carries them.
   struct LocaleConventions {
+    bool areCurrent = false;
     std::string localeCalendarIdentifier;
     std::string localeMeasurementSystem;
     std::string tempUnits;
@@ -88,20 +103,30 @@ class SBLNetworkRequestFactory {
 
   /// Everything a request says about the device; empty: not known.
   struct Context {
+    struct Location {
+      CoarseLocation place;
+      platform::WallTime timestamp;
+    };
+
     std::string localeIdentifier;
     std::string effectiveSystemLanguage;
     std::string preferredLanguages;  ///< JSON array of up to three
-    std::optional<LocaleConventions> conventions;
+    LocaleConventions conventions;
     std::string geoDeviceCountryCode;
     std::string localTimeZoneName;
-    std::string geoLocationLatLng;  ///< "latitude,longitude"
-    std::string lookupGeoLocationLatLng;
-    std::string geoLocationSource;
+    std::set<std::string> supportedGeoLocationSources;  ///< that the bag allows
+    std::shared_ptr<platform::LocationManager> locationManager;
+    std::optional<Location> geoLocation;  ///< the last fix that was accepted
+    std::string geoLocationLatLng;        ///< "latitude,longitude" of it
+    std::string lookupGeoLocationLatLng;  ///< likewise, when the last search was sent
+    std::string geoLocationSource;        ///< its source, or why there is none
+    std::optional<std::string> geoClientMetadata;
     std::string storeFrontIdentifier;
     std::optional<std::string> subscriptionInfo;
     std::optional<std::string> appWhitelistSignature;
     bool isManagedAccount = false;
     bool deviceRestricted = false;
+    bool hadBag = false;
     std::vector<platform::URLQueryItem> debuggingQueryItems;
   };
 
@@ -155,17 +180,37 @@ class SBLNetworkRequestFactory {
   // The context half.
   void observeContextChanges();
   void _updateLocaleContexts(bool notifyBagRefreshRequired);
+  static std::string getDeviceCountryCode(const platform::CountryConfiguration& country);
   void _updateDeviceCountryCode(bool notifyBagRefreshRequired);
   void _updateTimeZoneName();
   void _updateDeviceRestrictions();
-  void _updateAccount();
+  void _updateIsManagedAccount();
+  void _updateStoreFrontIdentifier();
+  void _updateMapsClientMetadata();
   void _setupDebuggingQueryItems();
   void _notifyBagRefreshRequired();
-  void _didGetBag(const SBLBag& bag);
+  void _didGetBag(const std::shared_ptr<const SBLBag>& bag);
+  void updateHashtagImagesVisibility(const SBLBag& bag);
+  void updateNewsVisibility(const SBLBag& bag);
   const LocaleConventions& conventions();
+
+  // Location. The host tells what it has on locationQueue_; all else is on the context queue.
+  void _setupLocationServices();
+  void didChangeAuthorization(platform::LocationAuthorization status);
+  void didUpdateLocation(const platform::LocationFix& fix);
+  void didFail(const std::string& reason);
+  void _didChangeAuthorization(platform::LocationAuthorization status);
+  void _startUpdatingLocation();
+  void stopUpdatingLocation();
+  static std::string_view _locationSourceForLocation(const platform::LocationFix& fix);
+  bool _setLocationIfAllowedByBag(const platform::LocationFix& fix);
+  bool _setLocation(const platform::LocationFix& fix, const std::string& source);
+  void _setNoLocationWithReason(std::string_view reason);
+  const std::string& _getLookupLatLng() const;
 
   Assembly& assembly_;
   const std::shared_ptr<platform::SerialQueue> contextAccessQueue_;
+  const std::shared_ptr<platform::SerialQueue> locationQueue_;
   const std::string sabledUserAgent_;
 
   Context context_;  ///< on contextAccessQueue_

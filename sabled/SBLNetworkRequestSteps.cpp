@@ -228,7 +228,7 @@ void SBLNetworkRequestFactory::_addHttpRequestTopTopics(Builder& builder,
 
 void SBLNetworkRequestFactory::_addHttpFuzzedLocation(Builder& builder) const {
   beginStep(builder, __func__);
-  addHeaderIfPresent(builder, "X-Kestrel-FuzzedLatLong", context_.lookupGeoLocationLatLng);
+  addHeaderIfPresent(builder, "X-Kestrel-FuzzedLatLong", _getLookupLatLng());
 }
 
 void SBLNetworkRequestFactory::_addHttpIfNoneMatch(Builder& builder, std::string_view version) const {
@@ -238,8 +238,8 @@ void SBLNetworkRequestFactory::_addHttpIfNoneMatch(Builder& builder, std::string
 
 void SBLNetworkRequestFactory::_addHttpGeoClientMetadata(Builder& builder) const {
   beginStep(builder, __func__);
-  if (const auto metadata = assembly_.platform.mapsService().clientMetadata()) {
-    builder.defaultHttpHeaderWithName("X-Kestrel-GeoMetadata", *metadata);
+  if (context_.geoClientMetadata) {
+    builder.defaultHttpHeaderWithName("X-Kestrel-GeoMetadata", *context_.geoClientMetadata);
   }
 }
 

@@ -17,6 +17,8 @@ constexpr std::array kSettings{
     KnownKey{"SBLDebugParameters", string},
     KnownKey{"SBLDefaultBagURL", string},
     KnownKey{"SBLDefaultBagURLCN", string},
+    KnownKey{"SBLHashtagImagesVisible", boolean},
+    KnownKey{"SBLNewsVisible", boolean},
     KnownKey{"SBLNoParallax", boolean},
     KnownKey{"SBLNoQueryCache", boolean},
     KnownKey{"SBLPersistSessions", boolean},
@@ -55,7 +57,7 @@ constexpr std::array kFacts{
     KnownKey{"on_battery", boolean},
     KnownKey{"metered", boolean},
     KnownKey{"memory_pressure_file", string},
-    KnownKey{"location", table},
+    KnownKey{"location", location},
     KnownKey{"subscriptions", tables},
     KnownKey{"applications", tables},
 };
@@ -79,6 +81,17 @@ void checkFile(const std::filesystem::path& path, std::span<const KnownKey> know
     problems.push_back(
         fmt::format("{}:{}:{}: {}: {}", path.native(), value.line, value.column, name, problem));
   }
+}
+
+bool isLocation(const Dictionary& value) {
+  if (!value.is_object()) return false;
+  const auto items = value.items();
+  return std::all_of(items.begin(), items.end(), [](const auto& member) {
+    const std::string& name = member.key();
+    if (name == "authorization" || name == "type") return member.value().is_number_integer();
+    const bool isNumber = name == "latitude" || name == "longitude" || name == "timestamp";
+    return isNumber && member.value().is_number();
+  });
 }
 
 bool allOf(const Dictionary& value, bool (Dictionary::*is)() const noexcept) {
@@ -106,6 +119,8 @@ std::string_view typeName(ValueType type) {
       return "an array of strings";
     case table:
       return "a table";
+    case location:
+      return "a table of authorization, latitude, longitude, type and timestamp, rightly typed";
     case tables:
       return "an array of tables";
   }
@@ -131,6 +146,8 @@ bool hasType(const TOMLValue& entry, ValueType type) {
       return allOf(value, &Dictionary::is_string);
     case table:
       return value.is_object();
+    case location:
+      return isLocation(value);
     case tables:
       return allOf(value, &Dictionary::is_object);
   }

@@ -10,7 +10,7 @@
 
 namespace sable::platform::host {
 
-enum class ValueType { boolean, integer, number, string, date, array, strings, table, tables };
+enum class ValueType { boolean, integer, number, string, date, array, strings, table, tables, location };
 
 /// "a boolean", "an array of strings".
 std::string_view typeName(ValueType type);

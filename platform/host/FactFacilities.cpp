@@ -75,10 +75,16 @@ std::optional<std::string> HostAccountStore::storeFrontIdentifier() const {
   return facts_.string("storefront");
 }
 
-std::optional<MapsService::SessionEntity> HostMapsService::userSessionEntity(bool /*reset*/) {
-  auto session = facts_.string("geo_session_id");
-  if (!session) return std::nullopt;
-  return SessionEntity{*session, *session};
+std::optional<MapsService::SessionEntity> HostMapsService::userSessionEntity(bool reset) {
+  const auto fact = facts_.string("geo_session_id");
+  if (!fact) return std::nullopt;
+  const std::lock_guard lock(mutex_);
+  if (reset) {
+    replacedFact_ = *fact;
+    session_ = runtime_.uuid().string();
+  }
+  const std::string& session = !session_.empty() && replacedFact_ == *fact ? session_ : *fact;
+  return SessionEntity{session, session};
 }
 
 std::string HostMapsService::environmentName() const {

@@ -1,5 +1,7 @@
 #pragma once
 
+#include <mutex>
+
 #include "platform/AccountStore.h"
 #include "platform/CountryConfiguration.h"
 #include "platform/InputModes.h"
@@ -57,16 +59,22 @@ class HostAccountStore final : public AccountStore {
   const HostFacts& facts_;
 };
 
-/// No maps service, environment "prod". A session that the facts name cannot be reset.
+/// No maps service, environment "prod". The session that the facts name serves until it is reset;
+/// then sessions are drawn at random, until the facts name another.
 class HostMapsService final : public MapsService {
  public:
-  explicit HostMapsService(const HostFacts& facts) : facts_(facts) {}
+  HostMapsService(Runtime& runtime, const HostFacts& facts) : runtime_(runtime), facts_(facts) {}
   std::optional<SessionEntity> userSessionEntity(bool reset) override;
   std::string environmentName() const override;
   std::optional<std::string> clientMetadata() const override;
 
  private:
+  Runtime& runtime_;
   const HostFacts& facts_;
+
+  std::mutex mutex_;
+  std::string replacedFact_;  ///< that session_ stands in for
+  std::string session_;
 };
 
 }  // namespace sable::platform::host

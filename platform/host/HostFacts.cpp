@@ -8,6 +8,7 @@
 #include "platform/LocaleInfo.h"
 #include "platform/Log.h"
 #include "platform/ManagedConfiguration.h"
+#include "platform/MapsService.h"
 #include "platform/host/ConfigurationSchema.h"
 #include "platform/host/LocaleNames.h"
 
@@ -25,8 +26,8 @@ struct Subject {
   Answer answer = nullptr;
 };
 
-const std::array<Subject, 5>& subjects() {
-  static const std::array<Subject, 5> all{
+const std::array<Subject, 7>& subjects() {
+  static const std::array<Subject, 7> all{
       Subject{kCurrentLocaleDidChangeNotification,
               {"calendar", "measurement_system", "temperature_unit", "preferred_languages", "system_language",
                "hour_cycle_24"},
@@ -38,6 +39,8 @@ const std::array<Subject, 5>& subjects() {
           {"diagnostics_allowed", "bookstore_allowed", "media_store_allowed", "app_installation_allowed"}},
       Subject{kAccountStoreDidChangeNotification,
               {"managed_account", "music_subscription_status", "storefront"}},
+      Subject{kMapsServiceDidChangeNotification, {"geo_session_id", "geo_environment", "geo_metadata"}},
+      Subject{kLocationFactsDidChangeNotification, {"location"}},
   };
   return all;
 }
@@ -135,6 +138,13 @@ std::optional<double> HostFacts::number(std::string_view key) const {
 }
 std::optional<std::vector<std::string>> HostFacts::strings(std::string_view key) const {
   return stringsMember(*facts(), key);
+}
+
+std::shared_ptr<const Dictionary> HostFacts::table(std::string_view key) const {
+  auto all = facts();
+  const auto found = all->find(key);
+  if (found == all->end() || !found->is_object()) return nullptr;
+  return {std::move(all), &*found};
 }
 
 std::string HostFacts::localeIdentifier() const {

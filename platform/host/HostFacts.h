@@ -14,6 +14,9 @@
 
 namespace sable::platform::host {
 
+/// Posted when the table "location" becomes another, or comes or goes.
+inline constexpr std::string_view kLocationFactsDidChangeNotification = "LocationFactsDidChange";
+
 /// Where the facilities look for facts about the host; tests give others.
 struct HostSources {
   Environment environment = processEnvironment;
@@ -38,6 +41,8 @@ class HostFacts {
   std::optional<std::int64_t> integer(std::string_view key) const;
   std::optional<double> number(std::string_view key) const;
   std::optional<std::vector<std::string>> strings(std::string_view key) const;
+  /// Null when there is none.
+  std::shared_ptr<const Dictionary> table(std::string_view key) const;
 
   // What several facilities are asked about: the fact, else the host's answer.
   std::string localeIdentifier() const;

@@ -13,6 +13,7 @@
 #include "platform/host/HostFileManager.h"
 #include "platform/host/HostHTTPSession.h"
 #include "platform/host/HostLocaleInfo.h"
+#include "platform/host/HostLocation.h"
 #include "platform/host/HostMemoryPressure.h"
 #include "platform/host/HostNotify.h"
 #include "platform/host/HostProcess.h"
@@ -52,6 +53,7 @@ struct HostPlatform::Facilities {
       : socketPath(std::move(configuration.socketPath)) {}
 
   TOMLUserDefaults& settings() { return userDefaults.get(folders, runtime, runtime.reactor(), fileManager); }
+  HostLocationService& location() { return locationService.get(runtime, hostFacts(), notificationCenter); }
   HostFacts& hostFacts() { return facts.get(folders, HostSources{}, runtime.reactor(), notificationCenter); }
 
   const std::filesystem::path socketPath;
@@ -74,6 +76,7 @@ struct HostPlatform::Facilities {
   Lazy<HostLocaleInfo> localeInfo;
   Lazy<HostInputModes> inputModes;
   Lazy<HostCountryConfiguration> countryConfiguration;
+  Lazy<HostLocationService> locationService;
   Lazy<HostManagedConfiguration> managedConfiguration;
   Lazy<HostAccountStore> accountStore;
   Lazy<HostMapsService> mapsService;
@@ -156,6 +159,10 @@ CountryConfiguration& HostPlatform::countryConfiguration() {
   return facilities_->countryConfiguration.get(facilities_->hostFacts());
 }
 
+LocationService& HostPlatform::locationService() {
+  return facilities_->location();
+}
+
 ManagedConfiguration& HostPlatform::managedConfiguration() {
   return facilities_->managedConfiguration.get(facilities_->hostFacts());
 }
@@ -164,7 +171,7 @@ AccountStore& HostPlatform::accountStore() {
   return facilities_->accountStore.get(facilities_->hostFacts());
 }
 MapsService& HostPlatform::mapsService() {
-  return facilities_->mapsService.get(facilities_->hostFacts());
+  return facilities_->mapsService.get(facilities_->runtime, facilities_->hostFacts());
 }
 
 std::vector<Availability> HostPlatform::availability() {
@@ -174,6 +181,7 @@ std::vector<Availability> HostPlatform::availability() {
   return {
       {"counters", tallyFile.isPersistent(), facilities_->folders.counters().string()},
       {"maps service", mapsService().userSessionEntity(false).has_value(), "geo_session_id of the facts"},
+      facilities_->location().availability(),
       facilities_->notify.get(facilities_->runtime).availability(),
       facilities_->memoryPressure.get(facilities_->runtime.reactor()).availability(),
   };

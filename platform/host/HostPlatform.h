@@ -38,6 +38,7 @@ class HostPlatform final : public Platform {
   LocaleInfo& localeInfo() override;
   InputModes& inputModes() override;
   CountryConfiguration& countryConfiguration() override;
+  LocationService& locationService() override;
   ManagedConfiguration& managedConfiguration() override;
   AccountStore& accountStore() override;
   MapsService& mapsService() override;

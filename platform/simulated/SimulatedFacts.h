@@ -154,7 +154,13 @@ class SimulatedMapsService final : public MapsService {
  public:
   std::vector<SessionEntity> sessions;  ///< empty: there is no maps service
   std::string environment = "prod";
-  std::optional<std::string> metadata;
+
+  explicit SimulatedMapsService(NotificationCenter& center) : center_(center) {}
+
+  void changeMetadata(std::optional<std::string> metadata) {
+    metadata_ = std::move(metadata);
+    center_.post({kMapsServiceDidChangeNotification, this, {}});
+  }
 
   std::optional<SessionEntity> userSessionEntity(bool reset) override {
     if (reset) ++resets_;
@@ -162,11 +168,13 @@ class SimulatedMapsService final : public MapsService {
     return sessions.empty() ? std::nullopt : std::optional(sessions[current_]);
   }
   std::string environmentName() const override { return environment; }
-  std::optional<std::string> clientMetadata() const override { return metadata; }
+  std::optional<std::string> clientMetadata() const override { return metadata_; }
 
   int resets() const { return resets_; }
 
  private:
+  NotificationCenter& center_;
+  std::optional<std::string> metadata_;
   std::size_t current_ = 0;
   int resets_ = 0;
 };

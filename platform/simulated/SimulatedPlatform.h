@@ -7,6 +7,7 @@
 #include "platform/simulated/SimulatedFacts.h"
 #include "platform/simulated/SimulatedFileManager.h"
 #include "platform/simulated/SimulatedHTTP.h"
+#include "platform/simulated/SimulatedLocation.h"
 #include "platform/simulated/SimulatedMemoryPressure.h"
 #include "platform/simulated/SimulatedNotify.h"
 #include "platform/simulated/SimulatedProcess.h"
@@ -40,6 +41,7 @@ class SimulatedPlatform final : public Platform {
   SimulatedLocaleInfo& localeInfo() override { return localeInfo_; }
   SimulatedInputModes& inputModes() override { return inputModes_; }
   SimulatedCountryConfiguration& countryConfiguration() override { return countryConfiguration_; }
+  SimulatedLocationService& locationService() override { return locationService_; }
   SimulatedManagedConfiguration& managedConfiguration() override { return managedConfiguration_; }
   SimulatedAccountStore& accountStore() override { return accountStore_; }
   SimulatedMapsService& mapsService() override { return mapsService_; }
@@ -60,9 +62,10 @@ class SimulatedPlatform final : public Platform {
   SimulatedLocaleInfo localeInfo_{notificationCenter_};
   SimulatedInputModes inputModes_;
   SimulatedCountryConfiguration countryConfiguration_{notificationCenter_};
+  SimulatedLocationService locationService_;
   SimulatedManagedConfiguration managedConfiguration_{notificationCenter_};
   SimulatedAccountStore accountStore_{notificationCenter_};
-  SimulatedMapsService mapsService_;
+  SimulatedMapsService mapsService_{notificationCenter_};
   ScriptLanguageTagger languageTagger_;
   ConfiguredServiceProxy networkServiceProxy_;
 

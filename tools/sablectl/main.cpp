@@ -1,7 +1,9 @@
 #include <cstdio>
 
 #include "platform/host/Folders.h"
+#include "platform/host/HostFacts.h"
 #include "platform/host/HostFileManager.h"
+#include "platform/host/HostLocation.h"
 #include "platform/host/HostMemoryPressure.h"
 #include "platform/host/HostNotify.h"
 #include "platform/host/HostRelay.h"
@@ -25,8 +27,11 @@ std::vector<NamedPath> placesOf(const host::Folders& folders) {
           {"user facts", folders.userFacts()},       {"system facts", folders.systemFacts}};
 }
 
-std::vector<sable::platform::Availability> probe(host::HostRuntime& runtime) {
-  return {host::HostNotify(runtime).availability(),
+std::vector<sable::platform::Availability> probe(const host::Folders& folders, host::HostRuntime& runtime) {
+  sable::platform::NotificationCenter notificationCenter;
+  const host::HostFacts facts(folders, {}, runtime.reactor(), notificationCenter);
+  return {host::HostLocationService(runtime, facts, notificationCenter).availability(),
+          host::HostNotify(runtime).availability(),
           host::HostMemoryPressure(runtime.reactor()).availability()};
 }
 
@@ -51,7 +56,7 @@ ExitCode run(const Invocation& invocation) {
       .places = placesOf(folders),
       .endpointOf = [](const std::filesystem::path& path) { return host::endpointOf(path.native()); },
       .readCounters = host::MappedTally::snapshotOf,
-      .availability = [&runtime] { return probe(runtime); },
+      .availability = [&folders, &runtime] { return probe(folders, runtime); },
   };
   const Output output = Output::standard(invocation.options.json);
   const ExitCode code = invocation.command({machine, invocation.options, output});
