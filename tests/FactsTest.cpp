@@ -8,6 +8,7 @@
 #include "platform/host/HostLocaleInfo.h"
 #include "platform/host/LocaleNames.h"
 #include "platform/simulated/SimulatedLog.h"
+#include "platform/simulated/SimulatedRuntime.h"
 #include "tests/support/ManualReactor.h"
 #include "tests/support/TemporaryFolder.h"
 
@@ -137,7 +138,8 @@ TEST_F(FactsTest, WithoutFactsTheHostAnswers) {
   EXPECT_EQ(device.answer("ProductType"), "Standard PC (Q35 + ICH9, 2009)");
   EXPECT_EQ(device.answer("BuildVersion"), "12");
 
-  HostMapsService maps(*facts);
+  simulated::SimulatedRuntime runtime;
+  HostMapsService maps(runtime, *facts);
   EXPECT_FALSE(maps.userSessionEntity(true));
   EXPECT_EQ(maps.environmentName(), "prod");
   EXPECT_FALSE(maps.clientMetadata());
@@ -151,9 +153,15 @@ TEST_F(FactsTest, WithoutFactsTheHostAnswers) {
       "geo_session_id = \"S\"\nkeyboard_input_mode = \"en_GB@sw=QWERTY\"\nproduct_type = \"SableBook1,1\"");
   EXPECT_EQ(maps.userSessionEntity(false)->sessionId, "S");
   EXPECT_EQ(maps.userSessionEntity(false)->entityString, "S");
+  const std::string drawn = maps.userSessionEntity(true)->sessionId;
+  EXPECT_NE(drawn, "S");
+  EXPECT_EQ(maps.userSessionEntity(false)->sessionId, drawn);
+  EXPECT_NE(maps.userSessionEntity(true)->sessionId, drawn);
   EXPECT_EQ(HostInputModes(*facts).preference(12), "en_GB@sw=QWERTY");
   EXPECT_FALSE(HostInputModes(*facts).preference(11));
   EXPECT_EQ(device.answer("ProductType"), "SableBook1,1");
+  change("geo_session_id = \"T\"");
+  EXPECT_EQ(maps.userSessionEntity(false)->sessionId, "T");
 }
 
 TEST_F(FactsTest, WhatFollowsFromTheLocale) {

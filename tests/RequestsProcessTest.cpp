@@ -27,6 +27,10 @@ managed_account = true
 geo_environment = "prod"
 geo_session_id = "session-1"
 geo_metadata = "meta-1"
+[location]
+latitude = 51.507351
+longitude = -0.127758
+type = 5
 )";
 
 constexpr const char* kAgent = "Sabled/1.0 (SableBook1,1; Debian 12.5) sablectl/1.0";
@@ -49,7 +53,9 @@ Pairs headers(const json& request) {
 
 class Requests : public testing::Test {
  protected:
-  Requests() : world_({.settings = "SBLUseBramble = false", .facts = kFacts}) {}
+  Requests() : world_({.settings = "SBLUseBramble = false", .facts = kFacts}) {
+    world_.waitForLog("location: wifi");
+  }
 
   json only(std::string_view path, std::initializer_list<std::string> command) {
     EXPECT_EQ(world_.sablectl(command).exitCode, 0);
@@ -83,8 +89,10 @@ TEST_F(Requests, ASearchCarriesTheWholeContext) {
                                    {"card", "1"},
                                    {"cc", "GB"},
                                    {"esl", "en-GB"},
+                                   {"geosrc", "wifi"},
                                    {"kb_ime", "en_GB@sw=QWERTY"},
                                    {"key", "tandem4371"},
+                                   {"latlng", "51.500000,-0.100000"},
                                    {"locale", "en_GB"},
                                    {"mode", "managed"},
                                    {"q", "weather; now"},
@@ -103,8 +111,10 @@ TEST_F(Requests, ZeroKeywordIsASearchWithoutAQuery) {
                                    {"calendar", "gregorian"},
                                    {"cc", "GB"},
                                    {"esl", "en-GB"},
+                                   {"geosrc", "wifi"},
                                    {"kb_ime", "en_GB@sw=QWERTY"},
                                    {"key", "tandem4371"},
+                                   {"latlng", "51.500000,-0.100000"},
                                    {"locale", "en_GB"},
                                    {"mode", "managed"},
                                    {"qtype", "zkw"},
@@ -123,8 +133,10 @@ TEST_F(Requests, ALookupTellsWhereItComesFrom) {
   EXPECT_EQ(items(request), (Pairs{{"cc", "GB"},
                                    {"context", "org.example.Reader"},
                                    {"esl", "en-GB"},
+                                   {"geosrc", "wifi"},
                                    {"kb_ime", "en_GB@sw=QWERTY"},
                                    {"key", "tandem4371"},
+                                   {"latlng", "51.500000,-0.100000"},
                                    {"lctxlang", "de"},
                                    {"ldomain", "nature"},
                                    {"locale", "en_GB"},
@@ -144,7 +156,9 @@ TEST_F(Requests, ALookupTellsWhereItComesFrom) {
 TEST_F(Requests, MoreResultsAndCardsKeepTheItemsOfTheirUrl) {
   const json more = only("/more", {"more", world_.serviceURL() + "/more?q=weather&offset=10&locale=de"});
   EXPECT_EQ(items(more), (Pairs{{"esl", "en-GB"},
+                                {"geosrc", "wifi"},
                                 {"key", "tandem4371"},
+                                {"latlng", "51.500000,-0.100000"},
                                 {"locale", "de"},
                                 {"mode", "managed"},
                                 {"offset", "10"},
@@ -158,8 +172,10 @@ TEST_F(Requests, MoreResultsAndCardsKeepTheItemsOfTheirUrl) {
   const json card = only("/card", {"card", world_.serviceURL() + "/card?id=1"});
   EXPECT_EQ(items(card), (Pairs{{"cc", "GB"},
                                 {"esl", "en-GB"},
+                                {"geosrc", "wifi"},
                                 {"id", "1"},
                                 {"key", "tandem4371"},
+                                {"latlng", "51.500000,-0.100000"},
                                 {"locale", "en_GB"},
                                 {"storefront", "143444"}}));
   EXPECT_EQ(headers(card), kSearchHeaders);
@@ -176,11 +192,14 @@ TEST_F(Requests, AClientsItemsReplaceTheQuery) {
 TEST(DebugParameters, ReplaceWhatARequestWouldHaveSaid) {
   World world({.settings = "SBLUseBramble = false\nSBLDebugParameters = \"key=abc&b&c=2=3&locale=xx\"",
                .facts = kFacts});
+  world.waitForLog("location: wifi");
   EXPECT_EQ(world.sablectl({"card", world.serviceURL() + "/card?id=1"}).exitCode, 0);
   EXPECT_EQ(items(world.requests("/card", 1)[0]), (Pairs{{"cc", "GB"},
                                                          {"esl", "en-GB"},
+                                                         {"geosrc", "wifi"},
                                                          {"id", "1"},
                                                          {"key", "abc"},
+                                                         {"latlng", "51.500000,-0.100000"},
                                                          {"locale", "xx"},
                                                          {"storefront", "143444"}}));
 }

@@ -186,7 +186,8 @@ std::map<std::string, std::string> World::environment() const {
                                                      {"SABLED_CONFIG_DIR", root_ / "config"},
                                                      {"SABLED_PROFILE", root_ / "profile.toml"},
                                                      {"LC_ALL", "C.UTF-8"},
-                                                     {"DBUS_SESSION_BUS_ADDRESS", "disabled:"}});
+                                                     {"DBUS_SESSION_BUS_ADDRESS", "disabled:"},
+                                                     {"DBUS_SYSTEM_BUS_ADDRESS", "disabled:"}});
   return variables;
 }
 
