@@ -76,7 +76,7 @@ void SBLNetworkRequestFactory::didUpdateLocation(const LocationFix& fix) {
 
 void SBLNetworkRequestFactory::didFail(const std::string& reason) {
   contextAccessQueue_->async([this, reason] {
-    log().error("no location: {}", reason);
+    log().info("no location: {}", reason);
     _setNoLocationWithReason(kErrorFail);
   });
 }
