@@ -194,12 +194,10 @@ class SBLNetworkRequestFactory {
   void updateNewsVisibility(const SBLBag& bag);
   const LocaleConventions& conventions();
 
-  // Location. The host tells what it has on locationQueue_; all else is on the context queue.
+  // Location, on the context queue. The manager is called, and tells what it has, on locationQueue_.
   void _setupLocationServices();
   void didChangeAuthorization(platform::LocationAuthorization status);
   void didUpdateLocation(const platform::LocationFix& fix);
-  void didFail(const std::string& reason);
-  void _didChangeAuthorization(platform::LocationAuthorization status);
   void _startUpdatingLocation();
   void stopUpdatingLocation();
   static std::string_view _locationSourceForLocation(const platform::LocationFix& fix);

@@ -41,22 +41,27 @@ void SBLNetworkRequestFactory::_setupLocationServices() {
   // Stands until the manager has been started; for good when there is none.
   _setNoLocationWithReason(kErrorInit);
   platform::LocationEvents events;
-  events.authorizationChanged = [this](LocationAuthorization status) { didChangeAuthorization(status); };
-  events.fixArrived = [this](const LocationFix& fix) { didUpdateLocation(fix); };
-  events.failed = [this](const std::string& reason) { didFail(reason); };
+  events.authorizationChanged = [this](LocationAuthorization status) {
+    contextAccessQueue_->async([this, status] { didChangeAuthorization(status); });
+  };
+  events.fixArrived = [this](const LocationFix& fix) {
+    contextAccessQueue_->async([this, fix] { didUpdateLocation(fix); });
+  };
+  events.failed = [this](const std::string& reason) {
+    contextAccessQueue_->async([this, reason] {
+      log().info("no location: {}", reason);
+      _setNoLocationWithReason(kErrorFail);
+    });
+  };
   context_.locationManager =
       assembly_.platform.locationService().makeManager(locationQueue_, kDesiredAccuracy, std::move(events));
   if (context_.locationManager == nullptr) return log().error("there is no location manager");
   // Where nobody has been asked yet, the first request that wants a location asks.
   const LocationAuthorization status = context_.locationManager->authorizationStatus();
-  if (status != LocationAuthorization::notDetermined) _didChangeAuthorization(status);
+  if (status != LocationAuthorization::notDetermined) didChangeAuthorization(status);
 }
 
 void SBLNetworkRequestFactory::didChangeAuthorization(LocationAuthorization status) {
-  contextAccessQueue_->async([this, status] { _didChangeAuthorization(status); });
-}
-
-void SBLNetworkRequestFactory::_didChangeAuthorization(LocationAuthorization status) {
   contextAccessQueue_->assertIsCurrent();
   const bool enabled = assembly_.platform.locationService().locationServicesEnabled();
   log().info("location services are {}, authorization is {:d}", enabled ? "on" : "off",
@@ -67,18 +72,9 @@ void SBLNetworkRequestFactory::_didChangeAuthorization(LocationAuthorization sta
 }
 
 void SBLNetworkRequestFactory::didUpdateLocation(const LocationFix& fix) {
-  contextAccessQueue_->async([this, fix] {
-    _setLocationIfAllowedByBag(fix);
-    // One fix is enough: until a request finds it too old, the device need not look for another.
-    stopUpdatingLocation();
-  });
-}
-
-void SBLNetworkRequestFactory::didFail(const std::string& reason) {
-  contextAccessQueue_->async([this, reason] {
-    log().info("no location: {}", reason);
-    _setNoLocationWithReason(kErrorFail);
-  });
+  _setLocationIfAllowedByBag(fix);
+  // One fix is enough: until a request finds it too old, the device need not look for another.
+  stopUpdatingLocation();
 }
 
 void SBLNetworkRequestFactory::_startUpdatingLocation() {

@@ -297,7 +297,8 @@ TEST_F(Context, SubscriptionsAndTheMapsSessionAreInHeaders) {
   SBLNetworkRequestFactory& factory = *device.assembly().requestFactory;
   const auto header = [&](const char* name) {
     searched();
-    const std::string* found = device.service.requests("/search").back().request.headers.find(name);
+    const auto sent = device.service.requests("/search");
+    const std::string* found = sent.back().request.headers.find(name);
     return found == nullptr ? "-" : *found;
   };
   factory.setSubscriptionInfo("[ {\"a\": 1},\r\n \"b\" ]");

@@ -49,7 +49,8 @@ int readTime(sd_bus_message* message, WallTime& time) {
 
 }  // namespace
 
-std::shared_ptr<GeoClueSearch> GeoClueSearch::start(HostRuntime& runtime, std::shared_ptr<SerialQueue> queue,
+std::shared_ptr<GeoClueSearch> GeoClueSearch::start(HostRuntime& runtime,
+                                                    const std::shared_ptr<SerialQueue>& queue,
                                                     double desiredAccuracy, Events events) {
   auto search = std::make_shared<GeoClueSearch>(runtime, queue, desiredAccuracy, std::move(events));
   queue->async([weak = std::weak_ptr(search)] {

@@ -33,7 +33,7 @@ class GeoClueSearch : public std::enable_shared_from_this<GeoClueSearch> {
 
   /// A search that looks until it is destroyed, or has found nothing for a minute. Its events come
   /// after start() has returned.
-  static std::shared_ptr<GeoClueSearch> start(HostRuntime& runtime, std::shared_ptr<SerialQueue> queue,
+  static std::shared_ptr<GeoClueSearch> start(HostRuntime& runtime, const std::shared_ptr<SerialQueue>& queue,
                                               double desiredAccuracy, Events events);
 
   /// Use start().
