@@ -129,9 +129,13 @@ void ImageFetcher::start(const FetchPointer& fetch) {
   request.timeout = fetch->timeout;
   request.followsRedirects = false;
   request.maximumResponseBytes = kMaximumImageBytes;
-  fetch->task = assembly_.urlSession().dataTask(std::move(request), [this, fetch](HTTPResult result) {
-    queue_->async([this, fetch, result = std::move(result)] { finished(fetch, result); });
-  });
+  // Weakly, for the fetch holds its task.
+  const auto completed = [this, weak = std::weak_ptr(fetch)](HTTPResult result) {
+    queue_->async([this, weak, result = std::move(result)] {
+      if (const auto alive = weak.lock()) finished(alive, result);
+    });
+  };
+  fetch->task = assembly_.urlSession().dataTask(std::move(request), completed);
   if (assembly_.useBramble()) enableProxy(*fetch->task);
   fetch->task->resume();
 }
