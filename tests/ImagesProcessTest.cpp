@@ -17,6 +17,12 @@ namespace {
 using namespace std::chrono_literals;
 using testing::HasSubstr;
 
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr bool kSanitized = true;
+#else
+constexpr bool kSanitized = false;
+#endif
+
 /// The most memory the daemon ever had, in KiB.
 long peakMemory(pid_t pid) {
   std::ifstream status("/proc/" + std::to_string(pid) + "/status");
@@ -31,7 +37,10 @@ class ImagesFromTheService : public testing::Test {
  protected:
   using Loading = std::future<Expected<SBLClient::Images>>;
 
-  ImagesFromTheService() { EXPECT_TRUE(application_.search("dog").reply); }
+  explicit ImagesFromTheService(std::vector<std::string> serviceArguments = {})
+      : world_({.serviceArguments = std::move(serviceArguments), .settings = "SBLUseBramble = false"}) {
+    EXPECT_TRUE(application_.search("dog").reply);
+  }
 
   std::string url(const std::string& name) const { return world_.serviceURL() + "/images/" + name; }
   std::string unvouched(const std::string& name) const {
@@ -58,16 +67,21 @@ class ImagesFromTheService : public testing::Test {
 
   static constexpr platform::Duration kLong = 60s;
 
-  const TemporaryFolder folder_;
-  World world_{{.serviceArguments = {"--fault", "/images/slow.png:slow=20", "--bag", impatientBag()},
-                .settings = "SBLUseBramble = false"}};
+  World world_;
   platform::host::HostRuntime runtime_;
   TestClient application_{runtime_, world_.address()};
+};
+
+/// With a service that wants nobody to wait longer than 3 s, and sends one image slower than that.
+class SlowImages : public ImagesFromTheService {
+ protected:
+  SlowImages() : ImagesFromTheService({"--fault", "/images/slow.png:slow=20", "--bag", impatientBag()}) {}
 
  private:
-  std::string impatientBag() const {
-    writeFile(folder_ / "bag.json", R"({"request_timeout": 3})");
-    return folder_ / "bag.json";
+  static std::string impatientBag() {
+    static const TemporaryFolder folder;
+    writeFile(folder / "bag.json", R"({"request_timeout": 3})");
+    return folder / "bag.json";
   }
 };
 
@@ -87,7 +101,10 @@ TEST_F(ImagesFromTheService, WhatMayNotOrDoesNotComeIsLeftOutAndTheRestIsDeliver
   ASSERT_EQ(images.size(), 2u);
   for (const auto& [name, image] : images) EXPECT_THAT(*image, testing::StartsWith("\x89PNG")) << name;
   EXPECT_NE(*images.at(all[0]), *images.at(all[1]));
-  EXPECT_LT(peakMemory(world_.daemon().pid()) - before, 30 << 10) << "50 MiB are not gathered to be refused";
+  if (!kSanitized) {
+    EXPECT_LT(peakMemory(world_.daemon().pid()) - before, 30 << 10)
+        << "50 MiB are not gathered to be refused";
+  }
 
   const std::string log = world_.daemonErrors();
   for (const std::string& line :
@@ -103,7 +120,7 @@ TEST_F(ImagesFromTheService, WhatMayNotOrDoesNotComeIsLeftOutAndTheRestIsDeliver
   }
 }
 
-TEST_F(ImagesFromTheService, ASlowOneIsLeftOutAtTheDeadlineAndEndsWithTheTimeoutOfARequest) {
+TEST_F(SlowImages, OneIsLeftOutAtTheDeadlineAndEndsWithTheTimeoutOfARequest) {
   load({url("quick.png")}, kLong);
   const auto images = load({url("slow.png"), url("quick.png")}, 200ms);
   EXPECT_EQ(images.size(), 1u);
@@ -116,14 +133,14 @@ TEST_F(ImagesFromTheService, ASlowOneIsLeftOutAtTheDeadlineAndEndsWithTheTimeout
   EXPECT_THAT(world_.daemonErrors(), HasSubstr("HTTPErrorDomain 4: no image in time"));
 }
 
-TEST_F(ImagesFromTheService, ThoseWhoWaitKeepNobodyFromHisAnswer) {
+TEST_F(SlowImages, ThoseWhoWaitKeepNobodyFromHisAnswer) {
   std::vector<Loading> waiting;
   for (int i = 0; i < 10; ++i) {
     waiting.push_back(
         begin({url("slow.png"), url(std::to_string(i) + ".png")}, platform::MonotonicTime::max()));
   }
   world_.requests("/images/slow.png", 1);
-  for (int i = 0; i < 5; ++i) EXPECT_TRUE(application_.search("dog").reply);
+  EXPECT_TRUE(application_.search("dog").reply);
   for (Loading& each : waiting) {
     EXPECT_EQ(each.wait_for(0s), std::future_status::timeout);
   }
@@ -140,7 +157,9 @@ TEST_F(ImagesFromTheService, TwoHundredComeAtOnce) {
   for (int i = 0; i < 200; ++i) all.push_back(url("number-" + std::to_string(i) + ".png"));
   const long before = peakMemory(world_.daemon().pid());
   EXPECT_EQ(load(all, kLong).size(), all.size());
-  EXPECT_LT(peakMemory(world_.daemon().pid()) - before, 64 << 10);
+  if (!kSanitized) {
+    EXPECT_LT(peakMemory(world_.daemon().pid()) - before, 64 << 10);
+  }
   EXPECT_EQ(load(all, 0s).size(), all.size()) << "from memory";
 }
 
