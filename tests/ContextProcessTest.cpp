@@ -18,7 +18,7 @@ class ChangingWorld {
   explicit ChangingWorld(const json& bag, std::string facts,
                          std::map<std::string, std::string> environment = {})
       : world_({.serviceArguments = {"--bag", bagFile(bag)},
-                .settings = "SBLUseBramble = false",
+                .settings = "SBLUseBramble = false\nSBLNoQueryCache = true",
                 .facts = std::move(facts),
                 .environment = std::move(environment)}) {}
 

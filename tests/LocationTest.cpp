@@ -75,7 +75,10 @@ TEST(CoarseLocation, NoCellIsNarrowerThanHighNorMuchWiderThanTwiceThat) {
 
 class Location : public testing::Test {
  protected:
-  Location() { device.bag["geo_location_sources"] = {"gps", "wifi"}; }
+  Location() {
+    device.bag["geo_location_sources"] = {"gps", "wifi"};
+    device.platform.userDefaults().setByUser("SBLNoQueryCache", true);  // every search is to be sent
+  }
 
   /// What an item of the newest request to a path says; "-" when it is not there.
   std::string item(std::string_view name, std::string_view path = "/search") {
