@@ -11,7 +11,8 @@ Error makeSBLError(SBLErrorCode code, std::string reason) {
 }
 
 Dictionary encodeErrorForJSON(const Error& error) {
-  return {{"code", error.code}, {"domain", error.domain}, {"reason", error.reason}};
+  const auto orNull = [](const std::string& text) { return text.empty() ? Dictionary() : Dictionary(text); };
+  return {{"code", error.code}, {"domain", orNull(error.domain)}, {"reason", orNull(error.reason)}};
 }
 
 }  // namespace sable

@@ -16,7 +16,7 @@ enum class SBLErrorCode : std::int64_t {
 
 Error makeSBLError(SBLErrorCode code, std::string reason);
 
-/// {"code", "domain", "reason"}, the form in which errors are uploaded.
+/// {"code", "domain", "reason"}, the form in which errors are uploaded; an empty text is null.
 Dictionary encodeErrorForJSON(const Error& error);
 
 }  // namespace sable

@@ -1,0 +1,222 @@
+#include "sabled/FeedbackMessage.h"
+
+#include <fmt/core.h>
+
+#include <algorithm>
+
+#include "SableKit/SBLError.h"
+#include "SableKit/messages/SKSession.pb.h"
+#include "sabled/FeedbackKinds.h"
+#include "sabled/FeedbackProcessing.h"
+#include "sabled/SableLogging.h"
+
+namespace sable {
+
+namespace feedback {
+
+void Untranslated::write(const messages::_SKFeedback&, Dictionary&) {
+  SableLogForCategory(SableLoggingCategoryFeedbackErrors)
+      .error("Feedback dictionary translation for {} fell back to default implementation.", "_SKFeedback");
+}
+
+void ResultGrading::writeGrade(std::uint32_t grade, Dictionary& d) {
+  if (grade < std::size(kResultGrades)) {
+    d["grade"] = kResultGrades[grade];
+  } else {
+    SableLogForCategory(SableLoggingCategoryFeedbackErrors)
+        .error("No JSON string defined for result grade {}", grade);
+  }
+}
+
+}  // namespace feedback
+
+namespace {
+
+using feedback::Identifiers;
+
+/// A message of a class and the kind that the class is of.
+template <class Kind, class M>
+class Feedback final : public FeedbackMessage {
+ public:
+  Feedback(std::string_view className, M message) : className_(className), message_(std::move(message)) {}
+
+  std::string_view className() const override { return className_; }
+
+  Dictionary dictionary() const override {
+    Dictionary dictionary = Dictionary::object();
+    Kind::write(message_, dictionary);
+    return dictionary;
+  }
+
+  unsigned type() const override { return Kind::type(message_); }
+  bool requiresQueryId() const override { return Kind::requiresQueryId(message_); }
+
+  void process(SessionProcessingHelper& helper) override {
+    if constexpr (Kind::identifiers != Identifiers::kept) {
+      feedback::processMembers(message_, Kind::identifiers == Identifiers::expanded, helper);
+    }
+  }
+
+  std::uint64_t timestamp() const override { return message_.timestamp(); }
+
+  std::uint64_t clientQueryId() const override {
+    if constexpr (requires { message_.query_id(); }) {
+      return message_.query_id();
+    } else if constexpr (requires { message_.blending_duration(); }) {
+      // A ranking belongs to the query of what it ranked.
+      const bool ranked = message_.sections_size() > 0 && message_.sections(0).results_size() > 0;
+      return ranked ? message_.sections(0).results(0).result().query_id() : 0;
+    }
+    return 0;
+  }
+
+  std::optional<ResultEngagement> resultEngagement() const override {
+    if constexpr (std::is_same_v<Kind, feedback::ResultEngaged>) {
+      const auto& result = message_.result();
+      return ResultEngagement{result.top_hit() != 0, result.type(), message_.completed_query()};
+    }
+    return std::nullopt;
+  }
+
+  std::optional<SearchViewAppearance> searchViewAppearance() const override {
+    if constexpr (std::is_same_v<Kind, feedback::SearchViewAppear>) {
+      return SearchViewAppearance{message_.on_lock_screen(), message_.view_appear_event()};
+    }
+    return std::nullopt;
+  }
+
+  std::optional<std::uint32_t> customFeedbackType() const override {
+    if constexpr (std::is_same_v<Kind, feedback::Custom>) return message_.feedback_type();
+    return std::nullopt;
+  }
+
+  std::string data() const override { return message_.SerializeAsString(); }
+
+ private:
+  std::string_view className_;
+  M message_;
+};
+
+tl::unexpected<Error> refusal(std::string reason) {
+  return tl::unexpected(makeSBLError(SBLErrorCode::daemonSide, std::move(reason)));
+}
+
+struct FeedbackClass {
+  std::string_view name;
+  Expected<std::unique_ptr<FeedbackMessage>> (*parse)(std::string_view name, std::string_view bytes);
+};
+
+template <class Kind, class M>
+Expected<std::unique_ptr<FeedbackMessage>> parseAs(std::string_view name, std::string_view bytes) {
+  M message;
+  if (!message.ParseFromArray(bytes.data(), static_cast<int>(bytes.size()))) {
+    return refusal(fmt::format("the bytes are no {}", name));
+  }
+  if constexpr (std::is_same_v<Kind, feedback::Custom>) {
+    const auto json = parseJSON(message.json_feedback(), kMaximumFeedbackBytes);
+    if (!json) return refusal(fmt::format("JSON of {}: {}", name, json.error().reason));
+    if (!json->is_object()) return refusal(fmt::format("JSON of {} is no object", name));
+  }
+  return std::make_unique<Feedback<Kind, M>>(name, std::move(message));
+}
+
+#define FEEDBACK_CLASS(kind, name) \
+  { #name, parseAs < feedback::kind, messages::name> }
+
+constexpr FeedbackClass kClasses[] = {
+    FEEDBACK_CLASS(VisibleResults, RKVisibleResultsFeedback),
+    FEEDBACK_CLASS(VisibleResults, _SKVisibleResultsFeedback),
+    FEEDBACK_CLASS(StartNetworkSearch, RKStartNetworkSearchFeedback),
+    FEEDBACK_CLASS(StartNetworkSearch, _SKStartNetworkSearchFeedback),
+    FEEDBACK_CLASS(LookupStartNetworkSearch, SBLLookupStartNetworkSearchFeedback),
+    FEEDBACK_CLASS(LookupStartNetworkSearch, _SKLookupStartNetworkSearchFeedback),
+    FEEDBACK_CLASS(EndNetworkSearch, RKEndNetworkSearchFeedback),
+    FEEDBACK_CLASS(EndNetworkSearch, _SKEndNetworkSearchFeedback),
+    FEEDBACK_CLASS(EndSableNetworkSearch, _SKSKEndNetworkSearchFeedback),
+    FEEDBACK_CLASS(StartLocalSearch, RKStartLocalSearchFeedback),
+    FEEDBACK_CLASS(StartLocalSearch, _SKStartLocalSearchFeedback),
+    FEEDBACK_CLASS(EndLocalSearch, RKEndLocalSearchFeedback),
+    FEEDBACK_CLASS(EndLocalSearch, _SKEndLocalSearchFeedback),
+    FEEDBACK_CLASS(SearchViewAppear, RKSearchViewAppearFeedback),
+    FEEDBACK_CLASS(SearchViewAppear, _SKSearchViewAppearFeedback),
+    FEEDBACK_CLASS(SearchViewDisappear, _SKSearchViewDisappearFeedback),
+    FEEDBACK_CLASS(Ranking, RKRankingFeedback),
+    FEEDBACK_CLASS(Ranking, _SKRankingFeedback),
+    FEEDBACK_CLASS(Ranker, SBLRankerFeedback),
+    FEEDBACK_CLASS(Ranker, _SKSBLRankerFeedback),
+    FEEDBACK_CLASS(ResultEngaged, RKResultEngagementFeedback),
+    FEEDBACK_CLASS(ResultEngaged, _SKResultEngagementFeedback),
+    FEEDBACK_CLASS(CardSectionEngagement, RKCardSectionEngagementFeedback),
+    FEEDBACK_CLASS(CardSectionEngagement, _SKCardSectionEngagementFeedback),
+    FEEDBACK_CLASS(MapsCardSectionEngagement, RKMapsCardSectionEngagementFeedback),
+    FEEDBACK_CLASS(MapsCardSectionEngagement, _SKMapsCardSectionEngagementFeedback),
+    FEEDBACK_CLASS(StoreCardSectionEngagement, RKStoreCardSectionEngagementFeedback),
+    FEEDBACK_CLASS(StoreCardSectionEngagement, _SKStoreCardSectionEngagementFeedback),
+    FEEDBACK_CLASS(ErrorFeedback, RKErrorFeedback),
+    FEEDBACK_CLASS(SuggestionEngagement, RKSuggestionEngagementFeedback),
+    FEEDBACK_CLASS(CardViewDisappear, RKCardViewDisappearFeedback),
+    FEEDBACK_CLASS(StartSearch, RKStartSearchFeedback),
+    FEEDBACK_CLASS(StartSearch, _SKStartSearchFeedback),
+    FEEDBACK_CLASS(EndSearch, RKEndSearchFeedback),
+    FEEDBACK_CLASS(EndSearch, _SKEndSearchFeedback),
+    FEEDBACK_CLASS(VisibleSuggestions, RKVisibleSuggestionsFeedback),
+    FEEDBACK_CLASS(Custom, RKCustomFeedback),
+    FEEDBACK_CLASS(ResultsReceivedAfterTimeout, RKResultsReceivedAfterTimeoutFeedback),
+    FEEDBACK_CLASS(ResultsReceivedAfterTimeout, _SKResultsReceivedAfterTimeoutFeedback),
+    FEEDBACK_CLASS(LateSectionsAppended, RKLateSectionsAppendedFeedback),
+    FEEDBACK_CLASS(LateSectionsAppended, _SKLateSectionsAppendedFeedback),
+    FEEDBACK_CLASS(ClearInput, RKClearInputFeedback),
+    FEEDBACK_CLASS(SessionEnd, SableSessionEndFeedback),
+    FEEDBACK_CLASS(SessionEnd, _SKSessionEndFeedback),
+    FEEDBACK_CLASS(SkipSearch, SBLSkipSearchFeedback),
+    FEEDBACK_CLASS(SkipSearch, _SKSkipSearchFeedback),
+    FEEDBACK_CLASS(CacheHit, SBLCacheHitFeedback),
+    FEEDBACK_CLASS(CacheHit, _SKCacheHitFeedback),
+    FEEDBACK_CLASS(SectionEngagement, RKSectionEngagementFeedback),
+    FEEDBACK_CLASS(SectionEngagement, _SKSectionEngagementFeedback),
+    FEEDBACK_CLASS(VisibleSectionHeader, RKVisibleSectionHeaderFeedback),
+    FEEDBACK_CLASS(VisibleSectionHeader, _SKVisibleSectionHeaderFeedback),
+    FEEDBACK_CLASS(SessionMissingResults, SableSessionMissingResults),
+    FEEDBACK_CLASS(SessionMissingResults, _SKSessionMissingResultsFeedback),
+    FEEDBACK_CLASS(SessionMissingSuggestions, SableSessionMissingSuggestions),
+    FEEDBACK_CLASS(DidGoToSite, RKDidGoToSiteFeedback),
+    FEEDBACK_CLASS(ConnectionInvalidated, SableConnectionInvalidated),
+    FEEDBACK_CLASS(ConnectionInvalidated, _SKConnectionInvalidatedFeedback),
+    FEEDBACK_CLASS(ResultGrading, _SKResultGradingFeedback),
+    FEEDBACK_CLASS(DidGoToSearch, RKDidGoToSearchFeedback),
+    FEEDBACK_CLASS(Untranslated, RKFeedback),
+    FEEDBACK_CLASS(Untranslated, _SKFeedback),
+};
+
+#undef FEEDBACK_CLASS
+
+}  // namespace
+
+Expected<std::unique_ptr<FeedbackMessage>> FeedbackMessage::parse(std::string_view className,
+                                                                  std::string_view bytes) {
+  if (bytes.size() > kMaximumFeedbackBytes) {
+    return refusal(
+        fmt::format("{} bytes of feedback, more than the {} allowed", bytes.size(), kMaximumFeedbackBytes));
+  }
+  const auto* found = std::find_if(std::begin(kClasses), std::end(kClasses),
+                                   [&](const FeedbackClass& each) { return each.name == className; });
+  if (found == std::end(kClasses)) return refusal("unknown feedback class");
+  return found->parse(found->name, bytes);
+}
+
+Expected<std::unique_ptr<FeedbackMessage>> FeedbackMessage::parsePayload(std::string_view bytes) {
+  messages::_SKFeedbackPayload payload;
+  if (bytes.size() > 2 * kMaximumFeedbackBytes ||
+      !payload.ParseFromArray(bytes.data(), static_cast<int>(bytes.size()))) {
+    return refusal("the bytes are no _SKFeedbackPayload");
+  }
+  return parse(payload.class_name(), payload.feedback());
+}
+
+std::vector<std::string_view> FeedbackMessage::classNames() {
+  std::vector<std::string_view> names;
+  for (const FeedbackClass& each : kClasses) names.push_back(each.name);
+  return names;
+}
+
+}  // namespace sable
