@@ -101,6 +101,12 @@ tl::unexpected<Error> refusal(std::string reason) {
   return tl::unexpected(makeSBLError(SBLErrorCode::daemonSide, std::move(reason)));
 }
 
+std::optional<Error> tooLong(std::string_view bytes) {
+  if (bytes.size() <= kMaximumFeedbackBytes) return std::nullopt;
+  return makeSBLError(SBLErrorCode::daemonSide, fmt::format("{} bytes of feedback, more than the {} allowed",
+                                                            bytes.size(), kMaximumFeedbackBytes));
+}
+
 struct FeedbackClass {
   std::string_view name;
   Expected<std::unique_ptr<FeedbackMessage>> (*parse)(std::string_view name, std::string_view bytes);
@@ -113,7 +119,7 @@ Expected<std::unique_ptr<FeedbackMessage>> parseAs(std::string_view name, std::s
     return refusal(fmt::format("the bytes are no {}", name));
   }
   if constexpr (std::is_same_v<Kind, feedback::Custom>) {
-    const auto json = parseJSON(message.json_feedback(), kMaximumFeedbackBytes);
+    const auto json = parseJSON(message.json_feedback(), message.json_feedback().size());
     if (!json) return refusal(fmt::format("JSON of {}: {}", name, json.error().reason));
     if (!json->is_object()) return refusal(fmt::format("JSON of {} is no object", name));
   }
@@ -194,20 +200,22 @@ constexpr FeedbackClass kClasses[] = {
 
 Expected<std::unique_ptr<FeedbackMessage>> FeedbackMessage::parse(std::string_view className,
                                                                   std::string_view bytes) {
-  if (bytes.size() > kMaximumFeedbackBytes) {
-    return refusal(
-        fmt::format("{} bytes of feedback, more than the {} allowed", bytes.size(), kMaximumFeedbackBytes));
-  }
   const auto* found = std::find_if(std::begin(kClasses), std::end(kClasses),
                                    [&](const FeedbackClass& each) { return each.name == className; });
   if (found == std::end(kClasses)) return refusal("unknown feedback class");
   return found->parse(found->name, bytes);
 }
 
-Expected<std::unique_ptr<FeedbackMessage>> FeedbackMessage::parsePayload(std::string_view bytes) {
+Expected<std::unique_ptr<FeedbackMessage>> FeedbackMessage::parseReported(std::string_view className,
+                                                                          std::string_view bytes) {
+  if (auto fault = tooLong(bytes)) return tl::unexpected(std::move(*fault));
+  return parse(className, bytes);
+}
+
+Expected<std::unique_ptr<FeedbackMessage>> FeedbackMessage::parseReportedPayload(std::string_view bytes) {
+  if (auto fault = tooLong(bytes)) return tl::unexpected(std::move(*fault));
   messages::_SKFeedbackPayload payload;
-  if (bytes.size() > 2 * kMaximumFeedbackBytes ||
-      !payload.ParseFromArray(bytes.data(), static_cast<int>(bytes.size()))) {
+  if (!payload.ParseFromArray(bytes.data(), static_cast<int>(bytes.size()))) {
     return refusal("the bytes are no _SKFeedbackPayload");
   }
   return parse(payload.class_name(), payload.feedback());

@@ -13,7 +13,7 @@ namespace sable {
 
 class SessionProcessingHelper;
 
-/// A longer message is refused: it would be kept, and translated as a whole.
+/// A client's longer message is refused: it would be kept, and translated as a whole.
 inline constexpr std::size_t kMaximumFeedbackBytes = 256u << 10;
 
 /// What the engagement with a result tells beside its record.
@@ -34,13 +34,15 @@ class FeedbackMessage {
  public:
   virtual ~FeedbackMessage() = default;
 
-  /// Reads a serialised message, as ReportEvent and session files carry it. The error (of
-  /// kSBLErrorDomain) says what is wrong: the class is none of classNames(), or the bytes are too
-  /// many or no message of it.
+  /// Reads a serialised message. The error (of kSBLErrorDomain) says what is wrong: the class is none
+  /// of classNames(), or the bytes are no message of it.
   static Expected<std::unique_ptr<FeedbackMessage>> parse(std::string_view className, std::string_view bytes);
 
-  /// Reads a `_SKFeedbackPayload`, as ReportEventData carries it; fails as parse() does.
-  static Expected<std::unique_ptr<FeedbackMessage>> parsePayload(std::string_view bytes);
+  /// The same for what a client reports through ReportEvent: also fails past kMaximumFeedbackBytes.
+  static Expected<std::unique_ptr<FeedbackMessage>> parseReported(std::string_view className,
+                                                                  std::string_view bytes);
+  /// The same for the `_SKFeedbackPayload` of ReportEventData, and its limit.
+  static Expected<std::unique_ptr<FeedbackMessage>> parseReportedPayload(std::string_view bytes);
 
   /// The classes that a feedback may have, in the order of their kinds.
   static std::vector<std::string_view> classNames();
