@@ -8,6 +8,7 @@
 #include "SableKit/messages/SKSession.pb.h"
 #include "sabled/FeedbackKinds.h"
 #include "sabled/FeedbackProcessing.h"
+#include "sabled/ParsedMessage.h"
 #include "sabled/SableLogging.h"
 
 namespace sable {
@@ -115,7 +116,7 @@ struct FeedbackClass {
 template <class Kind, class M>
 Expected<std::unique_ptr<FeedbackMessage>> parseAs(std::string_view name, std::string_view bytes) {
   M message;
-  if (!message.ParseFromArray(bytes.data(), static_cast<int>(bytes.size()))) {
+  if (!parseMessage(message, bytes)) {
     return refusal(fmt::format("the bytes are no {}", name));
   }
   if constexpr (std::is_same_v<Kind, feedback::Custom>) {
@@ -215,7 +216,7 @@ Expected<std::unique_ptr<FeedbackMessage>> FeedbackMessage::parseReported(std::s
 Expected<std::unique_ptr<FeedbackMessage>> FeedbackMessage::parseReportedPayload(std::string_view bytes) {
   if (auto fault = tooLong(bytes)) return tl::unexpected(std::move(*fault));
   messages::_SKFeedbackPayload payload;
-  if (!payload.ParseFromArray(bytes.data(), static_cast<int>(bytes.size()))) {
+  if (!parseMessage(payload, bytes)) {
     return refusal("the bytes are no _SKFeedbackPayload");
   }
   return parse(payload.class_name(), payload.feedback());

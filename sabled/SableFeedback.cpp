@@ -5,6 +5,7 @@
 #include "SableKit/SBLError.h"
 #include "SableKit/messages/SKSession.pb.h"
 #include "sabled/FeedbackTables.h"
+#include "sabled/ParsedMessage.h"
 
 namespace sable {
 
@@ -24,7 +25,7 @@ SableFeedback::SableFeedback(std::unique_ptr<FeedbackMessage> feedback, std::int
 
 Expected<SableFeedback> SableFeedback::parse(std::string_view bytes) {
   messages::_SKSableFeedback record;
-  if (!record.ParseFromArray(bytes.data(), static_cast<int>(bytes.size()))) {
+  if (!parseMessage(record, bytes)) {
     return tl::unexpected(makeSBLError(SBLErrorCode::daemonSide, "sable feedback expected"));
   }
   auto message = FeedbackMessage::parse(record.payload().class_name(), record.payload().feedback());
