@@ -5,6 +5,7 @@ add_test(NAME layering
 # One source per header that includes nothing else, and that twice: Ninja then knows which headers are due again.
 file(GLOB headers CONFIGURE_DEPENDS RELATIVE ${PROJECT_SOURCE_DIR}
   ${PROJECT_SOURCE_DIR}/platform/*.h ${PROJECT_SOURCE_DIR}/platform/*/*.h ${PROJECT_SOURCE_DIR}/SableKit/*.h
+  ${PROJECT_SOURCE_DIR}/SableKit/*/*.h
   ${PROJECT_SOURCE_DIR}/sabled/*.h ${PROJECT_SOURCE_DIR}/tests/support/*.h ${PROJECT_SOURCE_DIR}/tools/*/*.h)
 set(header_sources "")
 foreach(header ${headers})
@@ -15,6 +16,6 @@ endforeach()
 if(header_sources)
   add_library(headers OBJECT EXCLUDE_FROM_ALL ${header_sources})
   target_include_directories(headers PRIVATE ${PROJECT_SOURCE_DIR}/tools/sable-service)
-  target_link_libraries(headers PRIVATE test_support CURL::libcurl SQLite::SQLite3 OpenSSL::Crypto CLI11::CLI11
+  target_link_libraries(headers PRIVATE test_support feedback_messages CURL::libcurl SQLite::SQLite3 OpenSSL::Crypto CLI11::CLI11
     PkgConfig::SYSTEMD PkgConfig::ICU PkgConfig::TOMLPLUSPLUS PkgConfig::SIMDJSON)
 endif()
