@@ -114,7 +114,8 @@ class TOMLUserDefaults::Store : public std::enable_shared_from_this<Store> {
     // The files are replaced only here, so that they can be read without making readers wait.
     const std::lock_guard turn(reloading_);
     TOMLFile profile = profile_, user = user_;
-    const bool changed = profile.reload() | user.reload();
+    const bool profileChanged = profile.reload();
+    const bool changed = user.reload() || profileChanged;
     const std::unique_lock lock(mutex_);
     profile_ = std::move(profile);
     user_ = std::move(user);
