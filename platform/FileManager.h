@@ -1,13 +1,45 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 #include <filesystem>
+#include <memory>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/Error.h"
+#include "platform/Runtime.h"
 
 namespace sable::platform {
+
+/// A regular file open for adding to its end; closed with the object. One thread at a time.
+class AppendableFile {
+ public:
+  virtual ~AppendableFile() = default;
+  /// Bytes in the file.
+  virtual Expected<std::uint64_t> size() = 0;
+  /// Adds both texts in one go, so that a process killed meanwhile leaves at most these torn. They
+  /// reach the disk in the system's own time. After a failure some of them may be there.
+  virtual Expected<void> append(std::string_view head, std::string_view body) = 0;
+};
+
+/// A regular file open for reading; closed with the object. One thread at a time.
+class ReadableFile {
+ public:
+  virtual ~ReadableFile() = default;
+  /// All bytes of the file, fetched when they are looked at and valid as long as this object:
+  /// nobody can take them away meanwhile by cutting the file. EFBIG when it is longer than
+  /// `maximumBytes`. Once.
+  virtual Expected<std::string_view> map(std::size_t maximumBytes) = 0;
+};
+
+struct FileAttributes {
+  std::uint64_t size = 0;  ///< bytes
+  /// When the file came to be; for a copy that kept its time of change, that time, and so too
+  /// where the file system does not know better.
+  WallTime creationDate;
+};
 
 /// Files of the daemon. Errors are of kPOSIXErrorDomain. May block on the disk. Any thread.
 class FileManager {
@@ -29,6 +61,18 @@ class FileManager {
   virtual Expected<void> writeAtomically(const std::filesystem::path& path, std::string_view bytes) = 0;
 
   virtual Expected<void> remove(const std::filesystem::path& path) = 0;
+
+  /// Makes an empty file, 0600; EEXIST where the name is taken, be it by a link or a folder.
+  virtual Expected<void> createFile(const std::filesystem::path& path) = 0;
+
+  // A symbolic link is refused by these three with ELOOP, a folder with EISDIR, and what is no
+  // regular file either with another error; none waits on a FIFO.
+  virtual Expected<std::unique_ptr<AppendableFile>> openForAppending(const std::filesystem::path& path) = 0;
+  virtual Expected<std::unique_ptr<ReadableFile>> openForReading(const std::filesystem::path& path) = 0;
+  virtual Expected<FileAttributes> attributes(const std::filesystem::path& path) = 0;
+
+  /// The names in a folder, of whatever they are, sorted.
+  virtual Expected<std::vector<std::string>> list(const std::filesystem::path& path) = 0;
 };
 
 }  // namespace sable::platform

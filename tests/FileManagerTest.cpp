@@ -1,10 +1,12 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <atomic>
 #include <cerrno>
+#include <csignal>
 #include <memory>
 #include <vector>
 
@@ -12,6 +14,7 @@
 #include "platform/host/HostFileManager.h"
 #include "platform/host/HostRuntime.h"
 #include "platform/simulated/SimulatedFileManager.h"
+#include "platform/simulated/SimulatedRuntime.h"
 #include "tests/support/TemporaryFolder.h"
 
 namespace sable::platform {
@@ -29,11 +32,12 @@ mode_t modeOf(const std::filesystem::path& path) {
 /// What every file manager promises.
 struct FileManagerContract : testing::TestWithParam<bool> {
   TemporaryFolder folder;
+  simulated::SimulatedRuntime clock;
   std::unique_ptr<FileManager> files = makeFiles();
 
   std::unique_ptr<FileManager> makeFiles() {
     if (GetParam()) return std::make_unique<host::HostFileManager>(folder.folders());
-    return std::make_unique<simulated::SimulatedFileManager>();
+    return std::make_unique<simulated::SimulatedFileManager>(clock);
   }
 };
 
@@ -55,6 +59,44 @@ TEST_P(FileManagerContract, WhatIsWrittenIsReadUntilItIsRemoved) {
   EXPECT_EQ(errorOf(files->read(file, 10)), ENOENT);
   EXPECT_EQ(errorOf(files->read(file.parent_path(), 10)), EISDIR);
   EXPECT_EQ(errorOf(files->writeAtomically(file.parent_path(), "x")), EISDIR);
+}
+
+TEST_P(FileManagerContract, AFileGrowsAtItsEndAndIsMappedWhole) {
+  const auto parent = *files->cachesDirectory();
+  const auto file = parent / "session.0";
+  EXPECT_EQ(errorOf(files->openForAppending(file)), ENOENT);
+  EXPECT_EQ(errorOf(files->openForReading(file)), ENOENT);
+  EXPECT_EQ(errorOf(files->attributes(file)), ENOENT);
+  EXPECT_EQ(errorOf(files->createFile(parent / "missing" / "file")), ENOENT);
+  ASSERT_TRUE(files->createFile(file));
+  EXPECT_EQ(errorOf(files->createFile(file)), EEXIST);
+  EXPECT_EQ((*files->openForReading(file))->map(0), "");
+
+  const auto first = *files->openForAppending(file);
+  ASSERT_TRUE(first->append("head", std::string(100'000, 'x')));
+  const auto second = *files->openForAppending(file);
+  ASSERT_TRUE(second->append("", "tail"));
+  ASSERT_TRUE(first->append("", ""));
+  EXPECT_EQ(first->size(), 100'008u);
+  EXPECT_EQ(files->attributes(file)->size, 100'008u);
+  const auto readable = *files->openForReading(file);
+  EXPECT_EQ(errorOf((*files->openForReading(file))->map(100'007)), EFBIG);
+  EXPECT_EQ(readable->map(100'008), "head" + std::string(100'000, 'x') + "tail");
+}
+
+TEST_P(FileManagerContract, AFolderIsListedInOrderAndIsNoFile) {
+  const auto parent = *files->cachesDirectory();
+  EXPECT_EQ(files->list(parent), std::vector<std::string>{});
+  ASSERT_TRUE(files->createDirectory(parent / "b" / "below"));
+  for (const char* name : {"c", "a"}) ASSERT_TRUE(files->createFile(parent / name));
+  EXPECT_EQ(files->list(parent), (std::vector<std::string>{"a", "b", "c"}));
+  EXPECT_EQ(errorOf(files->list(parent / "missing")), ENOENT);
+  EXPECT_EQ(errorOf(files->list(parent / "a")), ENOTDIR);
+
+  EXPECT_EQ(errorOf(files->createFile(parent / "b")), EEXIST);
+  EXPECT_EQ(errorOf(files->openForAppending(parent / "b")), EISDIR);
+  EXPECT_EQ(errorOf(files->openForReading(parent / "b")), EISDIR);
+  EXPECT_EQ(errorOf(files->attributes(parent / "b")), EISDIR);
 }
 
 INSTANTIATE_TEST_SUITE_P(Both, FileManagerContract, testing::Bool(),
@@ -87,6 +129,67 @@ TEST_F(HostFileManagerTest, ReadsRegularFilesOnlyAndNeverWaits) {
   EXPECT_EQ(errorOf(files.read(folder / "link", 100)), ELOOP);
   EXPECT_EQ(errorOf(files.read(folder / "fifo", 100)), EINVAL);
   EXPECT_EQ(errorOf(files.read("/dev/null", 100)), EINVAL);
+}
+
+TEST_F(HostFileManagerTest, WhatIsNoRegularFileIsNeitherMadeNorAppendedTo) {
+  const mode_t before = umask(0);
+  ASSERT_TRUE(files.createFile(folder / "file"));
+  umask(before);
+  EXPECT_EQ(modeOf(folder / "file"), 0600u);
+  ASSERT_EQ(symlink("absent", (folder / "dangling").c_str()), 0);
+  ASSERT_EQ(symlink("file", (folder / "link").c_str()), 0);
+  ASSERT_EQ(mkfifo((folder / "fifo").c_str(), 0600), 0);
+  for (const char* name : {"dangling", "link", "fifo"}) {
+    EXPECT_EQ(errorOf(files.createFile(folder / name)), EEXIST) << name;
+    EXPECT_FALSE(files.openForAppending(folder / name)) << name;
+    EXPECT_FALSE(files.openForReading(folder / name)) << name;
+    EXPECT_FALSE(files.attributes(folder / name)) << name;
+  }
+  EXPECT_FALSE(std::filesystem::exists(folder / "absent"));
+  EXPECT_EQ(errorOf(files.openForAppending(folder / "link")), ELOOP);
+  EXPECT_EQ(errorOf(files.attributes(folder / "fifo")), EINVAL);
+}
+
+TEST_F(HostFileManagerTest, AMappedFileCannotBeCutUnderItsReader) {
+  writeFile(folder / "file", std::string(10'000, 'x'));
+  const auto path = folder / "file";
+  {
+    const auto readable = *files.openForReading(path);
+    const auto bytes = readable->map(10'000);
+    ASSERT_TRUE(bytes);
+    EXPECT_EQ(open(path.c_str(), O_WRONLY | O_TRUNC | O_NONBLOCK | O_CLOEXEC), -1);
+    EXPECT_EQ(errno, EWOULDBLOCK);
+    EXPECT_EQ(*bytes, std::string(10'000, 'x'));
+  }
+  const host::Descriptor writer(open(path.c_str(), O_WRONLY | O_NONBLOCK | O_CLOEXEC));
+  ASSERT_TRUE(writer) << "the file is free again";
+  const auto readable = *files.openForReading(path);
+  const auto bytes = readable->map(10'000);
+  ASSERT_EQ(ftruncate(writer.number(), 0), 0);
+  EXPECT_EQ(bytes, std::string(10'000, 'x')) << "what somebody holds open for writing is copied";
+}
+
+TEST_F(HostFileManagerTest, ADiskThatIsFullTakesWhatItCanAndSaysSo) {
+  ASSERT_TRUE(files.createFile(folder / "file"));
+  const auto file = *files.openForAppending(folder / "file");
+  const auto ignored = std::signal(SIGXFSZ, SIG_IGN);
+  rlimit old{};
+  getrlimit(RLIMIT_FSIZE, &old);
+  const rlimit small{10, old.rlim_max};
+  setrlimit(RLIMIT_FSIZE, &small);
+  const auto appended = file->append("12345678", "abcd");
+  setrlimit(RLIMIT_FSIZE, &old);
+  std::signal(SIGXFSZ, ignored);
+  EXPECT_EQ(errorOf(appended), EFBIG);
+  EXPECT_EQ(readFile(folder / "file"), "12345678ab");
+}
+
+TEST_F(HostFileManagerTest, ACopyIsAsOldAsWhatItWasCopiedFrom) {
+  const auto start = std::filesystem::file_time_type::clock::now() - std::chrono::hours(1);
+  writeFile(folder / "file", "x");
+  const WallTime created = files.attributes(folder / "file")->creationDate;
+  std::filesystem::last_write_time(folder / "file", start);
+  EXPECT_NEAR(toSeconds(created - files.attributes(folder / "file")->creationDate), 3600, 60);
 }
 
 TEST_F(HostFileManagerTest, ALinkInThePlaceOfAFileIsReplacedNotFollowed) {

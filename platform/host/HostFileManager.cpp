@@ -1,12 +1,15 @@
 #include "platform/host/HostFileManager.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/file.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
 
+#include "platform/host/OpenFiles.h"
 #include "platform/host/TrustedPath.h"
 
 namespace sable::platform::host {
@@ -68,6 +71,16 @@ int synchronizeFolder(int folder) {
   return readable && fsync(readable.number()) == 0 ? 0 : errno;
 }
 
+/// 0, or why a file of this mode is not for reading and writing.
+int refusalOf(mode_t mode) {
+  if (S_ISREG(mode)) return 0;
+  return S_ISLNK(mode) ? ELOOP : S_ISDIR(mode) ? EISDIR : EINVAL;
+}
+
+WallTime timeOf(const struct statx_timestamp& time) {
+  return WallTime(std::chrono::seconds(time.tv_sec) + std::chrono::nanoseconds(time.tv_nsec));
+}
+
 }  // namespace
 
 Expected<Path> HostFileManager::cachesDirectory() {
@@ -116,6 +129,63 @@ Expected<void> HostFileManager::remove(const Path& path) {
   const std::string name = path.filename();
   if (unlinkat(folder->number(), name.c_str(), 0) != 0) return failed(errno, path);
   return {};
+}
+
+Expected<void> HostFileManager::createFile(const Path& path) {
+  const auto folder = openTrustedFolder(path.parent_path(), MissingFolders::fail);
+  if (!folder) return tl::unexpected(folder.error());
+  const Descriptor file(openat(folder->number(), path.filename().c_str(),
+                               O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, S_IRUSR | S_IWUSR));
+  if (!file || fchmod(file.number(), S_IRUSR | S_IWUSR) != 0) return failed(errno, path);
+  return {};
+}
+
+Expected<std::unique_ptr<AppendableFile>> HostFileManager::openForAppending(const Path& path) {
+  const auto folder = openTrustedFolder(path.parent_path(), MissingFolders::fail);
+  if (!folder) return tl::unexpected(folder.error());
+  Descriptor file(openat(folder->number(), path.filename().c_str(),
+                         O_WRONLY | O_APPEND | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+  struct stat status {};
+  if (!file || fstat(file.number(), &status) != 0) return failed(errno, path);
+  if (const int number = refusalOf(status.st_mode); number != 0) return failed(number, path);
+  return std::make_unique<HostAppendableFile>(std::move(file), path);
+}
+
+Expected<std::unique_ptr<ReadableFile>> HostFileManager::openForReading(const Path& path) {
+  auto file = openTrustedFile(path, LastLink::refuse);
+  if (!file) return tl::unexpected(std::move(file.error()));
+  return std::make_unique<HostReadableFile>(*std::move(file), path);
+}
+
+Expected<FileAttributes> HostFileManager::attributes(const Path& path) {
+  const auto folder = openTrustedFolder(path.parent_path(), MissingFolders::fail);
+  if (!folder) return tl::unexpected(folder.error());
+  struct statx status {};
+  if (statx(folder->number(), path.filename().c_str(), AT_SYMLINK_NOFOLLOW,
+            STATX_TYPE | STATX_SIZE | STATX_MTIME | STATX_BTIME, &status) != 0) {
+    return failed(errno, path);
+  }
+  if (const int number = refusalOf(status.stx_mode); number != 0) return failed(number, path);
+  WallTime created = timeOf(status.stx_mtime);
+  if ((status.stx_mask & STATX_BTIME) != 0) created = std::min(created, timeOf(status.stx_btime));
+  return FileAttributes{status.stx_size, created};
+}
+
+Expected<std::vector<std::string>> HostFileManager::list(const Path& path) {
+  const auto folder = openTrustedFolder(path, MissingFolders::fail);
+  if (!folder) return tl::unexpected(folder.error());
+  const int readable = openat(folder->number(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  const std::unique_ptr<DIR, int (*)(DIR*)> stream(readable < 0 ? nullptr : fdopendir(readable), closedir);
+  if (!stream) return failed(errno, path);
+  std::vector<std::string> names;
+  errno = 0;
+  while (const dirent* entry = readdir(stream.get())) {  // NOLINT(concurrency-mt-unsafe): own stream
+    const std::string_view name = entry->d_name;
+    if (name != "." && name != "..") names.emplace_back(name);
+  }
+  if (errno != 0) return failed(errno, path);
+  std::ranges::sort(names);
+  return names;
 }
 
 }  // namespace sable::platform::host

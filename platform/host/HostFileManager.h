@@ -17,6 +17,11 @@ class HostFileManager final : public FileManager {
   Expected<std::string> read(const std::filesystem::path& path, std::size_t maximumBytes) override;
   Expected<void> writeAtomically(const std::filesystem::path& path, std::string_view bytes) override;
   Expected<void> remove(const std::filesystem::path& path) override;
+  Expected<void> createFile(const std::filesystem::path& path) override;
+  Expected<std::unique_ptr<AppendableFile>> openForAppending(const std::filesystem::path& path) override;
+  Expected<std::unique_ptr<ReadableFile>> openForReading(const std::filesystem::path& path) override;
+  Expected<FileAttributes> attributes(const std::filesystem::path& path) override;
+  Expected<std::vector<std::string>> list(const std::filesystem::path& path) override;
 
  private:
   const Folders folders_;

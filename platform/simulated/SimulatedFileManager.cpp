@@ -14,9 +14,52 @@ tl::unexpected<Error> failed(int number, const Path& path) {
 
 }  // namespace
 
+/// What is appended to a file that has been removed meanwhile is gone, as on a disk.
+class SimulatedFileManager::Appendable final : public AppendableFile {
+ public:
+  Appendable(SimulatedFileManager& files, const Path& path) : files_(files), path_(path) {}
+
+  Expected<std::uint64_t> size() override {
+    const auto file = files_.find(path_);
+    if (!file) return tl::unexpected(file.error());
+    return (*file)->size();
+  }
+  Expected<void> append(std::string_view head, std::string_view body) override {
+    const auto file = files_.find(path_);
+    if (file) (*file)->append(head).append(body);
+    if (!file && file.error().code != ENOENT) return tl::unexpected(file.error());
+    return {};
+  }
+
+ private:
+  SimulatedFileManager& files_;
+  const Path path_;
+};
+
+class SimulatedFileManager::Readable final : public ReadableFile {
+ public:
+  Readable(std::string bytes, const Path& path) : bytes_(std::move(bytes)), path_(path) {}
+
+  Expected<std::string_view> map(std::size_t maximumBytes) override {
+    if (bytes_.size() > maximumBytes) return failed(EFBIG, path_);
+    return std::string_view(bytes_);
+  }
+
+ private:
+  const std::string bytes_;
+  const Path path_;
+};
+
 Expected<void> SimulatedFileManager::check(const Path& path) const {
   if (failure_ != 0) return failed(failure_, path);
   return {};
+}
+
+Expected<std::string*> SimulatedFileManager::find(const Path& path) {
+  if (auto checked = check(path); !checked) return tl::unexpected(checked.error());
+  const Path file = path.lexically_normal();
+  if (const auto found = files_.find(file); found != files_.end()) return &found->second;
+  return failed(directories_.contains(file) ? EISDIR : ENOENT, path);
 }
 
 Expected<Path> SimulatedFileManager::cachesDirectory() {
@@ -37,12 +80,10 @@ Expected<void> SimulatedFileManager::createDirectory(const Path& path) {
 }
 
 Expected<std::string> SimulatedFileManager::read(const Path& path, std::size_t maximumBytes) {
-  if (auto checked = check(path); !checked) return tl::unexpected(checked.error());
-  const auto found = files_.find(path.lexically_normal());
-  if (found == files_.end())
-    return failed(directories_.contains(path.lexically_normal()) ? EISDIR : ENOENT, path);
-  if (found->second.size() > maximumBytes) return failed(EFBIG, path);
-  return found->second;
+  const auto file = find(path);
+  if (!file) return tl::unexpected(file.error());
+  if ((*file)->size() > maximumBytes) return failed(EFBIG, path);
+  return **file;
 }
 
 Expected<void> SimulatedFileManager::writeAtomically(const Path& path, std::string_view bytes) {
@@ -51,6 +92,7 @@ Expected<void> SimulatedFileManager::writeAtomically(const Path& path, std::stri
   if (directories_.contains(file)) return failed(EISDIR, path);
   if (!directories_.contains(file.parent_path())) return failed(ENOENT, path);
   files_.insert_or_assign(file, std::string(bytes));
+  creationDates_.insert_or_assign(file, clock_.now());
   return {};
 }
 
@@ -60,6 +102,44 @@ Expected<void> SimulatedFileManager::remove(const Path& path) {
   if (directories_.contains(file)) return failed(EISDIR, path);
   if (files_.erase(file) == 0) return failed(ENOENT, path);
   return {};
+}
+
+Expected<void> SimulatedFileManager::createFile(const Path& path) {
+  const auto file = find(path);
+  if (file || file.error().code == EISDIR) return failed(EEXIST, path);
+  if (file.error().code != ENOENT) return tl::unexpected(file.error());
+  return writeAtomically(path, "");
+}
+
+Expected<std::unique_ptr<AppendableFile>> SimulatedFileManager::openForAppending(const Path& path) {
+  if (const auto file = find(path); !file) return tl::unexpected(file.error());
+  return std::make_unique<Appendable>(*this, path);
+}
+
+Expected<std::unique_ptr<ReadableFile>> SimulatedFileManager::openForReading(const Path& path) {
+  const auto file = find(path);
+  if (!file) return tl::unexpected(file.error());
+  return std::make_unique<Readable>(**file, path);
+}
+
+Expected<FileAttributes> SimulatedFileManager::attributes(const Path& path) {
+  const auto file = find(path);
+  if (!file) return tl::unexpected(file.error());
+  return FileAttributes{(*file)->size(), creationDates_.at(path.lexically_normal())};
+}
+
+Expected<std::vector<std::string>> SimulatedFileManager::list(const Path& path) {
+  if (auto checked = check(path); !checked) return tl::unexpected(checked.error());
+  const Path folder = path.lexically_normal();
+  if (!directories_.contains(folder)) return failed(files_.contains(folder) ? ENOTDIR : ENOENT, path);
+  std::set<std::string> names;
+  for (const auto& [file, bytes] : files_) {
+    if (file.parent_path() == folder) names.insert(file.filename());
+  }
+  for (const Path& directory : directories_) {
+    if (directory.parent_path() == folder && directory != folder) names.insert(directory.filename());
+  }
+  return std::vector<std::string>(names.begin(), names.end());
 }
 
 }  // namespace sable::platform::simulated

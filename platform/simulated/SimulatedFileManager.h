@@ -12,11 +12,19 @@ namespace sable::platform::simulated {
 /// Files in memory; they outlive a simulated daemon that is given the same manager again.
 class SimulatedFileManager final : public FileManager {
  public:
+  /// `clock` tells when files are created.
+  explicit SimulatedFileManager(const Runtime& clock) : clock_(clock) {}
+
   Expected<std::filesystem::path> cachesDirectory() override;
   Expected<void> createDirectory(const std::filesystem::path& path) override;
   Expected<std::string> read(const std::filesystem::path& path, std::size_t maximumBytes) override;
   Expected<void> writeAtomically(const std::filesystem::path& path, std::string_view bytes) override;
   Expected<void> remove(const std::filesystem::path& path) override;
+  Expected<void> createFile(const std::filesystem::path& path) override;
+  Expected<std::unique_ptr<AppendableFile>> openForAppending(const std::filesystem::path& path) override;
+  Expected<std::unique_ptr<ReadableFile>> openForReading(const std::filesystem::path& path) override;
+  Expected<FileAttributes> attributes(const std::filesystem::path& path) override;
+  Expected<std::vector<std::string>> list(const std::filesystem::path& path) override;
 
   /// From now on every operation fails with this errno value; 0 ends that.
   void failWith(int number) { failure_ = number; }
@@ -25,9 +33,15 @@ class SimulatedFileManager final : public FileManager {
   const std::set<std::filesystem::path>& directories() const { return directories_; }
 
  private:
-  Expected<void> check(const std::filesystem::path& path) const;
+  class Appendable;
+  class Readable;
 
+  Expected<void> check(const std::filesystem::path& path) const;
+  Expected<std::string*> find(const std::filesystem::path& path);
+
+  const Runtime& clock_;
   std::map<std::filesystem::path, std::string> files_;
+  std::map<std::filesystem::path, WallTime> creationDates_;
   std::set<std::filesystem::path> directories_{"/"};
   int failure_ = 0;
 };

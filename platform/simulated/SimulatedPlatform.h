@@ -54,7 +54,7 @@ class SimulatedPlatform final : public Platform {
   NotificationCenter notificationCenter_;
   SimulatedTally tally_;
   SimulatedUserDefaults userDefaults_;
-  SimulatedFileManager fileManager_;
+  SimulatedFileManager fileManager_{runtime_};
   SimulatedNotify notify_;
   SimulatedTransactions transactions_;
   SimulatedMemoryPressure memoryPressure_;
