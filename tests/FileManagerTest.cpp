@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "platform/FileManager.h"
+#include "platform/host/Descriptor.h"
 #include "platform/host/HostFileManager.h"
 #include "platform/host/HostRuntime.h"
 #include "platform/simulated/SimulatedFileManager.h"
