@@ -1,9 +1,12 @@
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
+
+#include "platform/Runtime.h"
 
 namespace sable::platform {
 
@@ -25,6 +28,10 @@ class LocaleInfo {
   /// The date pattern for the skeleton "j": hours as this locale writes them (UTS 35).
   virtual std::string hourPattern() const = 0;
   virtual std::string timeZoneName() const = 0;  ///< "Europe/London"
+  /// The day of a time in the current time zone, counted from 1970-01-01. Days begin at midnight in
+  /// every calendar, so two times are of one day of the user's calendar where this is the same. May
+  /// read the zone from the disk.
+  virtual std::int64_t dayNumber(WallTime time) const = 0;
 };
 
 }  // namespace sable::platform

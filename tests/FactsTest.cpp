@@ -240,5 +240,27 @@ TEST_F(FactsTest, TheVariableNamesTheTimeZoneInAnyOfItsForms) {
   }
 }
 
+TEST_F(FactsTest, ADayBeginsAtMidnightOfTheZoneInSummerAndWinter) {
+  const auto facts = open();
+  const HostLocaleInfo locale(*facts);
+  struct Case {
+    const char* zone;
+    std::int64_t lastSecond;  ///< of a day, since 1970
+    std::int64_t day;
+  };
+  for (const Case& each :
+       {Case{"UTC", 86399, 0}, Case{"UTC", -1, -1}, Case{"Nowhere/Such", 86399, 0},
+        Case{"America/Los_Angeles", 1768550399, 20468},  // 15 January 2026
+        Case{"America/Los_Angeles", 1784185199, 20649},  // 15 July
+        Case{"Asia/Kathmandu", 1768500899, 20468}, Case{"Pacific/Kiritimati", 1768471199, 20468},
+        // 2 November 2018: Sao Paulo skipped the hour after the midnight of the 3rd
+        Case{"America/Sao_Paulo", 1541213999, 17837}, Case{"America/Sao_Paulo", 1541300399, 17838}}) {
+    change("time_zone = \"" + std::string(each.zone) + "\"");
+    const WallTime last = wallTimeFromSecondsSince1970(static_cast<double>(each.lastSecond));
+    EXPECT_EQ(locale.dayNumber(last), each.day) << each.zone;
+    EXPECT_EQ(locale.dayNumber(last + std::chrono::seconds(1)), each.day + 1) << each.zone;
+  }
+}
+
 }  // namespace
 }  // namespace sable::platform::host

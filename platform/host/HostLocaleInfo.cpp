@@ -2,6 +2,7 @@
 
 #include "platform/host/LocaleConventions.h"
 #include "platform/host/LocaleNames.h"
+#include "platform/host/TimeZones.h"
 
 namespace sable::platform::host {
 
@@ -43,6 +44,11 @@ std::string HostLocaleInfo::hourPattern() const {
 
 std::string HostLocaleInfo::timeZoneName() const {
   return facts_.timeZoneName();
+}
+
+std::int64_t HostLocaleInfo::dayNumber(WallTime time) const {
+  const WallTime local = time + utcOffsetOf(timeZoneName(), time);
+  return std::chrono::floor<std::chrono::days>(local).time_since_epoch().count();
 }
 
 }  // namespace sable::platform::host

@@ -21,6 +21,7 @@ class HostLocaleInfo final : public LocaleInfo {
   std::string systemLanguage() const override;
   std::string hourPattern() const override;
   std::string timeZoneName() const override;
+  std::int64_t dayNumber(WallTime time) const override;
 
  private:
   const HostFacts& facts_;

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <map>
 #include <optional>
 #include <string>
@@ -43,6 +44,7 @@ class SimulatedLocaleInfo final : public LocaleInfo {
     std::string systemLanguage = "en-US";
     std::string hourPattern = "h a";
     std::string timeZoneName = "America/Los_Angeles";
+    std::chrono::seconds utcOffset = std::chrono::hours(-8);  ///< of the zone, all year round
   };
   Values values;
 
@@ -69,6 +71,9 @@ class SimulatedLocaleInfo final : public LocaleInfo {
   std::string systemLanguage() const override { return values.systemLanguage; }
   std::string hourPattern() const override { return values.hourPattern; }
   std::string timeZoneName() const override { return values.timeZoneName; }
+  std::int64_t dayNumber(WallTime time) const override {
+    return std::chrono::floor<std::chrono::days>(time + values.utcOffset).time_since_epoch().count();
+  }
 
  private:
   NotificationCenter& center_;
