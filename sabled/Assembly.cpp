@@ -10,6 +10,7 @@
 #include "sabled/ImageFetcher.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SableBagController.h"
+#include "sabled/SablePersistentStorage.h"
 #include "sabled/SableUserGUIDController.h"
 
 namespace sable {

@@ -16,6 +16,7 @@ class ClientStateManager;
 class ImageFetcher;
 class SBLNetworkRequestFactory;
 class SableBagController;
+class SablePersistentStorage;
 class SableUserGUIDController;
 
 /// Holds every long-lived service and setting of the daemon. Services are made in the order of
@@ -36,9 +37,11 @@ class Assembly {
   platform::Tally& tally;
 
   bool sharedSession = false;  ///< one feedback session for all clients instead of one per client
+  bool testFeedbacks = false;  ///< sessions keep their feedback in memory, too
 
   // Destroyed in reverse order: what is built on others goes first.
   std::unique_ptr<SBLNetworkRequestFactory> requestFactory;
+  std::unique_ptr<SablePersistentStorage> persistentStorage;
   std::unique_ptr<SableUserGUIDController> guidController;
   ClientSessionManager* clientSessionManager = nullptr;  ///< null: sessions are not recorded
   std::unique_ptr<ImageFetcher> imageFetcher;

@@ -13,6 +13,7 @@
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SableBagController.h"
 #include "sabled/SableLogging.h"
+#include "sabled/SablePersistentStorage.h"
 #include "sabled/SableService.h"
 #include "sabled/SableUserGUIDController.h"
 
@@ -53,6 +54,7 @@ void SableDaemon::registerDefaults() {
 void SableDaemon::createServices() {
   // The order is part of the design: a service may use in its constructor what stands before it.
   assembly_.requestFactory = std::make_unique<SBLNetworkRequestFactory>(assembly_);
+  assembly_.persistentStorage = std::make_unique<SablePersistentStorage>(assembly_);
   assembly_.tally.add("com.kestrel.sabled.launch", 1);
   assembly_.imageFetcher = std::make_unique<ImageFetcher>(assembly_);
   assembly_.bagController = std::make_unique<SableBagController>(assembly_);

@@ -1,0 +1,206 @@
+#include "sabled/FileContainer.h"
+
+#include <simdjson.h>
+
+#include <array>
+#include <cerrno>
+#include <cstring>
+#include <exception>
+#include <limits>
+
+#include "platform/Tally.h"
+#include "platform/Transaction.h"
+#include "sabled/ArchivedDataIterator.h"
+#include "sabled/Assembly.h"
+#include "sabled/ClientSession.h"
+#include "sabled/SableFeedback.h"
+#include "sabled/SableLogging.h"
+
+namespace sable {
+
+namespace {
+
+constexpr std::size_t kMaximumMappedBytes = std::numeric_limits<std::uint32_t>::max();
+/// As much of a stranger's version string as is logged; ours is far shorter.
+constexpr std::size_t kLoggedVersionBytes = 256;
+
+const platform::LogHandle& log() {
+  return SableLogForCategory(SableLoggingCategoryFeedbackStorage);
+}
+
+Expected<std::string_view> mmapFileHandle(platform::ReadableFile& fileHandle) {
+  auto data = fileHandle.map(kMaximumMappedBytes);
+  if (data) return data;
+  if (data.error().code == EFBIG) {
+    log().error("erroneous file data length");
+  } else {
+    log().error("mmap: {}", data.error().description());
+  }
+  return data;
+}
+
+/// Reads the records after the first two, up to one that cannot be used.
+void decodeFeedbacks(ArchivedDataIterator& records, std::size_t dataLength, ClientSession& session) {
+  const auto userGuid = session.userGuid();
+  while (records.hasMore()) {
+    const auto record = records.readNextObject();
+    if (!record) return;
+    auto feedback = SableFeedback::parse(*record);
+    if (!feedback) {
+      log().error("{}", feedback.error().reason);
+      log().error("could not unarchive feedback range {} size {}", records.position(), dataLength);
+      return;
+    }
+    feedback->setUserAgent(session.agent());
+    feedback->setUserGuid(userGuid);
+    session.addSessionFeedbacks(std::make_shared<SableFeedback>(*std::move(feedback)));
+  }
+}
+
+}  // namespace
+
+FileContainer::FileContainer(Assembly& assembly, std::unique_ptr<platform::AppendableFile> fileHandle,
+                             std::filesystem::path fileUrl, std::string version,
+                             std::shared_ptr<platform::SerialQueue> queue, std::uint64_t maxFileSize)
+    : assembly_(assembly),
+      fileUrl_(std::move(fileUrl)),
+      version_(std::move(version)),
+      queue_(std::move(queue)),
+      maxFileSize_(maxFileSize),
+      fileHandle_(std::move(fileHandle)) {}
+
+FileContainer::FileContainer(Assembly& assembly, std::filesystem::path fileUrl, std::string version,
+                             std::shared_ptr<platform::SerialQueue> queue, std::uint64_t maxFileSize)
+    : FileContainer(assembly, nullptr, std::move(fileUrl), std::move(version), std::move(queue),
+                    maxFileSize) {}
+
+void FileContainer::writeSessionHeader(const ClientSession& session) {
+  queue_->async([self = shared_from_this(), data = session.data()] {
+    if (!self->fileHandle_) return;
+    if (!self->_archiveData(self->version_)) {
+      log().error("Could not write version string");
+    } else if (!self->_archiveData(data)) {
+      log().error("Could not write root object");
+    }
+  });
+}
+
+void FileContainer::writeFeedback(const SableFeedback& feedback, platform::Function<void()> done) {
+  queue_->async([self = shared_from_this(), data = feedback.data(), done = std::move(done)]() mutable {
+    if (!self->fileHandle_) return;
+    self->_archiveData(data);
+    if (done) done();
+  });
+}
+
+/// Closes the file when it fails: what came after half a record could not be read.
+bool FileContainer::_archiveData(std::string_view bytes) {
+  queue_->assertIsCurrent();
+  const auto transaction = assembly_.platform.transactions().open("archiveObject");
+  const std::uint64_t length = bytes.size();
+  std::array<char, kArchivedLengthBytes> prefix{};
+  std::memcpy(prefix.data(), &length, sizeof length);
+
+  if (!hasRoomFor(prefix.size() + length)) {
+    _closeFile();
+    return false;
+  }
+  const auto appended = fileHandle_->append({prefix.data(), prefix.size()}, bytes);
+  if (!appended) {
+    log().error("{}", appended.error().description());
+    _closeFile();
+  }
+  return appended.has_value();
+}
+
+bool FileContainer::hasRoomFor(std::uint64_t bytes) {
+  const auto offset = fileHandle_->size();
+  if (!offset) {
+    log().error("{}", offset.error().description());
+    return false;
+  }
+  // A file that would just be full counts as too long.
+  if (*offset + bytes < maxFileSize_) return true;
+  assembly_.tally.add("com.kestrel.sabled.filesizeexceeded", 1);
+  log().error("bytes written ({}) + feedback ({}) exceeds max session size ({})", *offset, bytes,
+              maxFileSize_);
+  return false;
+}
+
+void FileContainer::_close() {
+  queue_->async([self = shared_from_this()] { self->_closeFile(); });
+}
+
+void FileContainer::_closeFile() {
+  queue_->assertIsCurrent();
+  log().debug("close file url {}", fileUrl_.native());
+  fileHandle_.reset();
+}
+
+std::shared_ptr<ClientSession> FileContainer::read() {
+  return queue_->sync([this] { return readFile(); });
+}
+
+std::shared_ptr<ClientSession> FileContainer::readFile() {
+  log().debug("reading file url {}", fileUrl_.native());
+  if (fileHandle_) {
+    log().fault("file is already open closing it {}", fileUrl_.native());
+    _closeFile();
+  }
+  const auto attributes = assembly_.fileManager.attributes(fileUrl_);
+  if (!attributes) {
+    log().error("Attribute fetch error {}", attributes.error().description());
+    return nullptr;
+  }
+  if (attributes->size > maxFileSize_) {
+    assembly_.tally.add("com.kestrel.sabled.filetoolarge", 1);
+    log().error("Session too big to process");
+    return nullptr;
+  }
+  const auto file = assembly_.fileManager.openForReading(fileUrl_);
+  if (!file) {
+    log().error("Could not open file for reading {}", fileUrl_.native());
+    return nullptr;
+  }
+  return _unarchiveObject(**file);
+}
+
+std::shared_ptr<ClientSession> FileContainer::_unarchiveObject(platform::ReadableFile& fileHandle) {
+  queue_->assertIsCurrent();
+  const auto data = mmapFileHandle(fileHandle);
+  if (!data) return nullptr;
+  log().debug("unarchive {}", fileUrl_.native());
+  if (data->empty()) {
+    log().error("empty file");
+    return nullptr;
+  }
+  try {
+    return decode(*data);
+  } catch (const std::exception& failure) {
+    log().error("exception reading session archive {}", failure.what());
+    return nullptr;
+  }
+}
+
+std::shared_ptr<ClientSession> FileContainer::decode(std::string_view data) {
+  ArchivedDataIterator records(data);
+  const auto version = records.readNextObject();
+  if (!version || !simdjson::validate_utf8(*version)) {
+    log().error("version string not stored");
+    return nullptr;
+  }
+  if (*version != version_) {
+    log().error("version not supported: {}", version->substr(0, kLoggedVersionBytes));
+    return nullptr;
+  }
+  const auto root = records.readNextObject();
+  auto session = root ? ClientSession::initWithData(assembly_, *root) : nullptr;
+  if (!session) {
+    log().error("client session not stored");
+    return nullptr;
+  }
+  decodeFeedbacks(records, data.size(), *session);
+  return session;
+}
+
+}  // namespace sable

@@ -1,0 +1,79 @@
+#pragma once
+
+#include <cstdint>
+#include <filesystem>
+#include <memory>
+#include <string>
+#include <string_view>
+
+#include "platform/FileManager.h"
+#include "platform/Function.h"
+#include "platform/Runtime.h"
+
+namespace sable {
+
+class Assembly;
+class ClientSession;
+class SableFeedback;
+
+/// One session file: records behind each other, with nothing between or after them.
+///
+///     bytes  content
+///     8      length of the payload, unsigned, in the byte order of the machine
+///     n      payload
+///
+///     record  payload
+///     1       the user agent of the daemon that wrote the file, UTF-8
+///     2       the session: a `_SKClientSession` without feedback
+///     3 ...   a feedback each, as they came: a `_SKSableFeedback`
+///
+/// Another build of the daemon or of the system has another user agent and does not read the file.
+/// A record is written at once and reaches the disk in the system's own time: a kill tears at most
+/// the last one, and what stands before it is read.
+///
+///     open --close, a write that failed, a record past the limit--> closed
+///
+/// Writes to a closed file are left out without a word. All work on the file is done on the
+/// storage's queue; callers that write never wait for it.
+class FileContainer : public std::enable_shared_from_this<FileContainer> {
+ public:
+  /// A file of at most `maxFileSize` bytes, just made and open, for a session to write.
+  FileContainer(Assembly& assembly, std::unique_ptr<platform::AppendableFile> fileHandle,
+                std::filesystem::path fileUrl, std::string version,
+                std::shared_ptr<platform::SerialQueue> queue, std::uint64_t maxFileSize);
+  /// A file found on the disk.
+  FileContainer(Assembly& assembly, std::filesystem::path fileUrl, std::string version,
+                std::shared_ptr<platform::SerialQueue> queue, std::uint64_t maxFileSize);
+
+  const std::filesystem::path& fileUrl() const { return fileUrl_; }
+
+  /// Writes the first two records, later, from the session as it is now.
+  void writeSessionHeader(const ClientSession& session);
+  /// Writes a record, later, and then calls `done` on the storage's queue. Where the file is closed
+  /// `done` is destroyed uncalled.
+  void writeFeedback(const SableFeedback& feedback, platform::Function<void()> done = {});
+
+  /// The session with its feedback; null when the file is none that this daemon can use, which is
+  /// logged. Waits for the disk.
+  std::shared_ptr<ClientSession> read();
+
+  void _close();
+  void _closeFile();  ///< on the storage's queue
+
+ private:
+  bool _archiveData(std::string_view bytes);
+  bool hasRoomFor(std::uint64_t bytes);
+  std::shared_ptr<ClientSession> readFile();
+  std::shared_ptr<ClientSession> _unarchiveObject(platform::ReadableFile& fileHandle);
+  std::shared_ptr<ClientSession> decode(std::string_view data);
+
+  Assembly& assembly_;
+  const std::filesystem::path fileUrl_;
+  const std::string version_;
+  const std::shared_ptr<platform::SerialQueue> queue_;
+  const std::uint64_t maxFileSize_;
+
+  std::unique_ptr<platform::AppendableFile> fileHandle_;  ///< on queue_; null when closed
+};
+
+}  // namespace sable
