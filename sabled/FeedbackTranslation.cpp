@@ -4,27 +4,34 @@
 
 namespace sable::feedback {
 
+void ObjectBuilder::set(const std::string& key, Dictionary value) {
+  Dictionary::object_t::Container& members = object_.get_ref<Dictionary::object_t&>();
+  const auto [place, isNew] = places_.try_emplace(key, members.size());
+  if (isNew) {
+    members.emplace_back(key, std::move(value));
+  } else {
+    members[place->second].second = std::move(value);
+  }
+}
+
 Dictionary firstURL(const messages::SBLPunchout& punchout) {
   return punchout.urls_size() > 0 ? Dictionary(punchout.urls(0)) : Dictionary();
 }
 
 Dictionary localFeatures(const google::protobuf::RepeatedPtrField<messages::SBLLocalFeature>& features) {
-  Dictionary d = Dictionary::object();
+  ObjectBuilder builder;
   for (const auto& feature : features) {
-    Dictionary& value = d[feature.key()];
-    if (feature.has_string_value()) {
-      value = feature.string_value();
-    } else {
-      value = feature.double_value();
-    }
+    builder.set(feature.key(), feature.has_string_value() ? Dictionary(feature.string_value())
+                                                          : Dictionary(feature.double_value()));
   }
-  return d;
+  return builder.take();
 }
 
 Dictionary headerFields(const google::protobuf::RepeatedPtrField<messages::SBLHeaderField>& fields) {
-  Dictionary d;
-  for (const auto& field : fields) d[field.name()] = field.value();
-  return d;
+  if (fields.empty()) return nullptr;
+  ObjectBuilder builder;
+  for (const auto& field : fields) builder.set(field.name(), field.value());
+  return builder.take();
 }
 
 Dictionary errorRecord(const messages::SBLErrorRecord& error) {

@@ -4,6 +4,8 @@
 #include <span>
 #include <string>
 #include <string_view>
+#include <unordered_map>
+#include <utility>
 
 #include "SableKit/messages/Shared.pb.h"
 #include "platform/Dictionary.h"
@@ -30,6 +32,18 @@ Dictionary listOrNull(const List& list, Translate translate) {
   for (const auto& member : list) array.push_back(translate(member));
   return array;
 }
+
+/// An object whose members a stranger counts: setting one takes the same time whatever their number.
+class ObjectBuilder {
+ public:
+  /// Of members with one name the last value counts, in the first one's place.
+  void set(const std::string& key, Dictionary value);
+  Dictionary take() { return std::move(object_); }
+
+ private:
+  Dictionary object_ = Dictionary::object();
+  std::unordered_map<std::string, std::size_t> places_;
+};
 
 /// The first URL, or null.
 Dictionary firstURL(const messages::SBLPunchout& punchout);

@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "platform/IPAddress.h"
+#include "sabled/FeedbackTranslation.h"
 
 namespace sable::feedback {
 
@@ -66,20 +67,20 @@ Dictionary value(const Entry& entry) {
 }
 
 Dictionary everyEntry(const messages::SBLNetworkTiming& statistics) {
-  Dictionary stats = Dictionary::object();
-  for (const Entry& entry : statistics.entries()) stats[entry.key()] = value(entry);
-  return stats;
+  ObjectBuilder stats;
+  for (const Entry& entry : statistics.entries()) stats.set(entry.key(), value(entry));
+  return stats.take();
 }
 
 /// Those whose integer part is not 0.
 Dictionary countsOf(const messages::SBLNetworkTiming& statistics) {
-  Dictionary stats = Dictionary::object();
+  ObjectBuilder stats;
   for (const Entry& entry : statistics.entries()) {
     const bool counts = entry.has_number() ? std::abs(entry.number()) >= 1 : entry.integer() != 0;
     const std::string_view key = entry.key();
-    if (counts) stats[std::string(key.substr(std::min(kStatPrefixLength, key.size())))] = value(entry);
+    if (counts) stats.set(std::string(key.substr(std::min(kStatPrefixLength, key.size()))), value(entry));
   }
-  return stats;
+  return stats.take();
 }
 
 std::int64_t roundedMilliseconds(double seconds) {
