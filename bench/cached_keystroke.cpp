@@ -4,8 +4,6 @@
 #include <fmt/core.h>
 #include <unistd.h>
 
-#include <thread>
-
 #include "bench/support/Bench.h"
 
 namespace {
@@ -14,9 +12,10 @@ using namespace sable::bench;
 
 constexpr const char* kTyped = "weather";
 constexpr int kWarmUp = 500;
-constexpr int kRounds = 40;
+constexpr int kRounds = 4;  // of each start
 constexpr int kCallsInARound = 250;
 constexpr int kClients = 8;
+constexpr int kThroughputRounds = 10;
 
 struct Bounds {
   std::optional<double> raw;  ///< at most so many times the bare socket
@@ -24,30 +23,36 @@ struct Bounds {
 };
 
 void roundTrips(Placement placement, const Bounds& bounds, int argc, char** argv) {
-  placeServers(placement);
-  World world;
-  world.startDaemon();
-  Client client(world.socket());
-  client.search(kTyped, Client::Outcome::answer);
-  const RawServer server(world.path("raw.sock"), client.sizes(kTyped, Client::Outcome::answer));
-  const BusServer busServer(world.path(""), Service::kAnswerBytes);
-  placeClient(placement);
-  const int socket = server.connect();
-  Client busClient(busServer);
-
-  Microseconds ignored, raw, bus, daemon;
-  for (int round = -1; round < kRounds; ++round) {
-    const int calls = round < 0 ? kWarmUp : kCallsInARound;
-    const auto into = [&](Microseconds& times) -> Microseconds& { return round < 0 ? ignored : times; };
-    measure(calls, into(raw), [&] { server.call(socket); });
-    measure(calls, into(bus), [&] { busClient.search(kTyped, Client::Outcome::answer); });
-    measure(calls, into(daemon), [&] { client.search(kTyped, Client::Outcome::answer); });
+  Rounds raw, bus, daemon;
+  for (int start = 0; start < kStarts; ++start) {
+    placeServers(placement);
+    World world;
+    world.startDaemon();
+    Client client(world.socket());
+    client.search(kTyped, Client::Outcome::answer);
+    const RawServer server(world.path("raw.sock"), client.sizes(kTyped, Client::Outcome::answer));
+    const BusServer busServer(world.path(""), Service::kAnswerBytes);
+    placeClient(placement);
+    const int socket = server.connect();
+    Client busClient(busServer);
+    const auto call = [&] { server.call(socket); };
+    const auto callOnBus = [&] { busClient.search(kTyped, Client::Outcome::answer); };
+    const auto search = [&] { client.search(kTyped, Client::Outcome::answer); };
+    Rounds warmUp;
+    warmUp.measure(kWarmUp, call);
+    warmUp.measure(kWarmUp, callOnBus);
+    warmUp.measure(kWarmUp, search);
+    for (int round = 0; round < kRounds; ++round) {
+      raw.measure(kCallsInARound, call);
+      bus.measure(kCallsInARound, callOnBus);
+      daemon.measure(kCallsInARound, search);
+    }
+    ::close(socket);
+    if (world.service().searches() != 1) fail("not the cache answered");
   }
-  ::close(socket);
-  if (world.service().searches() != 1) fail("not the cache answered");
   const auto name = fmt::format("cached_keystroke{}", suffix(placement));
-  report({name, "us", median(daemon), median(raw), bounds.raw}, argc, argv);
-  report({name + "_bus", "us", median(daemon), median(bus), bounds.bus}, argc, argv);
+  report({name, "us", daemon.typical(placement), raw.typical(placement), bounds.raw}, argc, argv);
+  report({name + "_bus", "us", daemon.typical(placement), bus.typical(placement), bounds.bus}, argc, argv);
 }
 
 void throughput(double least, int argc, char** argv) {
@@ -57,7 +62,7 @@ void throughput(double least, int argc, char** argv) {
   first.search(kTyped, Client::Outcome::answer);
   const RawServer server(world.path("raw.sock"), first.sizes(kTyped, Client::Outcome::answer));
   std::vector<double> raw, daemon;
-  for (int round = 0; round < kRounds / 4; ++round) {
+  for (int round = 0; round < kThroughputRounds; ++round) {
     raw.push_back(callsPerSecond(kClients, kCallsInARound, [&] {
       const int socket = server.connect();
       for (int i = 0; i < kCallsInARound; ++i) server.call(socket);

@@ -12,9 +12,10 @@ using namespace sable::bench;
 
 constexpr const char* kTooShort = "we";
 constexpr int kWarmUp = 500;
-constexpr int kRounds = 40;
+constexpr int kRounds = 4;  // of each start
 constexpr int kCallsInARound = 500;
 constexpr int kClients = 8;
+constexpr int kThroughputRounds = 10;
 
 struct Setup {
   World world;
@@ -28,26 +29,33 @@ struct Setup {
 };
 
 void roundTrips(Placement placement, std::optional<double> bound, int argc, char** argv) {
-  placeServers(placement);
-  const Setup setup;
-  placeClient(placement);
-  const int socket = setup.server.connect();
-  Client client(setup.world.socket());
-  Microseconds ignored, raw, daemon;
-  for (int round = -1; round < kRounds; ++round) {
-    const int calls = round < 0 ? kWarmUp : kCallsInARound;
-    measure(calls, round < 0 ? ignored : raw, [&] { setup.server.call(socket); });
-    measure(calls, round < 0 ? ignored : daemon, [&] { client.search(kTooShort, Client::Outcome::nothing); });
+  Rounds raw, daemon;
+  for (int start = 0; start < kStarts; ++start) {
+    placeServers(placement);
+    const Setup setup;
+    placeClient(placement);
+    const int socket = setup.server.connect();
+    Client client(setup.world.socket());
+    const auto call = [&] { setup.server.call(socket); };
+    const auto search = [&] { client.search(kTooShort, Client::Outcome::nothing); };
+    Rounds warmUp;
+    warmUp.measure(kWarmUp, call);
+    warmUp.measure(kWarmUp, search);
+    for (int round = 0; round < kRounds; ++round) {
+      raw.measure(kCallsInARound, call);
+      daemon.measure(kCallsInARound, search);
+    }
+    ::close(socket);
   }
-  ::close(socket);
-  report({fmt::format("refused_search{}", suffix(placement)), "us", median(daemon), median(raw), bound}, argc,
-         argv);
+  report({fmt::format("refused_search{}", suffix(placement)), "us", daemon.typical(placement),
+          raw.typical(placement), bound},
+         argc, argv);
 }
 
 void throughput(const std::string& name, int argc, char** argv) {
   const Setup setup;
   std::vector<double> raw, daemon;
-  for (int round = 0; round < kRounds / 4; ++round) {
+  for (int round = 0; round < kThroughputRounds; ++round) {
     raw.push_back(callsPerSecond(kClients, kCallsInARound, [&] {
       const int socket = setup.server.connect();
       for (int i = 0; i < kCallsInARound; ++i) setup.server.call(socket);

@@ -10,6 +10,7 @@
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
+#include <numeric>
 #include <string_view>
 #include <thread>
 
@@ -24,6 +25,11 @@ double median(std::vector<double> values) {
   const auto middle = values.begin() + static_cast<std::ptrdiff_t>(values.size() / 2);
   std::nth_element(values.begin(), middle, values.end());
   return *middle;
+}
+
+double Rounds::typical(Placement placement) const {
+  if (placement != Placement::free) return median(medians_);
+  return std::accumulate(medians_.begin(), medians_.end(), 0.0) / static_cast<double>(medians_.size());
 }
 
 double callsPerSecond(int clients, int calls, const std::function<void()>& run) {

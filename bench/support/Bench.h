@@ -33,6 +33,33 @@ void measure(int count, Microseconds& times, Call call) {
   }
 }
 
+/// Where the two sides of a call run. Left to itself, the scheduler has them either share a processor or
+/// keep one each, sticks to it for thousands of calls, and changes a call's time by three to six that way:
+/// chance decides between floor and daemon. So both are measured with the same places as well, and where
+/// they are free, over many starts.
+enum class Placement { free, twoProcessors, oneProcessor };
+
+/// What calls took, in rounds that alternate with those of the rival: what else the machine does changes
+/// from second to second.
+class Rounds {
+ public:
+  template <class Call>
+  void measure(int count, Call call) {
+    Microseconds times;
+    bench::measure(count, times, call);
+    medians_.push_back(median(times));
+  }
+  /// The median of the rounds' medians. With free placement their mean: of two modes, the median would
+  /// be either.
+  double typical(Placement placement) const;
+
+ private:
+  std::vector<double> medians_;
+};
+
+/// How often a comparison starts its servers anew.
+inline constexpr int kStarts = 20;
+
 /// Calls per second of all of `clients` threads together, each of which makes `calls` calls.
 double callsPerSecond(int clients, int calls, const std::function<void()>& run);
 
@@ -149,28 +176,22 @@ class Client {
   std::uint64_t queryId_ = 0;
 };
 
-/// The floor of a call: the same numbers of bytes through a Unix socket, served by a process with
-/// one thread and a one-shot epoll set.
+/// The floor of a call: the same numbers of bytes through a Unix socket, served by raw_server.
 class RawServer {
  public:
   RawServer(std::string path, Client::Sizes sizes);
+  pid_t pid() const { return process_.pid(); }
   int connect() const;
   /// One call.
   void call(int socket) const;
 
  private:
-  void serve() const;
-
   std::string path_;
   Client::Sizes sizes_;
   int listener_;
   Child process_;
 };
 
-/// Where the two sides of a call run. Left to the scheduler, the floor's may share a processor while the
-/// daemon's do not, or the other way round, which changes a call's time sixfold: so both are measured with
-/// the same places as well, client and servers on a processor each.
-enum class Placement { free, twoProcessors, oneProcessor };
 /// "", "_two_cpus", "_one_cpu", behind a measure's name.
 const char* suffix(Placement placement);
 /// For what is started from now on.

@@ -1,6 +1,5 @@
 #include <fcntl.h>
 #include <poll.h>
-#include <sys/epoll.h>
 #include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -134,7 +133,11 @@ RawServer::RawServer(std::string path, Client::Sizes sizes)
       ::listen(listener_, 16) != 0) {
     fail("the floor's server cannot listen");
   }
-  process_ = Child([this] { serve(); });
+  process_ = Child([this] {
+    ::dup2(listener_, STDIN_FILENO);
+    ::execl(RAW_SERVER_PROGRAM, "raw_server", std::to_string(sizes_.request).c_str(),
+            std::to_string(sizes_.reply).c_str(), nullptr);
+  });
   ::close(listener_);
 }
 
@@ -152,27 +155,6 @@ void RawServer::call(int socket) const {
     const ssize_t count = ::recv(socket, buffer, sizeof buffer, 0);
     if (count <= 0) fail("the floor's server has gone");
     got += static_cast<std::size_t>(count);
-  }
-}
-
-void RawServer::serve() const {
-  const int epoll = ::epoll_create1(EPOLL_CLOEXEC);
-  const auto wait = [epoll](int operation, int descriptor) {
-    epoll_event event{EPOLLIN | EPOLLONESHOT, {.fd = descriptor}};
-    ::epoll_ctl(epoll, operation, descriptor, &event);
-  };
-  wait(EPOLL_CTL_ADD, listener_);
-  char buffer[65536] = {};
-  for (epoll_event event; ::epoll_wait(epoll, &event, 1, -1) == 1;) {
-    if (event.data.fd == listener_) {
-      wait(EPOLL_CTL_ADD, ::accept4(listener_, nullptr, nullptr, SOCK_NONBLOCK | SOCK_CLOEXEC));
-    } else if (::recv(event.data.fd, buffer, sizes_.request, 0) <= 0) {
-      ::close(event.data.fd);
-      continue;
-    } else {
-      ::send(event.data.fd, buffer, sizes_.reply, MSG_NOSIGNAL);
-    }
-    wait(EPOLL_CTL_MOD, event.data.fd);
   }
 }
 
