@@ -22,6 +22,8 @@ class Descriptor {
 
   int number() const { return number_; }
   explicit operator bool() const { return number_ >= 0; }
+  /// The caller's from now on.
+  int release() { return std::exchange(number_, -1); }
 
  private:
   int number_ = -1;

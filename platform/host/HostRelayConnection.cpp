@@ -1,6 +1,5 @@
 #include "platform/host/HostRelayConnection.h"
 
-#include <fcntl.h>
 #include <fmt/format.h>
 #include <sys/epoll.h>
 #include <systemd/sd-bus.h>
@@ -31,6 +30,7 @@ std::string reasonFor(int error) {
   if (error == -EDQUOT) return "it does not read what it asked for";
   if (error == -EMSGSIZE || error == -ENOBUFS) return "its message is too large";
   if (error == -EBADMSG) return "it sent what is no D-Bus message";
+  if (error == -EOPNOTSUPP) return "it sent descriptors, which no call here takes";
   return std::generic_category().message(-error);
 }
 
@@ -105,11 +105,7 @@ void HostRelayConnection::setInvalidationHandler(Function<void()> handler) {
 void HostRelayConnection::resume() {
   const Turn turn(turn_);
   if (!bus_ || watch_) return;
-  // sd-bus closes its descriptor when it likes. The reactor's is another, so that its number
-  // belongs to nobody else while the watch lives.
-  const int forBus = ::fcntl(socket_.number(), F_DUPFD_CLOEXEC, 3);
-  if (forBus < 0) return end(posixError(errno, "fcntl").description());
-  if (const int error = bus_->start(forBus); error < 0) return end(reasonFor(error));
+  if (const int error = bus_->start(socket_.number()); error < 0) return end(reasonFor(error));
   watch_ = runtime_.reactor().watch(socket_.number(), [weak = weak_from_this()](Events) {
     if (const auto self = weak.lock()) self->wake();
   });

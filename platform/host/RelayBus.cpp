@@ -1,6 +1,6 @@
 #include "platform/host/RelayBus.h"
 
-#include <sys/ioctl.h>
+#include <fcntl.h>
 #include <systemd/sd-bus.h>
 #include <systemd/sd-id128.h>
 #include <unistd.h>
@@ -11,29 +11,50 @@
 
 namespace sable::platform::host {
 
+namespace {
+
+int countMessage(sd_bus_message*, void* expected, sd_bus_error*) {
+  auto& count = *static_cast<std::size_t*>(expected);
+  if (count > 0) --count;
+  return 0;
+}
+
+}  // namespace
+
 RelayBus::~RelayBus() {
   if (bus_ != nullptr) sd_bus_close_unref(bus_);
 }
 
 int RelayBus::start(int socket) {
+  // sd-bus closes its descriptors when it likes.
+  Descriptor output(::fcntl(socket, F_DUPFD_CLOEXEC, 3));
+  if (!output) return -errno;
+  int input = output.number();
+  if (side_ == Side::server) {
+    inlet_.emplace(socket, quotas_.messageBytes);
+    input = inlet_->open();
+    if (input < 0) return input;
+  }
   int error = sd_bus_new(&bus_);
-  if (error >= 0) error = sd_bus_set_fd(bus_, socket, socket);
+  if (error >= 0) error = sd_bus_set_fd(bus_, input, output.number());
   if (error < 0) {
-    ::close(socket);
+    if (inlet_) ::close(input);
     return error;
   }
+  output.release();
   if (side_ == Side::server) {
     sd_id128_t id;
     error = sd_id128_randomize(&id);
     if (error >= 0) error = sd_bus_set_server(bus_, 1, id);
   }
+  if (error >= 0 && inlet_) error = sd_bus_add_filter(bus_, nullptr, countMessage, &expected_);
   if (error >= 0) error = sd_bus_negotiate_fds(bus_, 1);
   if (error >= 0) error = sd_bus_start(bus_);
   return error;
 }
 
 int RelayBus::process(RelayMessage& message) {
-  if (midMessage_ && messageGrowsTooLarge()) return -EMSGSIZE;
+  if (const int admitted = admit(); admitted <= 0) return admitted;
   sd_bus_message* received = nullptr;
   const int result = sd_bus_process(bus_, &received);
   message.reset(received);
@@ -42,25 +63,23 @@ int RelayBus::process(RelayMessage& message) {
   if (sd_bus_is_open(bus_) <= 0) return -ECONNRESET;
   if (!ready_) ready_ = sd_bus_is_ready(bus_) > 0;
   if (result == 0) {
-    midMessage_ = !sawMessage_;
-    sawMessage_ = false;
-  } else {
-    sawMessage_ = true;
-    midMessage_ = false;
-    midMessageBytes_ = 0;
+    reading_ = false;
+    if (expected_ > 0) return -EBADMSG;
   }
   if (const int error = drain(); error < 0) return error;
   return result;
 }
 
-/// sd-bus would let a message grow to 128 MiB before anybody sees it. What came in its first wake-up
-/// is not counted; the whole is, once it is read.
-bool RelayBus::messageGrowsTooLarge() {
-  int readable = 0;
-  if (::ioctl(sd_bus_get_fd(bus_), FIONREAD, &readable) == 0) {
-    midMessageBytes_ += static_cast<std::size_t>(readable);
-  }
-  return midMessageBytes_ > quotas_.messageBytes;
+/// Whether sd-bus may go on: 0 when there is nothing for it to do, below 0 an errno value.
+int RelayBus::admit() {
+  if (!inlet_ || reading_) return 1;
+  const int admitted = inlet_->admit(expected_);
+  if (admitted < 0) return admitted;
+  reading_ = admitted > 0;
+  if (reading_) return 1;
+  if (ready_ && !sdBusHoldsMessages()) return 0;
+  const int error = inlet_->close();
+  return error < 0 ? error : 1;
 }
 
 int RelayBus::send(RelayOutgoing outgoing) {

@@ -2,8 +2,10 @@
 
 #include <cstddef>
 #include <deque>
+#include <optional>
 
 #include "platform/host/Reactor.h"
+#include "platform/host/RelayInlet.h"
 #include "platform/host/RelayOutgoing.h"
 
 namespace sable::platform::host {
@@ -18,6 +20,9 @@ struct RelayQuotas {
 
 /// One connection's sd-bus object and the messages that wait for it. sd-bus is not thread-safe:
 /// everything happens under the turn of the connection that owns this. Never blocks.
+///
+/// The server side trusts its peer with nothing (RelayInlet), descriptors included; the client side
+/// trusts the daemon that it chose.
 class RelayBus {
  public:
   enum class Side { client, server };
@@ -29,7 +34,7 @@ class RelayBus {
 
   // Results: below 0, an errno value and the connection is of no more use.
 
-  /// Begins the handshake on a socket that it takes over, whatever the result.
+  /// Begins the handshake on a socket that stays the caller's.
   [[nodiscard]] int start(int socket);
   /// Whether the handshake is over.
   bool isReady() const { return ready_; }
@@ -46,10 +51,10 @@ class RelayBus {
   bool wantsToWrite() const;
 
  private:
+  int admit();
   int transmit(const RelayOutgoing& outgoing);
   int drain();
   bool sdBusHoldsMessages() const;
-  bool messageGrowsTooLarge();
 
   const Side side_;
   const RelayQuotas quotas_;
@@ -63,9 +68,9 @@ class RelayBus {
   std::size_t outboxBytes_ = 0;
   std::size_t handedBytes_ = 0;  // of the message that sd-bus has not written whole
 
-  bool sawMessage_ = false;  // since the socket was last empty
-  bool midMessage_ = false;
-  std::size_t midMessageBytes_ = 0;
+  std::optional<RelayInlet> inlet_;  // on the side that strangers connect to
+  bool reading_ = false;             // sd-bus has not read all that it was let
+  std::size_t expected_ = 0;         // messages that it must find there
 };
 
 }  // namespace sable::platform::host
