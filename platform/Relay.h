@@ -25,7 +25,8 @@
 ///
 /// A peer that sends what is no valid call gets an error reply where the protocol has one, else
 /// loses its connection. A peer that holds too much (calls in flight, unread replies, descriptors)
-/// loses its connection too, with one log line. Neither costs anybody else anything.
+/// loses its connection too, with one log line. Neither costs anybody else anything. Files go from
+/// the listener's side to the client; a client that sends one loses its connection.
 namespace sable::platform {
 
 struct RelayMethod {

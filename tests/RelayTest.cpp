@@ -22,8 +22,9 @@ constexpr RelayMethod kMethods[] = {
     {"Forget", "", ""},
     {"CallBack", "s", "s"},
     {"Note", "ts", ""},
-    {"Keep", "", ""}};
-enum Method : std::size_t { kEcho, kFail, kDrop, kForget, kCallBack, kNote, kKeep };
+    {"Keep", "", ""},
+    {"Open", "a{sv}", "a{sv}ah"}};
+enum Method : std::size_t { kEcho, kFail, kDrop, kForget, kCallBack, kNote, kKeep, kOpen };
 constexpr RelayInterface kServer{"com.kestrel.Test", "/com/kestrel/test", kMethods};
 
 constexpr RelayMethod kClientMethods[] = {{"Shout", "s", "s"}};
@@ -244,6 +245,8 @@ class RelayContract : public ::testing::TestWithParam<std::string> {
         kept_.push_back(std::move(call.reply));
         return server_->add("kept");
       }
+      case kOpen:
+        return call.reply(call.arguments[0], file_);
       default:
         break;
     }
@@ -278,6 +281,7 @@ class RelayContract : public ::testing::TestWithParam<std::string> {
   std::mutex mutex_;
   std::vector<std::shared_ptr<RelayConnection>> served_;
   std::vector<RelayReply> kept_;
+  RelayFile file_;
   std::unique_ptr<RelayListener> listener_;
 };
 
@@ -293,18 +297,16 @@ TEST_P(RelayContract, EveryTypeOfValueArrivesAsItWasSent) {
 TEST_P(RelayContract, AFileArrivesOpenAndAbsentMembersDoNotArrive) {
   int ends[2];
   ASSERT_EQ(pipe(ends), 0);
-  RelayArguments arguments = oneOfEach();
-  arguments[12] = RelayFile{std::make_shared<const int>(ends[1])};
+  file_ = RelayFile{std::make_shared<const int>(ends[1])};
   RelayRecord record;
   record.add("none", RelayValue());
   record.add("null", Data());
   record.add("empty", makeData(""));
-  arguments[7] = record;
   const auto connection = connect();
-  connection->call(kServer, kEcho, std::move(arguments), kLong, [&](Expected<RelayArguments> result) {
-    const auto& file = std::get<RelayFile>(result->at(12));
+  connection->call(kServer, kOpen, {record}, kLong, [&](Expected<RelayArguments> result) {
+    const auto& file = std::get<RelayFile>(result->at(1));
     EXPECT_EQ(write(*file.descriptor, "x", 1), 1);
-    client_->add(show(result->at(7)));
+    client_->add(show(result->at(0)));
   });
   EXPECT_EQ(client_->next(), Lines{"{empty=<> }"});
   char byte = 0;
