@@ -176,9 +176,24 @@ void ClientConnection::bagChangeNotification(const platform::Notification& notif
 }
 
 void ClientConnection::pushBag(const SBLBag* bag, const std::optional<Error>& error) {
-  connection_->send(kSBLClientRelay, SBLClientRelay::bagDidLoad,
-                    {bag == nullptr ? std::string() : compactJSON(*bag->rawBag()),
-                     bag == nullptr ? userAgent_ : bag->userAgent(), encodeError(error)});
+  platform::RelayArguments arguments{bag == nullptr ? std::string() : compactJSON(*bag->rawBag()),
+                                     bag == nullptr ? userAgent_ : bag->userAgent(), encodeError(error)};
+  // Some clients never answer: one answer at a time is waited for, for as long as they may be silent.
+  if (std::exchange(awaitsPush_, true)) {
+    return connection_->send(kSBLClientRelay, SBLClientRelay::bagDidLoad, std::move(arguments));
+  }
+  connection_->call(kSBLClientRelay, SBLClientRelay::bagDidLoad, std::move(arguments), kClientIdleTimeout,
+                    [weak = weak_from_this()](const Expected<platform::RelayArguments>& result) {
+                      if (const auto self = weak.lock()) self->pushAnswered(result);
+                    });
+}
+
+void ClientConnection::pushAnswered(const Expected<platform::RelayArguments>& result) {
+  awaitsPush_ = false;
+  if (result) return;
+  const auto code = static_cast<platform::RelayErrorCode>(result.error().code);
+  if (code == platform::RelayErrorCode::disconnected || code == platform::RelayErrorCode::timedOut) return;
+  log().error("(pid:{}) remote proxy error: {}", connection_->peer().pid, result.error().description());
 }
 
 void ClientConnection::bag(platform::RelayReply reply) {

@@ -58,6 +58,7 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void bag(platform::RelayReply reply);
   void bagChangeNotification(const platform::Notification& notification);
   void pushBag(const SBLBag* bag, const std::optional<Error>& error);
+  void pushAnswered(const Expected<platform::RelayArguments>& result);
 
   void request(platform::RelayCall& call);
   void explain(platform::RelayCall& call);
@@ -80,6 +81,7 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   std::string userAgent_;
   std::shared_ptr<ClientState> state_;
   platform::NotificationCenter::Token bagObservation_;
+  bool awaitsPush_ = false;  ///< a pushed bag is unanswered
 
   platform::Timer timer_;  ///< on the background queue
 };

@@ -1,6 +1,8 @@
 #include <gtest/gtest.h>
 
 #include "SableKit/SBLBag.h"
+#include "SableKit/SBLConstants.h"
+#include "SableKit/SBLRelayCoding.h"
 #include "SableKit/SBLRelayInterfaces.h"
 #include "platform/PropertyList.h"
 #include "sabled/ClientState.h"
@@ -45,6 +47,36 @@ TEST_F(Daemon, AClientIsConfiguredAndGetsTheBag) {
   device.advance(1s);
   ASSERT_EQ(client.bags().size(), 2u) << "a new bag is pushed to whoever is there";
   EXPECT_EQ(client.bags()[1].raw["version"], "2");
+}
+
+TEST_F(Daemon, AClientThatRefusesItsBagIsToldOfInTheLogAndOneThatNeverAnswersIsNot) {
+  constexpr const char* kLine =
+      "(pid:100) remote proxy error: RelayErrorDomain 3: org.freedesktop.DBus.Error.UnknownMethod "
+      "/com/kestrel/client has no method BagDidLoad";
+  const auto configure = [&](platform::RelayConnection& connection) {
+    connection.resume();
+    connection.send(kSBLDaemonRelay, SBLDaemonRelay::configure,
+                    {encodeConfiguration({{"client"}, {"Client/1"}})});
+    device.advance(1s);
+  };
+  device.start();
+  const std::string address = "unix:path=/simulated/" + std::string(kSBLServiceName);
+  const auto without = *device.platform.relay().connectAs(address, {100, 1000});
+  configure(*without);
+  EXPECT_EQ(device.log.count(kLine), 1u);
+
+  int bags = 0;
+  const auto silent = *device.platform.relay().connectAs(address, {100, 1000});
+  silent->exportObject(kSBLClientRelay, [&](platform::RelayCall call) {
+    ++bags;
+    call.reply.forget();
+  });
+  configure(*silent);
+  device.bag["version"] = "2";
+  device.assembly().bagController->forceFetchBag({{"bag", 2}});
+  device.advance(61s);
+  EXPECT_EQ(bags, 2) << "waiting for one answer keeps no bag back";
+  EXPECT_EQ(device.log.count("remote proxy error"), 2u) << "again the first client's";
 }
 
 TEST_F(Daemon, AFailedConfigurationClosesTheConnectionWithoutAnAnswer) {
