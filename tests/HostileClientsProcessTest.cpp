@@ -59,9 +59,9 @@ class HostileClients : public testing::Test {
 TEST_F(HostileClients, WhoDoesNotShakeHandsIsHungUpOn) {
   std::list<RawPeer> peers;  // all at once: those who say too little have a few seconds
   for (const std::string& greeting :
-       {""s, "\0"s, "\0AUTH EXTERNAL"s, "\0AUTH EXTERNAL\r\n"s, "\0AUTH EXTERNAL\r\nDATA\r\n"s,
-        "\0AUTH ANONYMOUS\r\n"s, "\0AUTH EXTERNAL zz\r\nDATA\r\nBEGIN\r\n"s, "\0BEGIN\r\n"s,
-        "GET / HTTP/1.1\r\n\r\n"s, std::string(1 << 20, '\0'), std::string(1 << 20, '\xff'),
+       {""s, "\0"s, "\0AUTH EXTERNAL"s, "\0AUTH\r\nBEGIN\r\n"s, "\0AUTH EXTERNAL\r\n"s,
+        "\0AUTH EXTERNAL\r\nDATA\r\n"s, "\0AUTH ANONYMOUS\r\n"s, "\0AUTH EXTERNAL zz\r\nDATA\r\nBEGIN\r\n"s,
+        "\0BEGIN\r\n"s, "GET / HTTP/1.1\r\n\r\n"s, std::string(1 << 20, '\0'), std::string(1 << 20, '\xff'),
         "\0"s + std::string(1 << 20, 'A')}) {
     peers.emplace_back(world_.socket()).send(greeting);
   }

@@ -32,7 +32,7 @@ int RelayBus::start(int socket) {
   int input = output.number();
   if (side_ == Side::server) {
     inlet_.emplace(socket, quotas_.messageBytes);
-    input = inlet_->open();
+    input = inlet_->start();
     if (input < 0) return input;
   }
   int error = sd_bus_new(&bus_);
@@ -64,7 +64,7 @@ int RelayBus::process(RelayMessage& message) {
   if (!ready_) ready_ = sd_bus_is_ready(bus_) > 0;
   if (result == 0) {
     reading_ = false;
-    if (expected_ > 0) return -EBADMSG;
+    if (expected_ > 0 || (inlet_ && inlet_->hasBegun() && !ready_)) return -EBADMSG;
   }
   if (const int error = drain(); error < 0) return error;
   return result;
@@ -72,13 +72,13 @@ int RelayBus::process(RelayMessage& message) {
 
 /// Whether sd-bus may go on: 0 when there is nothing for it to do, below 0 an errno value.
 int RelayBus::admit() {
-  if (!inlet_ || reading_) return 1;
+  if (!inlet_ || expected_ > 0 || (reading_ && !inlet_->isAttached())) return 1;
   const int admitted = inlet_->admit(expected_);
   if (admitted < 0) return admitted;
   reading_ = admitted > 0;
   if (reading_) return 1;
   if (ready_ && !sdBusHoldsMessages()) return 0;
-  const int error = inlet_->close();
+  const int error = inlet_->detach();
   return error < 0 ? error : 1;
 }
 

@@ -2,10 +2,10 @@
 
 #include <fcntl.h>
 #include <sys/socket.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
+#include <utility>
 
 #include "platform/host/RelayFraming.h"
 
@@ -15,12 +15,14 @@ namespace {
 
 constexpr std::size_t kLookedAt = 8192;
 constexpr std::size_t kFedAtOnce = 65536;
-/// Ends the handshake (D-Bus specification, "Authentication Protocol").
+// Of the handshake (D-Bus specification, "Authentication Protocol").
+constexpr std::size_t kLongestLine = 4096;
+constexpr std::string_view kLineEnd = "\r\n";
 constexpr std::string_view kLastLine = "BEGIN\r\n";
 
 }  // namespace
 
-int RelayInlet::open() {
+int RelayInlet::start() {
   int ends[2];
   if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends) != 0) return -errno;
   toBus_ = Descriptor(ends[0]);
@@ -28,17 +30,16 @@ int RelayInlet::open() {
   return input_;
 }
 
-int RelayInlet::close() {
-  if (toBus_) return 0;
-  int ends[2];
-  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0, ends) != 0) return -errno;
-  toBus_ = Descriptor(ends[0]);
-  const Descriptor fromHere(ends[1]);
-  return ::dup3(fromHere.number(), input_, O_CLOEXEC) < 0 ? -errno : 0;
+int RelayInlet::detach() {
+  if (!isAttached()) return 0;
+  const int bus = input_;
+  const Descriptor fromHere(start());
+  input_ = bus;
+  if (!fromHere) return fromHere.number();
+  return ::dup3(fromHere.number(), bus, O_CLOEXEC) < 0 ? -errno : 0;
 }
 
 int RelayInlet::admit(std::size_t& messages) {
-  if (std::exchange(emptied_, false)) return 0;
   if (begun_ && fixed_.empty() && messageLeft_ == 0) {
     const int result = look(messages);
     if (result < 0 || messages > 0) return result;
@@ -47,7 +48,7 @@ int RelayInlet::admit(std::size_t& messages) {
   return feed(messages);
 }
 
-/// Below 0 an errno value, 0 at the end
+/// 0: nothing has come.
 int RelayInlet::receive(char* bytes, std::size_t size, int flags) const {
   iovec part{bytes, size};
   msghdr message{};
@@ -74,8 +75,7 @@ int RelayInlet::look(std::size_t& messages) {
     ++messages;
   }
   if (messages == 0) return count;
-  emptied_ = rest.empty() && count < static_cast<int>(sizeof bytes);
-  if (!toBus_) return count;
+  if (isAttached()) return count;
   if (::dup3(socket_, input_, O_CLOEXEC) < 0) return -errno;
   toBus_ = Descriptor();
   return count;
@@ -85,7 +85,7 @@ int RelayInlet::feed(std::size_t& messages) {
   char bytes[kFedAtOnce];
   const int received = receive(bytes, sizeof bytes, 0);
   if (received <= 0) return received;
-  if (const int error = close(); error < 0) return error;
+  if (const int error = detach(); error < 0) return error;
   const std::string_view read(bytes, static_cast<std::size_t>(received));
   if (const int error = count(read, messages); error < 0) return error;
   // The pair is empty, and has room for this much.
@@ -97,7 +97,7 @@ int RelayInlet::feed(std::size_t& messages) {
 int RelayInlet::count(std::string_view bytes, std::size_t& messages) {
   while (!bytes.empty()) {
     if (!begun_) {
-      countLine(bytes);
+      if (!countLine(bytes)) return -EBADMSG;
       continue;
     }
     if (messageLeft_ == 0) {
@@ -118,15 +118,16 @@ int RelayInlet::count(std::string_view bytes, std::size_t& messages) {
   return 0;
 }
 
-void RelayInlet::countLine(std::string_view& bytes) {
-  const std::size_t end = bytes.find('\n');
-  const std::size_t size = end == std::string_view::npos ? bytes.size() : end + 1;
-  line_ +=
-      bytes.substr(0, std::min(size, kLastLine.size() + 1 - std::min(line_.size(), kLastLine.size() + 1)));
+/// False when the line is longer than any that makes sense.
+bool RelayInlet::countLine(std::string_view& bytes) {
+  const std::size_t size = std::min(bytes.find('\n'), bytes.size() - 1) + 1;
+  line_ += bytes.substr(0, size);
   bytes.remove_prefix(size);
-  if (end == std::string_view::npos) return;
-  begun_ = line_ == kLastLine;
-  line_.clear();
+  if (line_.ends_with(kLineEnd)) {
+    begun_ = line_ == kLastLine;
+    line_.clear();
+  }
+  return line_.size() <= kLongestLine;
 }
 
 }  // namespace sable::platform::host
