@@ -67,6 +67,8 @@ class ManyClients : public testing::Test {
 TEST_F(ManyClients, TwoHundredSearchAtOnceAndEachIsAnswered) {
   constexpr int kClients = 200;
   constexpr std::uint64_t kSearches = 5;
+  // Who comes before the bag waits a second for it, which is not what is looked at here.
+  ASSERT_TRUE(TestClient(runtime_, world_.address()).search("dog").isClean());
   const std::int64_t before = residentKiB();
   std::deque<TestClient> clients;
   for (int i = 0; i < kClients; ++i) {

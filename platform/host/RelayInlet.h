@@ -12,8 +12,9 @@ namespace sable::platform::host {
 ///
 /// sd-bus leaves out a message whose head breaks the rules without a word, with the descriptors that came
 /// with it open, and lets a message grow to 128 MiB. So its descriptor is the stranger's socket only while
-/// nothing but whole plain calls lie at the socket's head: a look is a fifth of the price of copying them. Everything else (handshake, large messages, parts of messages, whatever is odd) is read
-/// here, where the kernel closes the descriptors that come with it, and reaches sd-bus through a socket pair.
+/// nothing but whole plain calls lie at the socket's head: a look is a fifth of the price of copying them.
+/// Everything else (handshake, large messages, parts of messages, whatever is odd) is read here, where the
+/// kernel closes the descriptors that come with it, and reaches sd-bus through a socket pair.
 /// Either way it is known how many messages sd-bus must find; when it finds fewer, one of them was none.
 class RelayInlet {
  public:
