@@ -191,7 +191,8 @@ TEST_F(Client, TellsWhenNobodyListens) {
 
 TEST_F(Client, PassesTheDaemonsRefusalsOn) {
   Expected<RelayArguments> result;
-  client_->call(kSBLDaemonRelay, SBLDaemonRelay::listSessions, {}, [&](Expected<RelayArguments> answer) { result = answer; });
+  client_->call(kSBLDaemonRelay, SBLDaemonRelay::listSessions, {},
+                [&](Expected<RelayArguments> answer) { result = answer; });
   runtime_.run();
   ASSERT_FALSE(result);
   EXPECT_TRUE(result.error().description().starts_with(errorText(RelayErrorCode::remoteError)));
