@@ -24,7 +24,7 @@ struct Bounds {
 
 void roundTrips(Placement placement, const Bounds& bounds, int argc, char** argv) {
   Rounds raw, bus, daemon;
-  for (int start = 0; start < kStarts; ++start) {
+  for (int start = 0; start < Rounds::kStarts; ++start) {
     placeServers(placement);
     World world;
     world.startDaemon();

@@ -62,7 +62,7 @@ class DirectRequest {
 
 void compare(Placement placement, std::optional<double> bound, int argc, char** argv) {
   Rounds raw, http, daemon;
-  for (int start = 0; start < kStarts; ++start) {
+  for (int start = 0; start < Rounds::kStarts; ++start) {
     placeServers(placement);
     World world(World::QueryCache::off);
     world.startDaemon();

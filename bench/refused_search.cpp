@@ -30,7 +30,7 @@ struct Setup {
 
 void roundTrips(Placement placement, std::optional<double> bound, int argc, char** argv) {
   Rounds raw, daemon;
-  for (int start = 0; start < kStarts; ++start) {
+  for (int start = 0; start < Rounds::kStarts; ++start) {
     placeServers(placement);
     const Setup setup;
     placeClient(placement);

@@ -43,6 +43,9 @@ enum class Placement { free, twoProcessors, oneProcessor };
 /// from second to second.
 class Rounds {
  public:
+  /// How often a comparison starts its servers anew.
+  static constexpr int kStarts = 20;
+
   template <class Call>
   void measure(int count, Call call) {
     Microseconds times;
@@ -56,9 +59,6 @@ class Rounds {
  private:
   std::vector<double> medians_;
 };
-
-/// How often a comparison starts its servers anew.
-inline constexpr int kStarts = 20;
 
 /// Calls per second of all of `clients` threads together, each of which makes `calls` calls.
 double callsPerSecond(int clients, int calls, const std::function<void()>& run);
@@ -175,6 +175,9 @@ class Client {
   const char* destination_ = nullptr;
   std::uint64_t queryId_ = 0;
 };
+
+/// A socket connected to a Unix one; -1 when nobody listens there.
+int connectTo(const std::string& path);
 
 /// The floor of a call: the same numbers of bytes through a Unix socket, served by raw_server.
 class RawServer {

@@ -126,6 +126,14 @@ Client::Sizes Client::sizes(const char* text, Outcome wanted) {
   return sizes;
 }
 
+int connectTo(const std::string& path) {
+  const int socket = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  const sockaddr_un address = addressOf(path);
+  if (::connect(socket, reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0) return socket;
+  ::close(socket);
+  return -1;
+}
+
 RawServer::RawServer(std::string path, Client::Sizes sizes)
     : path_(std::move(path)), sizes_(sizes), listener_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
   const sockaddr_un address = addressOf(path_);
@@ -142,9 +150,8 @@ RawServer::RawServer(std::string path, Client::Sizes sizes)
 }
 
 int RawServer::connect() const {
-  const int socket = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  const sockaddr_un address = addressOf(path_);
-  if (::connect(socket, reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) fail("connect");
+  const int socket = connectTo(path_);
+  if (socket < 0) fail("connect");
   return socket;
 }
 

@@ -3,6 +3,7 @@
 #include <netinet/in.h>
 #include <netinet/tcp.h>
 #include <poll.h>
+#include <sched.h>
 #include <signal.h>
 #include <sys/inotify.h>
 #include <sys/mman.h>
@@ -37,6 +38,13 @@ std::string searchAnswer() {
 std::string response(const std::string& body) {
   return fmt::format("HTTP/1.1 200 OK\r\nContent-Type: application/json\r\nContent-Length: {}\r\n\r\n{}",
                      body.size(), body);
+}
+
+bool isListening(const std::string& path) {
+  const int socket = connectTo(path);
+  if (socket < 0) return false;
+  ::close(socket);
+  return true;
 }
 
 }  // namespace
@@ -149,6 +157,8 @@ void World::startDaemon() {
     [[maybe_unused]] const auto count = ::read(watch, events, sizeof events);
   }
   ::close(watch);
+  // Bound is not yet listening.
+  while (!isListening(socket())) ::sched_yield();
 }
 
 }  // namespace sable::bench
