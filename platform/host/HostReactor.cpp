@@ -25,6 +25,7 @@ constexpr std::size_t kMostThreads = 64;
 constexpr std::size_t kSpareThreads =
     2;                             // above the wanted number, kept so that short waits start no threads
 constexpr int kPostedInARow = 16;  // then descriptors get a look
+constexpr std::size_t kLeftToOneThread = 6;  // more posted work than this is worth waking another
 constexpr Duration kBackstop = std::chrono::milliseconds(2);
 
 thread_local const HostReactor* poolOfThisThread = nullptr;
@@ -205,13 +206,19 @@ void HostReactor::post(QualityOfService quality, Function<void()> work) {
   std::unique_lock lock(mutex_);
   posted_[static_cast<std::size_t>(quality)].push_back(std::move(work));
   ++postedCount_;
-  if (waitingThreads_ == 0) return;
-  if (!onPoolThread() || postedCount_ > 1) return wakeOne(lock);
+  if (onPoolThread()) return leaveToThisThread(lock);
+  wakeOne(lock);
+}
+
+/// Called on a pool thread, which will come back for what is posted.
+void HostReactor::leaveToThisThread(std::unique_lock<std::mutex>& lock) {
+  if (postedCount_ == 0 || waitingThreads_ == 0) return;
+  if (postedCount_ > kLeftToOneThread) return wakeOne(lock);
   if (!std::exchange(backstopSet_, true)) timers_.wakeBy(monotonicNow() + kBackstop);
 }
 
 void HostReactor::wakeOne(std::unique_lock<std::mutex>& lock) {
-  // One at a time: who wakes finds out whether there is work for another.
+  // One at a time: who wakes sees to it that another follows, should there be enough to do.
   if (postedCount_ == 0 || waitingThreads_ == 0 || std::exchange(wakeOnItsWay_, true)) return;
   lock.unlock();
   ::eventfd_write(wakeDescriptor_, 1);
@@ -239,7 +246,7 @@ Function<void()> HostReactor::takePosted() {
   Function<void()> work = std::move(queue.front());
   queue.pop_front();
   --postedCount_;
-  wakeOne(lock);
+  leaveToThisThread(lock);
   return work;
 }
 

@@ -19,8 +19,8 @@ namespace sable::platform::host {
 /// and an event descriptor for posted work. Idle, none of them makes a system call.
 ///
 /// A thread that is woken serves one event, then posted work, then waits again. Work that a pool
-/// thread posts is run by that thread once its handler returns, without waking another one; should
-/// the handler take longer than two milliseconds, a waiting thread takes the work.
+/// thread posts is run by that thread once its handler returns, without waking another one, unless it
+/// piles up; should the handler take longer than two milliseconds, a waiting thread takes the work.
 class HostReactor final : public Reactor {
  public:
   /// Starts `threads` threads, or one per processor (two at least) for 0. They take no signals.
@@ -66,6 +66,7 @@ class HostReactor final : public Reactor {
 
   void startThread();
   void wakeOne(std::unique_lock<std::mutex>& lock);
+  void leaveToThisThread(std::unique_lock<std::mutex>& lock);
   bool onPoolThread() const;
 
   const int epoll_;
