@@ -10,7 +10,7 @@ namespace {
 
 using namespace sable::bench;
 
-constexpr const char* kTooShort = "we";
+constexpr const char* kTooShort = "";
 constexpr int kWarmUp = 500;
 constexpr int kRounds = 4;  // of each start
 constexpr int kCallsInARound = 500;

@@ -95,8 +95,10 @@ class Child {
 class Service {
  public:
   static constexpr std::size_t kAnswerBytes = 10240;
+  static constexpr const char* kCompletedQuery = "weatherglass";
 
-  Service();
+  /// Searches wait for `latency` before they are answered.
+  explicit Service(std::chrono::milliseconds latency);
   const std::string& url() const { return url_; }
   /// The head of the last search request.
   std::string lastSearch() const;
@@ -113,7 +115,8 @@ class Service {
 class World {
  public:
   enum class QueryCache { on, off };
-  explicit World(QueryCache queryCache = QueryCache::on);
+  explicit World(QueryCache queryCache = QueryCache::on,
+                 std::chrono::milliseconds latency = std::chrono::milliseconds(0));
   ~World();
   World(const World&) = delete;
   World& operator=(const World&) = delete;
@@ -154,7 +157,7 @@ class Client {
   enum class Outcome { nothing, answer };
 
   /// Returns when Configure is answered.
-  explicit Client(const std::string& socket);
+  explicit Client(const std::string& socket, const char* identifier = "bench");
   explicit Client(const BusServer& rival);
   ~Client();
   Client(const Client&) = delete;
@@ -169,7 +172,7 @@ class Client {
   Sizes sizes(const char* text, Outcome wanted);
 
  private:
-  void configure();
+  void configure(const char* identifier);
 
   sd_bus* bus_ = nullptr;
   const char* destination_ = nullptr;

@@ -75,11 +75,11 @@ std::size_t requestSize(const char* text) {
 
 }  // namespace
 
-Client::Client(const std::string& socket) {
+Client::Client(const std::string& socket, const char* identifier) {
   sd_bus_new(&bus_);
   check(sd_bus_set_address(bus_, ("unix:path=" + socket).c_str()), "address");
   check(sd_bus_start(bus_), "connect");
-  configure();
+  configure(identifier);
 }
 
 Client::Client(const BusServer& rival) : destination_(BusServer::kName) {
@@ -87,12 +87,12 @@ Client::Client(const BusServer& rival) : destination_(BusServer::kName) {
   check(sd_bus_set_address(bus_, rival.address().c_str()), "address");
   sd_bus_set_bus_client(bus_, 1);
   check(sd_bus_start(bus_), "connect");
-  configure();
+  configure("bench");
 }
 
-void Client::configure() {
+void Client::configure(const char* identifier) {
   check(sd_bus_call_method(bus_, destination_, kPath, kInterface, "Configure", nullptr, nullptr, "a{sv}", 2,
-                           "identifier", "s", "bench", "userAgent", "s", "bench/1.0"),
+                           "identifier", "s", identifier, "userAgent", "s", "bench/1.0"),
         "Configure");
 }
 

@@ -14,6 +14,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
+#include <thread>
 
 #include "bench/support/Bench.h"
 
@@ -22,7 +23,8 @@ namespace {
 
 std::string searchAnswer() {
   std::string answer =
-      R"([{"query": "weather", "completion_score": 0.5, "max_age": 0, "status": "OK", "results": [)";
+      fmt::format(R"([{{"query": "{}", "completion_score": 0.5, "max_age": 0, "status": "OK", "results": [)",
+                  Service::kCompletedQuery);
   const std::string end = "]}]";
   for (int i = 0; answer.size() + 300 < Service::kAnswerBytes; ++i) {
     answer += fmt::format(
@@ -54,7 +56,7 @@ struct Service::Shared {
   int searches;
 };
 
-Service::Service() {
+Service::Service(std::chrono::milliseconds latency) {
   shared_ = static_cast<Shared*>(
       ::mmap(nullptr, sizeof(Shared), PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0));
   const int listener = ::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0);
@@ -70,7 +72,7 @@ Service::Service() {
 
   const std::string search = response(searchAnswer());
   const std::string bag = response(fmt::format(
-      R"({{"version": "1", "enabled": true, "minimum_query_length": 3, "search_url": "{}/search"}})", url_));
+      R"({{"version": "1", "enabled": true, "minimum_query_length": 1, "search_url": "{}/search"}})", url_));
   const auto serve = [&](int connection) {
     const int on = 1;
     ::setsockopt(connection, IPPROTO_TCP, TCP_NODELAY, &on, sizeof on);
@@ -83,6 +85,7 @@ Service::Service() {
       if (isSearch) {
         std::strncpy(shared_->head, request.c_str(), sizeof shared_->head - 1);
         ++shared_->searches;
+        std::this_thread::sleep_for(latency);
       }
       const std::string& answer = isSearch ? search : bag;
       if (::send(connection, answer.data(), answer.size(), MSG_NOSIGNAL) < 0) return;
@@ -112,7 +115,7 @@ int Service::searches() const {
   return shared_->searches;
 }
 
-World::World(QueryCache queryCache) {
+World::World(QueryCache queryCache, std::chrono::milliseconds latency) : service_(latency) {
   char folder[] = "/tmp/sabled-bench-XXXXXX";
   if (::mkdtemp(folder) == nullptr) fail("mkdtemp");
   root_ = folder;
