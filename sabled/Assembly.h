@@ -43,7 +43,8 @@ class Assembly {
   std::unique_ptr<SBLNetworkRequestFactory> requestFactory;
   std::unique_ptr<SablePersistentStorage> persistentStorage;
   std::unique_ptr<SableUserGUIDController> guidController;
-  ClientSessionManager* clientSessionManager = nullptr;  ///< null: sessions are not recorded
+  /// Of the daemon itself, and of all clients where they share a session.
+  std::unique_ptr<ClientSessionManager> clientSessionManager;
   std::unique_ptr<ImageFetcher> imageFetcher;
   std::unique_ptr<SableBagController> bagController;
   std::unique_ptr<ClientStateManager> clientStateManager;

@@ -13,6 +13,7 @@
 #include "SableKit/SBLTracing.h"
 #include "platform/DeviceInfo.h"
 #include "sabled/Assembly.h"
+#include "sabled/ClientSessionManager.h"
 #include "sabled/ClientState.h"
 #include "sabled/ClientStateManager.h"
 #include "sabled/KeyboardLocale.h"
@@ -317,8 +318,9 @@ void ClientConnection::fileHandleAndAttributesForResource(const std::string& ide
 }
 
 void ClientConnection::flushSessionInvalidation(platform::Function<void(bool)> callback) {
-  // Without a session manager there is nothing to flush.
-  callback(false);
+  auto* manager = state_ == nullptr ? nullptr : state_->sessionManager();
+  if (manager == nullptr) return callback(false);  // nothing was recorded
+  manager->flushSessionInvalidationWithAgent(userAgent_, std::move(callback));
 }
 
 }  // namespace sable

@@ -11,6 +11,7 @@
 #include "platform/UserDefaults.h"
 #include "sabled/Assembly.h"
 #include "sabled/ClientNames.h"
+#include "sabled/ClientSessionManager.h"
 #include "sabled/QueryCache.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SableBagController.h"
@@ -49,13 +50,15 @@ ClientState::ClientState(std::string identifier, Assembly& assembly)
   if (assembly_.sharedSession) {
     log().standard("Sable is using shared instance of guid controller");
     guidController_ = assembly_.guidController.get();
+    sessionManager_ = assembly_.clientSessionManager.get();
   } else {
     ownGUIDController_ = std::make_unique<SableUserGUIDController>(assembly_);
     guidController_ = ownGUIDController_.get();
     log().standard("Sable is using individual instance of guid controller {}",
                    fmt::ptr(static_cast<const void*>(guidController_)));
+    ownSessionManager_ = std::make_unique<ClientSessionManager>(assembly_, *guidController_, identifier_);
+    sessionManager_ = ownSessionManager_.get();
   }
-  sessionManager_ = assembly_.clientSessionManager;
 }
 
 ClientState::~ClientState() = default;

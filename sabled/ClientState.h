@@ -112,6 +112,7 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   const std::unique_ptr<platform::Semaphore> bagFetchSemaphore_;
   std::unique_ptr<QueryCache> queryCache_;
   std::unique_ptr<SableUserGUIDController> ownGUIDController_;
+  std::unique_ptr<ClientSessionManager> ownSessionManager_;
   SableUserGUIDController* guidController_;
   ClientSessionManager* sessionManager_;
 

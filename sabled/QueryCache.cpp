@@ -11,6 +11,7 @@
 #include "platform/MemoryPressure.h"
 #include "sabled/Assembly.h"
 #include "sabled/CachedResultSet.h"
+#include "sabled/ClientSessionManager.h"
 #include "sabled/CritbitTree.h"
 #include "sabled/QueryCacheDecision.h"
 #include "sabled/SableLogging.h"

@@ -4,7 +4,6 @@
 #include <cstdint>
 #include <memory>
 #include <string>
-#include <string_view>
 #include <vector>
 
 #include "SableKit/SBLRequest.h"
@@ -15,10 +14,6 @@ namespace sable {
 class Assembly;
 class CachedResultSet;
 struct QueryCacheDecision;
-
-// Posted by those who keep sessions, when one has grown past a limit. They empty the cache.
-inline constexpr std::string_view kSBLSessionSoftLimitNotification = "SBLSessionSoftLimitNotification";
-inline constexpr std::string_view kSBLSessionMaxLimitNotification = "SBLSessionMaxLimitNotification";
 
 /// Keeps result sets of one client under the queries that they complete, and answers later
 /// keystrokes from them: an entry answers what is typed when its query begins with it and it was

@@ -11,6 +11,7 @@
 #include "sabled/Assembly.h"
 #include "sabled/ClientConnection.h"
 #include "sabled/ClientNames.h"
+#include "sabled/ClientSessionManager.h"
 #include "sabled/ClientState.h"
 #include "sabled/SableLogging.h"
 #include "sabled/SableUserGUIDController.h"
@@ -28,6 +29,8 @@ SableService::SableService(Assembly& assembly)
     : assembly_(assembly), queue_(assembly.runtime.serialQueue("com.kestrel.sable.serviceQueue")) {
   assembly_.sharedSession = assembly_.userDefaults.boolean(kSBLSharedSession).value_or(false);
   assembly_.guidController = std::make_unique<SableUserGUIDController>(assembly_);
+  assembly_.clientSessionManager = std::make_unique<ClientSessionManager>(
+      assembly_, *assembly_.guidController, std::string(kSBLServiceName));
 }
 
 SableService::~SableService() = default;
@@ -68,10 +71,10 @@ void SableService::addConnection(std::shared_ptr<ClientConnection> connection, p
 void SableService::connectionInvalidated(const std::shared_ptr<ClientConnection>& connection,
                                          const std::string& clientID, pid_t pid) {
   log().standard("connection from {} ({}) invalidated", clientID, pid);
-  queue_->async([this, connection, clientID] {
-    connection->flushSessionInvalidation([this, connection, clientID](bool flushed) {
+  queue_->async([this, connection] {
+    connection->flushSessionInvalidation([this, connection](bool flushed) {
       log().standard("session {} on invalidation", flushed ? "flushed" : "not flushed");
-      removeConnection(connection);
+      queue_->async([this, connection] { removeConnection(connection); });
     });
   });
   const auto& state = connection->state();
