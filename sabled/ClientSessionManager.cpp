@@ -210,7 +210,8 @@ ClientSessionManager::ClientSessionManager(Assembly& assembly, SableUserGUIDCont
                                            std::string identifier)
     : assembly_(assembly),
       sessions_(std::make_shared<Sessions>(assembly, guidController, std::move(identifier))) {
-  log().info("Sable is using {} session for clients {}", assembly.sharedSession ? "shared" : "individual",
+  log().info("Sable is using {} {}",
+             assembly.sharedSession ? "shared session for all clients" : "individual session for clients",
              this->identifier());
 }
 

@@ -7,11 +7,13 @@ using feedback::SessionEndReason;
 std::optional<SessionTransition> sessionTransition(SessionEvent event, SessionState state) {
   const bool isActive = state == SessionState::active;
   const bool isPastLimit = state == SessionState::softLimitReached;
+  const bool isOpen = isActive || isPastLimit;
+  const bool isNone = state == SessionState::noSession;
   const SessionTransition unchanged{.next = state};
   switch (event) {
     case SessionEvent::feedbackReceived:
-      if (isActive || isPastLimit) return SessionTransition{.addsFeedback = true, .next = state};
-      if (state != SessionState::noSession) return std::nullopt;
+      if (isOpen) return SessionTransition{.addsFeedback = true, .next = state};
+      if (!isNone) return std::nullopt;
       return SessionTransition{.beginsSession = true, .next = SessionState::active};
     case SessionEvent::softLimitReached:
       return SessionTransition{.next = isActive ? SessionState::softLimitReached : state};
@@ -19,6 +21,7 @@ std::optional<SessionTransition> sessionTransition(SessionEvent event, SessionSt
       if (!isPastLimit) return unchanged;
       return SessionTransition{.end = SessionEndReason::maxSessionTimePassed};
     case SessionEvent::externalFlushRequest:
+      if (!isOpen && !isNone) return unchanged;
       return SessionTransition{.end = SessionEndReason::externalRequest};
     case SessionEvent::criticalMemory:
       return SessionTransition{.end = SessionEndReason::criticalMemory};
@@ -29,7 +32,7 @@ std::optional<SessionTransition> sessionTransition(SessionEvent event, SessionSt
                                .beginsSession = true,
                                .next = SessionState::active};
     case SessionEvent::guidChanged:
-      if (!isActive && !isPastLimit) return unchanged;
+      if (!isOpen) return unchanged;
       return SessionTransition{
           .end = SessionEndReason::guidChanged, .beginsSession = true, .next = SessionState::active};
     case SessionEvent::sentinelFeedback:
