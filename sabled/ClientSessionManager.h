@@ -41,7 +41,8 @@ class ClientSessionManager {
   /// feedback belongs to the manager, which gives it its user GUID. Never null.
   void addSableFeedback(std::shared_ptr<SableFeedback> feedback);
 
-  /// Ends the session, later, if there is one; calls back on sessionQueue() in any case.
+  /// Ends the session, later, if there is one, and in any case calls back on sessionQueue(); `callback`
+  /// may be null.
   void flushSession(platform::Function<void()> callback);
 
   /// For a client that has gone: ends the session and calls back with true on sessionQueue(). A shared
