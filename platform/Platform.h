@@ -25,6 +25,7 @@ class Relay;
 class Runtime;
 class Tally;
 class Transactions;
+class UserActivity;
 class UserDefaults;
 
 /// The device under the daemon: one object per facility, made when first asked for (a facility
@@ -55,6 +56,7 @@ class Platform {
   virtual MapsService& mapsService() = 0;
   virtual LanguageTagger& languageTagger() = 0;
   virtual NetworkServiceProxy& networkServiceProxy() = 0;
+  virtual UserActivity& userActivity() = 0;
 
   /// What the host offers and lacks.
   virtual std::vector<Availability> availability() = 0;

@@ -17,6 +17,7 @@ constexpr std::array kSettings{
     KnownKey{"SBLDebugParameters", string},
     KnownKey{"SBLDefaultBagURL", string},
     KnownKey{"SBLDefaultBagURLCN", string},
+    KnownKey{"SBLDonateInteractions", boolean},
     KnownKey{"SBLHashtagImagesVisible", boolean},
     KnownKey{"SBLNewsVisible", boolean},
     KnownKey{"SBLNoParallax", boolean},

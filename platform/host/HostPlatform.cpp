@@ -20,6 +20,7 @@
 #include "platform/host/HostRelay.h"
 #include "platform/host/HostRuntime.h"
 #include "platform/host/HostTransactions.h"
+#include "platform/host/HostUserActivity.h"
 #include "platform/host/MappedTally.h"
 #include "platform/host/TOMLUserDefaults.h"
 
@@ -80,6 +81,7 @@ struct HostPlatform::Facilities {
   Lazy<HostManagedConfiguration> managedConfiguration;
   Lazy<HostAccountStore> accountStore;
   Lazy<HostMapsService> mapsService;
+  Lazy<HostUserActivity> userActivity;
 };
 
 HostPlatform::HostPlatform(HostPlatformConfiguration configuration)
@@ -172,6 +174,12 @@ AccountStore& HostPlatform::accountStore() {
 }
 MapsService& HostPlatform::mapsService() {
   return facilities_->mapsService.get(facilities_->runtime, facilities_->hostFacts());
+}
+
+UserActivity& HostPlatform::userActivity() {
+  auto& facilities = *facilities_;
+  return facilities.userActivity.get(facilities.runtime, facilities.settings(), facilities.fileManager,
+                                     facilities.folders.interactions());
 }
 
 std::vector<Availability> HostPlatform::availability() {

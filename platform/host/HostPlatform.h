@@ -44,6 +44,7 @@ class HostPlatform final : public Platform {
   MapsService& mapsService() override;
   LanguageTagger& languageTagger() override;
   NetworkServiceProxy& networkServiceProxy() override;
+  UserActivity& userActivity() override;
 
   std::vector<Availability> availability() override;
 

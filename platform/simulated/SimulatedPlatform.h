@@ -15,6 +15,7 @@
 #include "platform/simulated/SimulatedRuntime.h"
 #include "platform/simulated/SimulatedTally.h"
 #include "platform/simulated/SimulatedTransactions.h"
+#include "platform/simulated/SimulatedUserActivity.h"
 #include "platform/simulated/SimulatedUserDefaults.h"
 
 namespace sable::platform::simulated {
@@ -47,6 +48,7 @@ class SimulatedPlatform final : public Platform {
   SimulatedMapsService& mapsService() override { return mapsService_; }
   ScriptLanguageTagger& languageTagger() override { return languageTagger_; }
   ConfiguredServiceProxy& networkServiceProxy() override { return networkServiceProxy_; }
+  SimulatedUserActivity& userActivity() override { return userActivity_; }
 
   std::vector<Availability> availability() override { return {}; }
 
@@ -68,6 +70,7 @@ class SimulatedPlatform final : public Platform {
   SimulatedMapsService mapsService_{notificationCenter_};
   ScriptLanguageTagger languageTagger_;
   ConfiguredServiceProxy networkServiceProxy_;
+  SimulatedUserActivity userActivity_;
 
   // Last: what is still queued goes first.
   SimulatedRuntime runtime_;
