@@ -1,11 +1,13 @@
 #include "sabled/DaemonFeedback.h"
 
+#include <simdjson.h>
+
 #include <limits>
 #include <nlohmann/json.hpp>
 
 #include "SableKit/messages/RKFeedback.pb.h"
 #include "SableKit/messages/SKFeedback.pb.h"
-#include "platform/ProgrammingError.h"
+#include "sabled/FeedbackOfKind.h"
 #include "sabled/FeedbackTables.h"
 #include "sabled/NetworkTimingTranslation.h"
 
@@ -21,18 +23,14 @@ M at(platform::MonotonicTime time) {
   return message;
 }
 
-/// The road of a client's message: both come to be records in the same way.
-template <class M>
-Message made(const M& message) {
-  const std::string name = message.GetTypeName();
-  auto read =
-      FeedbackMessage::parse(std::string_view(name).substr(name.rfind('.') + 1), message.SerializeAsString());
-  if (!read) platform::programmingError(read.error().reason);
-  return std::move(*read);
+template <class Kind, class M>
+Message made(std::string_view className, M message) {
+  return std::make_unique<FeedbackOfKind<Kind, M>>(className, std::move(message));
 }
 
 /// Messages hold UTF-8 only, but a path or a header in an error need not be.
 std::string text(std::string_view bytes) {
+  if (simdjson::validate_utf8(bytes)) return std::string(bytes);
   return parseJSON(compactJSON(Dictionary(bytes)), std::numeric_limits<std::size_t>::max())
       ->get<std::string>();
 }
@@ -47,10 +45,10 @@ M networkSearchStart(platform::MonotonicTime time, const NetworkSearch& search) 
   M message = at<M>(time);
   message.set_trigger_event(enumeration(search.triggerEvent));
   message.set_input(text(search.input));
-  message.set_uuid(search.uuid);
-  message.set_url(text(search.url));
+  message.set_uuid(std::string(search.uuid));
+  message.set_url(text(search.request.url));
   message.set_endpoint_type(static_cast<std::uint32_t>(search.endpoint));
-  for (const auto& [name, value] : search.headers.fields()) {
+  for (const auto& [name, value] : search.request.headers.fields()) {
     auto& field = *message.add_headers();
     field.set_name(text(name));
     field.set_value(text(value));
@@ -95,7 +93,7 @@ M networkSearchEnd(platform::MonotonicTime time, const NetworkSearchEnd& end) {
   M message = at<M>(time);
   message.set_response_size(end.responseSize);
   message.set_status_code(end.statusCode);
-  message.set_uuid(end.uuid);
+  message.set_uuid(std::string(end.uuid));
   if (end.timing.start != platform::WallTime{}) *message.mutable_network_timing() = networkTiming(end.timing);
   return message;
 }
@@ -116,7 +114,7 @@ Message skipSearch(platform::MonotonicTime time, SkipSearchTrigger trigger, std:
   auto message = at<messages::SBLSkipSearchFeedback>(time);
   message.set_trigger_event(static_cast<std::uint32_t>(trigger));
   message.set_input(text(input));
-  return made(message);
+  return made<SkipSearch>("SBLSkipSearchFeedback", std::move(message));
 }
 
 Message cacheHit(platform::MonotonicTime time, std::string_view input, std::string_view uuid) {
@@ -124,22 +122,31 @@ Message cacheHit(platform::MonotonicTime time, std::string_view input, std::stri
   message.set_trigger_event(static_cast<std::uint32_t>(SkipSearchTrigger::cacheHit));
   message.set_input(text(input));
   message.set_uuid(std::string(uuid));
-  return made(message);
+  return made<CacheHit>("SBLCacheHitFeedback", std::move(message));
 }
 
 Message startNetworkSearch(platform::MonotonicTime time, const NetworkSearch& search) {
-  return made(networkSearchStart<messages::RKStartNetworkSearchFeedback>(time, search));
+  return made<StartNetworkSearch>("RKStartNetworkSearchFeedback",
+                                  networkSearchStart<messages::RKStartNetworkSearchFeedback>(time, search));
 }
 
 Message startLookupNetworkSearch(platform::MonotonicTime time, const NetworkSearch& search,
                                  std::int64_t lookupSelectionType) {
   auto message = networkSearchStart<messages::SBLLookupStartNetworkSearchFeedback>(time, search);
   message.set_lookup_selection_type(enumeration(lookupSelectionType));
-  return made(message);
+  return made<LookupStartNetworkSearch>("SBLLookupStartNetworkSearchFeedback", std::move(message));
+}
+
+NetworkSearchEnd endOf(const platform::HTTPResult& result, std::string_view uuid) {
+  return {.uuid = uuid,
+          .responseSize = result.data == nullptr ? 0 : static_cast<std::int64_t>(result.data->size()),
+          .statusCode = result.response ? result.response->status : 0,
+          .timing = result.timing};
 }
 
 Message endNetworkSearch(platform::MonotonicTime time, const NetworkSearchEnd& end) {
-  return made(networkSearchEnd<messages::RKEndNetworkSearchFeedback>(time, end));
+  return made<EndNetworkSearch>("RKEndNetworkSearchFeedback",
+                                networkSearchEnd<messages::RKEndNetworkSearchFeedback>(time, end));
 }
 
 Message endSableNetworkSearch(platform::MonotonicTime time, const NetworkSearchEnd& end,
@@ -149,37 +156,38 @@ Message endSableNetworkSearch(platform::MonotonicTime time, const NetworkSearchE
   message.set_sable_duration(answer.duration);
   if (answer.fbq) message.set_fbq(text(*answer.fbq));
   if (answer.partialClientIP) message.set_sable_partial_client_ip(text(*answer.partialClientIP));
-  return made(message);
+  return made<EndSableNetworkSearch>("_SKSKEndNetworkSearchFeedback", std::move(message));
 }
 
 Message error(platform::MonotonicTime time, const Error& error, const Error* underlying) {
   auto message = at<messages::RKErrorFeedback>(time);
   fill(*message.mutable_error(), error);
   if (underlying != nullptr) fill(*message.mutable_underlying_error(), *underlying);
-  return made(message);
+  return made<ErrorFeedback>("RKErrorFeedback", std::move(message));
 }
 
 Message sessionEnd(platform::MonotonicTime time, SessionEndReason reason) {
   auto message = at<messages::SableSessionEndFeedback>(time);
   message.set_reason(static_cast<std::uint32_t>(reason));
-  return made(message);
+  return made<SessionEnd>("SableSessionEndFeedback", std::move(message));
 }
 
 Message connectionInvalidated(platform::MonotonicTime time) {
-  return made(at<messages::SableConnectionInvalidated>(time));
+  return made<ConnectionInvalidated>("SableConnectionInvalidated",
+                                     at<messages::SableConnectionInvalidated>(time));
 }
 
 Message sessionMissingResults(platform::MonotonicTime time, const std::vector<std::string>& results) {
   auto message = at<messages::_SKSessionMissingResultsFeedback>(time);
   // A result of the other family has the same fields under the same numbers.
   for (const std::string& result : results) message.add_results()->ParseFromString(result);
-  return made(message);
+  return made<SessionMissingResults>("_SKSessionMissingResultsFeedback", std::move(message));
 }
 
 Message sessionMissingSuggestions(platform::MonotonicTime time, const std::vector<std::string>& suggestions) {
   auto message = at<messages::SableSessionMissingSuggestions>(time);
   for (const std::string& suggestion : suggestions) message.add_suggestions()->ParseFromString(suggestion);
-  return made(message);
+  return made<SessionMissingSuggestions>("SableSessionMissingSuggestions", std::move(message));
 }
 
 }  // namespace sable::feedback

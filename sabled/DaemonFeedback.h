@@ -10,6 +10,7 @@
 
 #include "platform/HTTPSession.h"
 #include "sabled/FeedbackMessage.h"
+#include "sabled/SableAnswer.h"
 
 /// What the daemon reports of itself. Every maker takes the time of the event, on the daemon's
 /// monotonic clock, and never fails: bytes of a text that are no UTF-8 are replaced. Any thread.
@@ -43,14 +44,13 @@ Message skipSearch(platform::MonotonicTime time, SkipSearchTrigger trigger, std:
 /// `uuid` is that of the search whose answer was used.
 Message cacheHit(platform::MonotonicTime time, std::string_view input, std::string_view uuid);
 
-/// A request that leaves for the service.
+/// A request that leaves for the service. Texts are the caller's.
 struct NetworkSearch {
   std::int64_t triggerEvent = 0;  ///< the client's, or kBagTrigger, kWarmTrigger
   Endpoint endpoint = Endpoint::sableSearch;
-  std::string input;
-  std::string url;
-  platform::HTTPHeaders headers;
-  std::string uuid;  ///< new for every request; its end names it again
+  std::string_view input;
+  const platform::HTTPRequest& request;
+  std::string_view uuid;  ///< new for every request; its end names it again
 };
 Message startNetworkSearch(platform::MonotonicTime time, const NetworkSearch& search);
 Message startLookupNetworkSearch(platform::MonotonicTime time, const NetworkSearch& search,
@@ -58,18 +58,12 @@ Message startLookupNetworkSearch(platform::MonotonicTime time, const NetworkSear
 
 /// How such a request ended.
 struct NetworkSearchEnd {
-  std::string uuid;  ///< of its start
+  std::string_view uuid;  ///< of its start
   std::int64_t responseSize = 0;
   int statusCode = 0;  ///< 0: no response
   platform::HTTPTaskTiming timing;
 };
-/// What the service's answer says of itself; `status` is also the daemon's word for a failure.
-struct SableAnswer {
-  std::optional<std::string> status;
-  double duration = 0;  ///< seconds
-  std::optional<std::string> fbq;
-  std::optional<std::string> partialClientIP;
-};
+NetworkSearchEnd endOf(const platform::HTTPResult& result, std::string_view uuid);
 /// The end of a bag or warm-up request.
 Message endNetworkSearch(platform::MonotonicTime time, const NetworkSearchEnd& end);
 /// The end of a search, zero-keyword or lookup request.

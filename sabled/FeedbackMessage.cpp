@@ -6,8 +6,7 @@
 
 #include "SableKit/SBLError.h"
 #include "SableKit/messages/SKSession.pb.h"
-#include "sabled/FeedbackKinds.h"
-#include "sabled/FeedbackProcessing.h"
+#include "sabled/FeedbackOfKind.h"
 #include "sabled/ParsedMessage.h"
 #include "sabled/SableLogging.h"
 
@@ -32,71 +31,6 @@ void ResultGrading::writeGrade(std::uint32_t grade, Dictionary& d) {
 }  // namespace feedback
 
 namespace {
-
-using feedback::Identifiers;
-
-/// A message of a class and the kind that the class is of.
-template <class Kind, class M>
-class Feedback final : public FeedbackMessage {
- public:
-  Feedback(std::string_view className, M message) : className_(className), message_(std::move(message)) {}
-
-  std::string_view className() const override { return className_; }
-
-  Dictionary dictionary() const override {
-    Dictionary dictionary = Dictionary::object();
-    Kind::write(message_, dictionary);
-    return dictionary;
-  }
-
-  unsigned type() const override { return Kind::type(message_); }
-  bool requiresQueryId() const override { return Kind::requiresQueryId(message_); }
-
-  void process(SessionProcessingHelper& helper) override {
-    if constexpr (Kind::identifiers != Identifiers::kept) {
-      feedback::processMembers(message_, Kind::identifiers == Identifiers::expanded, helper);
-    }
-  }
-
-  std::uint64_t timestamp() const override { return message_.timestamp(); }
-
-  std::uint64_t clientQueryId() const override {
-    if constexpr (requires { message_.query_id(); }) {
-      return message_.query_id();
-    } else if constexpr (requires { message_.blending_duration(); }) {
-      // A ranking belongs to the query of what it ranked.
-      const bool ranked = message_.sections_size() > 0 && message_.sections(0).results_size() > 0;
-      return ranked ? message_.sections(0).results(0).result().query_id() : 0;
-    }
-    return 0;
-  }
-
-  std::optional<ResultEngagement> resultEngagement() const override {
-    if constexpr (std::is_same_v<Kind, feedback::ResultEngaged>) {
-      const auto& result = message_.result();
-      return ResultEngagement{result.top_hit() != 0, result.type(), message_.completed_query()};
-    }
-    return std::nullopt;
-  }
-
-  std::optional<SearchViewAppearance> searchViewAppearance() const override {
-    if constexpr (std::is_same_v<Kind, feedback::SearchViewAppear>) {
-      return SearchViewAppearance{message_.on_lock_screen(), message_.view_appear_event()};
-    }
-    return std::nullopt;
-  }
-
-  std::optional<std::uint32_t> customFeedbackType() const override {
-    if constexpr (std::is_same_v<Kind, feedback::Custom>) return message_.feedback_type();
-    return std::nullopt;
-  }
-
-  std::string data() const override { return message_.SerializeAsString(); }
-
- private:
-  std::string_view className_;
-  M message_;
-};
 
 tl::unexpected<Error> refusal(std::string reason) {
   return tl::unexpected(makeSBLError(SBLErrorCode::daemonSide, std::move(reason)));
@@ -124,7 +58,7 @@ Expected<std::unique_ptr<FeedbackMessage>> parseAs(std::string_view name, std::s
     if (!json) return refusal(fmt::format("JSON of {}: {}", name, json.error().reason));
     if (!json->is_object()) return refusal(fmt::format("JSON of {} is no object", name));
   }
-  return std::make_unique<Feedback<Kind, M>>(name, std::move(message));
+  return std::make_unique<feedback::FeedbackOfKind<Kind, M>>(name, std::move(message));
 }
 
 #define FEEDBACK_CLASS(kind, name) \

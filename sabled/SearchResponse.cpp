@@ -53,6 +53,13 @@ SearchResponse::ResultSet readResultSet(const object& members) {
           number(members, "max_age"), string(members, "status").value_or("")};
 }
 
+void addToAccount(const object& members, SableAnswer& account) {
+  if (!account.status) account.status = string(members, "status");
+  if (!account.fbq) account.fbq = string(members, "fbq");
+  if (!account.partialClientIP) account.partialClientIP = string(members, "partial_client_ip");
+  if (account.duration == 0) account.duration = number(members, "duration");
+}
+
 }  // namespace
 
 Expected<SearchResponse> SearchResponse::parse(const std::string& text) {
@@ -67,10 +74,13 @@ Expected<SearchResponse> SearchResponse::parse(const std::string& text) {
   }
   SearchResponse response;
   response.isObject = root.type() == element_type::OBJECT;
+  object members;
+  if (root.get(members) == simdjson::SUCCESS) addToAccount(members, response.account);
   if (root.type() == element_type::ARRAY) {
     for (const element item : root.get_array()) {
-      object members;
-      if (item.get(members) == simdjson::SUCCESS) response.resultSets.push_back(readResultSet(members));
+      if (item.get(members) != simdjson::SUCCESS) continue;
+      response.resultSets.push_back(readResultSet(members));
+      addToAccount(members, response.account);
     }
   }
   collectImages(root, 0, response.images);

@@ -6,6 +6,7 @@
 #include "SableKit/SBLImageDescription.h"
 #include "platform/Data.h"
 #include "platform/Error.h"
+#include "sabled/SableAnswer.h"
 
 namespace sable {
 
@@ -22,6 +23,9 @@ struct SearchResponse {
   std::vector<ResultSet> resultSets;  ///< the objects of an answer that is an array
   /// Found under "image" and "images" at up to 64 levels.
   std::vector<SBLImageDescription> images;
+
+  /// Of an answer that is an array each member stands in the first of its objects that has it.
+  SableAnswer account;
 
   /// Reads RFC 8259 text nested at most kMaximumJSONDepth deep; the error's reason is the parser's.
   static Expected<SearchResponse> parse(const std::string& text);

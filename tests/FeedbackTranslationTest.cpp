@@ -300,12 +300,14 @@ TEST(FeedbackTranslation, AMessageTellsWhatItsWayDependsOn) {
 }
 
 TEST(FeedbackTranslation, TheDaemonReportsOfItself) {
-  feedback::NetworkSearch search;
-  search.triggerEvent = feedback::kWarmTrigger;
-  search.endpoint = feedback::Endpoint::sableWarm;
-  search.url = "https://s.example/warm";
-  search.headers.add("X-B", "\xff");
-  search.uuid = "U";
+  platform::HTTPRequest request;
+  request.url = "https://s.example/warm";
+  request.headers.add("X-B", "\xff");
+  const feedback::NetworkSearch search{.triggerEvent = feedback::kWarmTrigger,
+                                       .endpoint = feedback::Endpoint::sableWarm,
+                                       .input = "",
+                                       .request = request,
+                                       .uuid = "U"};
   feedback::NetworkSearchEnd end{.uuid = "U", .responseSize = 10, .statusCode = 200, .timing = {}};
   feedback::NetworkSearchEnd failed{.uuid = "U", .responseSize = 0, .statusCode = 0, .timing = {}};
   end.timing.start = platform::WallTime(std::chrono::seconds(1'800'000'000));
