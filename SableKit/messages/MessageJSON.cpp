@@ -3,7 +3,11 @@
 #include <google/protobuf/descriptor.h>
 #include <google/protobuf/descriptor.pb.h>
 #include <google/protobuf/dynamic_message.h>
+#include <google/protobuf/stubs/logging.h>
 #include <google/protobuf/util/json_util.h>
+
+#include <nlohmann/json.hpp>
+#include <utility>
 
 namespace sable {
 
@@ -51,6 +55,17 @@ tl::unexpected<Error> unknownClass(std::string_view className) {
   return failure(MessageErrorCode::unknownClass, "no message class " + std::string(className));
 }
 
+const protobuf::FieldDescriptor* field(const protobuf::Message& message, const char* name) {
+  return message.GetDescriptor()->FindFieldByName(name);
+}
+
+/// The library's own line on standard error is held back.
+bool parse(protobuf::Message& message, std::string_view bytes) {
+  const protobuf::LogSilencer silence;
+  return std::in_range<int>(bytes.size()) &&
+         message.ParseFromArray(bytes.data(), static_cast<int>(bytes.size()));
+}
+
 }  // namespace
 
 Expected<std::string> messageFromJSON(std::string_view className, std::string_view json) {
@@ -65,13 +80,29 @@ Expected<std::string> messageFromJSON(std::string_view className, std::string_vi
 Expected<std::string> messageToJSON(std::string_view className, std::string_view bytes) {
   const auto message = Definitions::shared().make(className);
   if (message == nullptr) return unknownClass(className);
-  if (!message->ParseFromArray(bytes.data(), static_cast<int>(bytes.size()))) {
+  if (!parse(*message, bytes)) {
     return failure(MessageErrorCode::malformed, "the bytes are no " + std::string(className));
   }
   std::string json;
   const auto status = protobuf::util::MessageToJsonString(*message, &json);
   if (!status.ok()) return failure(MessageErrorCode::malformed, status.message().ToString());
   return json;
+}
+
+Expected<Dictionary> feedbackRecordDocument(std::string_view bytes) {
+  const auto record = Definitions::shared().make("_SKSableFeedback");
+  if (!parse(*record, bytes))
+    return failure(MessageErrorCode::malformed, "the bytes are no _SKSableFeedback");
+  const auto& payload = record->GetReflection()->GetMessage(*record, field(*record, "payload"));
+  const auto className = payload.GetReflection()->GetString(payload, field(payload, "class_name"));
+  const auto message =
+      messageToJSON(className, payload.GetReflection()->GetString(payload, field(payload, "feedback")));
+  if (!message) return tl::unexpected(message.error());
+  return Dictionary{
+      {"class", className},
+      {"query_id", record->GetReflection()->GetInt64(*record, field(*record, "query_id"))},
+      {"client_query_id", record->GetReflection()->GetUInt64(*record, field(*record, "client_query_id"))},
+      {"message", parseJSON(*message, message->size()).value_or(Dictionary())}};
 }
 
 std::vector<std::string> messageClassNames() {

@@ -4,6 +4,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/Dictionary.h"
 #include "platform/Error.h"
 
 /// Feedback messages in protobuf's JSON form, for tools and tests: by reflection, on the full
@@ -20,6 +21,10 @@ Expected<std::string> messageFromJSON(std::string_view className, std::string_vi
 
 /// The JSON form of a message's bytes, with every field in its place and absent ones left out.
 Expected<std::string> messageToJSON(std::string_view className, std::string_view bytes);
+
+/// A feedback record of a session file (a `_SKSableFeedback`) as {"class", "query_id",
+/// "client_query_id", "message"}, the message in that form.
+Expected<Dictionary> feedbackRecordDocument(std::string_view bytes);
 
 /// The names of all messages, in the order of their definition.
 std::vector<std::string> messageClassNames();

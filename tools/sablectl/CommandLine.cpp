@@ -5,6 +5,7 @@
 
 #include "SableKit/SBLRelayCoding.h"
 #include "tools/sablectl/Commands.h"
+#include "tools/sablectl/FeedbackFields.h"
 #include "tools/sablectl/RequestRecord.h"
 
 namespace sable::sablectl {
@@ -167,7 +168,6 @@ void addAnyRequest(CLI::App& app, Invocation& invocation) {
 void addQuestions(CLI::App& app, Invocation& invocation) {
   add(app, invocation, "bag", "Show the bag as this agent sees it", runBag);
   add(app, invocation, "sessions", "List the sessions that the daemon holds open", runSessions);
-  add(app, invocation, "feedback", "Show the feedback that the daemon has not sent yet", runFeedback);
 
   struct Resource {
     std::string identifier;
@@ -187,6 +187,40 @@ void addQuestions(CLI::App& app, Invocation& invocation) {
     return runCounters(context, *openMetrics);
   }).add_flag("--openmetrics", *openMetrics, "As OpenMetrics text");
   add(app, invocation, "status", "Show what the daemon is, has and holds", runStatus);
+}
+
+void addReport(CLI::App& app, Invocation& invocation) {
+  struct Words {
+    std::vector<std::string> fields;
+    std::filesystem::path file;
+    FeedbackReport report;
+  };
+  const auto words = std::make_shared<Words>();
+  CLI::App& command = *app.add_subcommand("report", "Report a feedback");
+  addText(command, "CLASS", words->report.className, "The message's class (RKStartSearchFeedback)");
+  auto* fields = command.add_option("FIELD", words->fields, "Fields as NAME=VALUE, in protobuf's JSON form");
+  fields->type_name("");
+  command.add_option("--file", words->file, "Read the message from this file, in that form")
+      ->type_name("F")
+      ->excludes(fields);
+  command.add_option("--query-id", words->report.queryId, "The service's query that it belongs to")
+      ->type_name("N");
+  command.callback([&invocation, words] {
+    auto bytes = words->file.empty() ? feedbackFromFields(words->report.className, words->fields)
+                                     : feedbackFromFile(words->report.className, words->file);
+    if (!bytes) throw CLI::ValidationError(bytes.error().reason);
+    words->report.bytes = std::move(*bytes);
+    invocation.command = [words](const Context& context) { return runReport(context, words->report); };
+  });
+}
+
+void addFeedback(CLI::App& app, Invocation& invocation) {
+  addReport(app, invocation);
+  add(app, invocation, "feedback", "Show the feedback that sessions hold in memory", runFeedback);
+  const auto path = std::make_shared<std::filesystem::path>();
+  CLI::App& session = add(app, invocation, "session", "Show what a session file holds",
+                          [path](const Context& context) { return runSessionFile(context, *path); });
+  session.add_option("FILE", *path, "The file")->required()->type_name("");
 }
 
 void addOptions(CLI::App& app, Options& options) {
@@ -215,6 +249,7 @@ std::variant<Invocation, ExitCode> readCommandLine(int argc, const char* const* 
   addImages(app, invocation);
   addAnyRequest(app, invocation);
   addQuestions(app, invocation);
+  addFeedback(app, invocation);
   try {
     app.parse(argc, argv);
   } catch (const CLI::Success& success) {

@@ -28,11 +28,21 @@ ExitCode runImages(const Context& context, const ImageOptions& options);
 ExitCode runExplain(const Context& context, const SBLSearchRequest& request);
 ExitCode runBag(const Context& context);
 ExitCode runSessions(const Context& context);
+/// What sessions hold in memory.
 ExitCode runFeedback(const Context& context);
 ExitCode runResource(const Context& context, const std::string& identifier,
                      const std::optional<std::filesystem::path>& save);
 
+struct FeedbackReport {
+  std::string className;
+  std::string bytes;  ///< the message
+  std::int64_t queryId = 0;
+};
+ExitCode runReport(const Context& context, const FeedbackReport& report);
+
 // What its files tell.
+/// A session file, as far as it can be read; kExitError where that is not to its end.
+ExitCode runSessionFile(const Context& context, const std::filesystem::path& path);
 ExitCode runCounters(const Context& context, bool openMetrics);
 ExitCode runStatus(const Context& context);
 

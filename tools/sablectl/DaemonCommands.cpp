@@ -86,26 +86,6 @@ ExitCode runSessions(const Context& context) {
   });
 }
 
-ExitCode runFeedback(const Context& context) {
-  return withSession(context, [&](Session& session) {
-    const auto result = session.call(kSBLDaemonRelay, SBLDaemonRelay::feedback, {});
-    if (!result) return fail(context, result.error());
-    if (const auto error = decodeError(std::get<RelayRecord>((*result)[1]))) return fail(context, *error);
-    Dictionary entries = Dictionary::array();
-    for (const std::string& text : std::get<platform::RelayStrings>((*result)[0])) {
-      const auto parsed = parseJSON(text, text.size());
-      entries.push_back(parsed ? *parsed : Dictionary(text));
-    }
-    if (context.output.json) {
-      context.output.document(entries);
-    } else {
-      for (const Dictionary& entry : entries) context.output.line(plainText(entry));
-      if (entries.empty()) context.output.line("no feedback");
-    }
-    return kExitSuccess;
-  });
-}
-
 ExitCode runResource(const Context& context, const std::string& identifier,
                      const std::optional<std::filesystem::path>& save) {
   return withSession(context, [&](Session& session) {

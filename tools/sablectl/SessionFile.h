@@ -1,0 +1,15 @@
+#pragma once
+
+#include <string_view>
+
+#include "platform/Dictionary.h"
+
+namespace sable::sablectl {
+
+/// What a session file holds (docs/feedback.md has its layout), as far as it can be read: {"version":
+/// the user agent of the daemon that wrote it, "root": the session without its feedback, "records":
+/// [{"class", "query_id", "client_query_id", "message"}], "damage": {"offset", "reason"} of the record
+/// at which reading had to stop, in bytes, or null}. A version or root that is not there is null.
+Dictionary sessionFileDocument(std::string_view bytes);
+
+}  // namespace sable::sablectl
