@@ -33,7 +33,6 @@ using platform::RelayRecord;
 constexpr std::uint32_t kTraceSearchStart = 0x2b000004;
 constexpr std::uint32_t kTraceSearchEnd = 0x2b000008;
 constexpr std::uint32_t kTraceCard = 0x2b00000c;
-constexpr std::uint32_t kTraceFeedback = 0x2b000024;
 
 const platform::LogHandle& log() {
   return SableLogForCategory(SableLoggingCategoryConnection);
@@ -141,6 +140,8 @@ void ClientConnection::configure(SBLSessionConfiguration configuration, platform
 }
 
 void ClientConnection::failConfiguration() {
+  ClientSessionManager::reportErrorAsSabledFeedback(
+      makeSBLError(SBLErrorCode::daemonSide, "invalid configuration"), assembly_);
   log().fault("invalid configuration, closing connection");
   connection_->invalidate();
 }
@@ -281,21 +282,6 @@ void ClientConnection::search(const SBLSearchRequest& request, SBLReplyHandler r
                    reply(id, std::move(answer), std::move(error));
                    SBLTracePoint(kTraceSearchEnd);
                  });
-}
-
-void ClientConnection::reportEvent(platform::RelayCall& call) {
-  if (!_ensureState()) {
-    log().error("state must not be nil");
-  } else if (state_->sessionManager() == nullptr) {
-    log().error("session manager nil");
-  }
-  call.reply.send({});
-}
-
-void ClientConnection::feedback(platform::RelayReply reply) {
-  SBLTracePoint(kTraceFeedback);
-  _ensureState();
-  reply(platform::RelayStrings{}, RelayRecord{});
 }
 
 void ClientConnection::listSessions(platform::RelayReply reply) {

@@ -18,7 +18,9 @@ namespace sable {
 
 class Assembly;
 class ClientState;
+class FeedbackMessage;
 class SBLBag;
+struct ResultEngagement;
 
 /// How long a connection may be silent before the daemon closes it.
 inline constexpr platform::Duration kClientIdleTimeout = std::chrono::seconds(60);
@@ -42,8 +44,8 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   const platform::RelayConnection& connection() const { return *connection_; }
   const std::shared_ptr<ClientState>& state() const { return state_; }
 
-  /// Ends the client's session, where it has one of its own; tells whether it did. Called when the
-  /// connection has ended.
+  /// Ends the client's session, where it has one of its own; tells whether it did, on any queue.
+  /// Called when the connection has ended.
   void flushSessionInvalidation(platform::Function<void(bool)> callback);
 
  private:
@@ -64,7 +66,12 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void explain(platform::RelayCall& call);
   void fillDefaults(SBLRequest& request) const;
   void search(const SBLSearchRequest& request, SBLReplyHandler reply);
+  // Feedback. The sender of what is none loses its connection.
   void reportEvent(platform::RelayCall& call);
+  void reportPayload(std::unique_ptr<FeedbackMessage> message, std::int64_t queryId);
+  void reportLost(std::string reason, const char* logLine);
+  void handleCustomFeedback(std::unique_ptr<FeedbackMessage> message, std::int64_t queryId);
+  void noteEngagement(const ResultEngagement& engagement);
   void feedback(platform::RelayReply reply);
   void listSessions(platform::RelayReply reply);
   void fileHandleAndAttributesForResource(const std::string& identifier, platform::RelayReply reply);

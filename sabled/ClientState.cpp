@@ -146,12 +146,16 @@ void ClientState::warm() {
     request.standard("warm not required, connection still warm");
     return;
   }
+  auto warmRequest = assembly_.requestFactory->warmRequest(*url);
+  std::string uuid = startWarmFeedback(warmRequest);
   const auto task = assembly_.urlSession().dataTask(
-      assembly_.requestFactory->warmRequest(*url), [](platform::HTTPResult result) {
+      std::move(warmRequest),
+      [self = shared_from_this(), uuid = std::move(uuid)](const platform::HTTPResult& result) {
         SableLogForCategory(SableLoggingCategoryRequest)
             .standard("Status for warm request: ({}) error: ({})",
                       result.response ? result.response->status : 0,
                       result.error ? result.error->description() : "(null)");
+        self->endWarmFeedback(result, uuid);
       });
   if (assembly_.useBramble()) enableProxy(*task);
   task->resume();

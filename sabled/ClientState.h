@@ -16,10 +16,12 @@ namespace sable {
 class Assembly;
 class CachedResultSet;
 class ClientSessionManager;
+class FeedbackMessage;
 class QueryCache;
 class RequestTrace;
 class SBLBag;
 class SableUserGUIDController;
+struct SableAnswer;
 struct SearchExplanation;
 struct SearchResponse;
 
@@ -96,7 +98,7 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
                                                      RequestTrace* trace) const;
   void dispatch(const std::shared_ptr<Query>& query, std::optional<platform::HTTPRequest> request);
   void didComplete(Query& query, platform::HTTPResult result);
-  std::optional<Error> processAnswer(const Query& query, const Data& data);
+  std::optional<Error> processAnswer(const Query& query, const platform::HTTPResult& result);
   void _cacheResponse(const SearchResponse& response, const Query& query, const Data& data, const UUID& uuid);
   SBLReply replyWith(const Query& query, Data data) const;
   bool routesThroughProxy(const Query& query) const;
@@ -104,6 +106,20 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   void recordSearchResult(int status);
   void forceFetch(const platform::HTTPRequest& request);
   void count(std::string_view event);
+
+  // What a query leaves in the client's session. None waits.
+  bool isRecorded(const Query& query) const;
+  void record(const Query& query, std::unique_ptr<FeedbackMessage> message) const;
+  void skipSearchFeedback(const Query& query, Verdict verdict) const;
+  void cacheHitFeedback(const Query& query, const CachedResultSet& hit) const;
+  void startNetworkFeedback(const Query& query) const;
+  void endNetworkFeedback(const Query& query, const platform::HTTPResult& result,
+                          const SableAnswer& answer) const;
+  void failSearchFeedback(const Query& query, const platform::HTTPResult& result) const;
+  /// Records that a warm-up begins, as the daemon's own; its uuid is for the end.
+  std::string startWarmFeedback(const platform::HTTPRequest& request) const;
+  void endWarmFeedback(const platform::HTTPResult& result, const std::string& uuid) const;
+  void recordOfDaemon(std::unique_ptr<FeedbackMessage> message) const;
 
   Assembly& assembly_;
   const std::string identifier_;

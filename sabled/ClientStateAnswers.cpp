@@ -33,15 +33,17 @@ void ClientState::didComplete(Query& query, HTTPResult result) {
   }
   if (result.error || result.data == nullptr) {
     log.error("error with request {}", result.error ? result.error->description() : "(null)");
-    return query.reply(query.queryId, std::nullopt, result.error);
+    query.reply(query.queryId, std::nullopt, result.error);
+    return failSearchFeedback(query, result);
   }
   if (!result.response) {
     log.error("not http response? {}", "(null)");
-    return query.reply(query.queryId, std::nullopt,
-                       makeSBLError(SBLErrorCode::daemonSide, "invalid response class"));
+    query.reply(query.queryId, std::nullopt,
+                makeSBLError(SBLErrorCode::daemonSide, "invalid response class"));
+    return failSearchFeedback(query, result);
   }
 
-  std::optional<Error> parseError = processAnswer(query, result.data);
+  std::optional<Error> parseError = processAnswer(query, result);
   SBLReply reply = replyWith(query, std::move(result.data));
   if (query.verboseReply) {
     reply.httpRequest = query.httpRequest;
@@ -52,19 +54,20 @@ void ClientState::didComplete(Query& query, HTTPResult result) {
 }
 
 /// Takes from an answer what concerns the daemon; says why it is no JSON, if it is none.
-std::optional<Error> ClientState::processAnswer(const Query& query, const Data& data) {
-  const auto response = SearchResponse::parse(*data);
+std::optional<Error> ClientState::processAnswer(const Query& query, const HTTPResult& result) {
+  const auto response = SearchResponse::parse(*result.data);
   std::optional<Error> parseError = response ? std::nullopt : std::optional(response.error());
   if (response) {
     assembly_.clientStateManager->processImagesFromResponse(*response, *query.bag);
-    if (&query.kind == &kSearch) _cacheResponse(*response, query, data, assembly_.runtime.uuid());
+    if (&query.kind == &kSearch) _cacheResponse(*response, query, result.data, query.uuid);
   }
   if (query.kind.expectsObject && (!response || !response->isObject)) {
     // The missing word after "for" is part of the line that log readers match.
     query.log().error(
         "Failed to deserialize card details for into a dictionary. Error: {}. Response data: \"{}\"",
-        parseError ? parseError->description() : "(null)", *data);
+        parseError ? parseError->description() : "(null)", *result.data);
   }
+  endNetworkFeedback(query, result, response ? response->account : SableAnswer{});
   return parseError;
 }
 
@@ -91,6 +94,7 @@ std::shared_ptr<const CachedResultSet> ClientState::cachedAnswer(const SBLSearch
 void ClientState::answerFromCache(Query& query, const CachedResultSet& hit) {
   query.reply(query.queryId, replyWith(query, hit.data), std::nullopt);
   count("ondevicecachehits");
+  cacheHitFeedback(query, hit);
 }
 
 void ClientState::_cacheResponse(const SearchResponse& response, const Query& query, const Data& data,

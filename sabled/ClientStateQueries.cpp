@@ -27,9 +27,10 @@ using platform::HTTPResult;
 
 ClientState::Query ClientState::makeQuery(const QueryKind& kind, const SBLRequest& request,
                                           const std::string& input, SBLReplyHandler reply) const {
-  Query query(kind, request, input, std::move(reply));
-  const std::string agent = lowercasedASCII(userAgent().value_or(""));
-  if (agent.find("messages") != std::string::npos) query.fieldMask = kSBLFieldMaskNoLocation;
+  Query query(kind, request, input, userAgent().value_or(""), std::move(reply));
+  if (lowercasedASCII(query.userAgent).find("messages") != std::string::npos) {
+    query.fieldMask = kSBLFieldMaskNoLocation;
+  }
   return query;
 }
 
@@ -65,7 +66,8 @@ ClientState::Verdict ClientState::judge(Query& query, SearchExplanation* why) {
 
 bool ClientState::refuses(Query& query) {
   std::optional<Error> error;
-  switch (judge(query, nullptr)) {
+  const Verdict verdict = judge(query, nullptr);
+  switch (verdict) {
     case Verdict::passes:
       return false;
     case Verdict::bagMissing:
@@ -81,6 +83,7 @@ bool ClientState::refuses(Query& query) {
       break;
   }
   query.reply(query.queryId, std::nullopt, std::move(error));
+  skipSearchFeedback(query, verdict);
   return true;
 }
 
@@ -126,6 +129,7 @@ void ClientState::lookup(const SBLLookupRequest& request, SBLReplyHandler reply)
   const auto query = begin(kLookup, request, request.queryString, std::move(reply));
   if (refuses(*query)) return;
   query->expire = assembly_.runtime.now() + platform::fromSeconds(query->bag->searchRenderTimeout());
+  query->lookupSelectionType = request.lookupSelectionType;
   dispatch(query,
            assembly_.requestFactory->lookupRequest(request, *query->bag, guidController_->currentUserGUID()));
 }
@@ -159,6 +163,8 @@ void ClientState::dispatch(const std::shared_ptr<Query>& query, std::optional<HT
   query->log().info(fmt::runtime(kind.dispatching), identifier_, query->queryId, query->input, "");
   query->log().info("request: {} header: {}", query->httpRequest.url,
                     query->httpRequest.headers.description());
+  query->uuid = assembly_.runtime.uuid();
+  startNetworkFeedback(*query);
 
   auto retryable = std::make_shared<SBLRetryableNetworkRequest>(
       SBLRetryableNetworkRequest{query->httpRequest, query->expire, kind.delayOnFail});

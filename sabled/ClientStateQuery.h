@@ -30,31 +30,43 @@ struct ClientState::QueryKind {
   bool hasMinimumLength = false;
   const char* fetchFailed = nullptr;  ///< {0} HTTP status, {1} error
   bool expectsObject = false;
+  bool isRecorded = false;  ///< in the client's session
 };
 
 /// A query under way.
 struct ClientState::Query {
-  Query(const QueryKind& queryKind, const SBLRequest& request, std::string text, SBLReplyHandler handler)
+  Query(const QueryKind& queryKind, const SBLRequest& request, std::string text, std::string agent,
+        SBLReplyHandler handler)
       : kind(queryKind),
         queryId(request.queryId),
+        clientQueryId(request.clientQueryId),
+        triggerEvent(request.triggerEvent),
         scale(request.scale),
         verboseReply(request.verboseReply),
         input(std::move(text)),
+        userAgent(std::move(agent)),
         reply(std::move(handler)) {}
 
   const platform::LogHandle& log() const { return SableLogForCategory(kind.category); }
+  /// The input as feedback tells it. What somebody selected to look it up stays on the device.
+  std::string_view recordedInput() const { return kind.hasMinimumLength ? input : std::string_view(); }
 
   const QueryKind& kind;
   const std::uint64_t queryId;
+  const std::uint64_t clientQueryId;
+  const std::int64_t triggerEvent;
   const double scale;
   const bool verboseReply;
   const std::string input;
+  const std::string userAgent;
   SBLReplyHandler reply;
 
   std::shared_ptr<const SBLBag> bag;
   unsigned fieldMask = 0;
   std::optional<platform::WallTime> expire;
+  std::optional<std::int64_t> lookupSelectionType;  ///< of lookups
   platform::HTTPRequest httpRequest;
+  UUID uuid;  ///< of the request, in its feedback and in what is cached of its answer
 };
 
 }  // namespace sable

@@ -14,6 +14,7 @@ const ClientState::QueryKind ClientState::kSearch{
     .retries = 0,
     .delayOnFail = false,
     .hasMinimumLength = true,
+    .isRecorded = true,
 };
 
 const ClientState::QueryKind ClientState::kZeroKeyword{
@@ -26,6 +27,7 @@ const ClientState::QueryKind ClientState::kZeroKeyword{
     .mayUseProxy = false,
     .retries = 0,
     .delayOnFail = false,
+    .isRecorded = true,
 };
 
 const ClientState::QueryKind ClientState::kLookup{
@@ -38,6 +40,7 @@ const ClientState::QueryKind ClientState::kLookup{
     .mayUseProxy = true,
     .retries = 2,  // within the time a rendered page waits for them
     .delayOnFail = false,
+    .isRecorded = true,
 };
 
 const ClientState::QueryKind ClientState::kMoreResults{

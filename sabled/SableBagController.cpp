@@ -14,9 +14,13 @@
 #include "platform/UserDefaults.h"
 #include "sabled/Assembly.h"
 #include "sabled/ClientNames.h"
+#include "sabled/ClientSession.h"
+#include "sabled/DaemonFeedback.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SBLRetryableNetworkRequest.h"
+#include "sabled/SableFeedback.h"
 #include "sabled/SableLogging.h"
+#include "sabled/SableUserGUIDController.h"
 #include "sabled/UserAgent.h"
 
 namespace sable {
@@ -80,6 +84,17 @@ bool isOlderVersion(std::string_view a, std::string_view b) {
   }
   return a.empty() && !b.empty();
 }
+
+/// A fetch's session; every feedback in it has the session's agent and user GUID.
+struct SableBagController::FetchRecord {
+  std::string uuid;
+  std::shared_ptr<ClientSession> session;
+
+  void add(feedback::Message message) const {
+    session->addFeedback(
+        std::make_shared<SableFeedback>(std::move(message), 0, session->userGuid(), session->agent()));
+  }
+};
 
 SableBagController::SableBagController(Assembly& assembly)
     : assembly_(assembly),
@@ -222,28 +237,44 @@ void SableBagController::_fetchBagStateWithVersion(const std::string& version) {
   request->delayOnFail = true;
   log().standard("Initiating bag fetch attempt with request {} header {}", request->httpRequest.url,
                  request->httpRequest.headers.description());
-  auto completion = [this, transaction = std::move(transaction)](const HTTPResult& result) {
-    fetchDidComplete(userAgent_, result);
-  };
+  auto completion = [this, transaction = std::move(transaction), record = beginRecord(request->httpRequest)](
+                        const HTTPResult& result) { fetchDidComplete(record, result); };
   dataTaskWithRetryableRequest(assembly_.runtime, assembly_.bagSession(), std::move(request), 1,
                                kFetchRetries, std::move(completion))
       ->resume();
 }
 
-void SableBagController::fetchDidComplete(const std::string& userAgent, const HTTPResult& result) {
+SableBagController::FetchRecord SableBagController::beginRecord(const platform::HTTPRequest& request) const {
+  const std::string uuid = assembly_.runtime.uuid().string();
+  auto start =
+      feedback::startNetworkSearch(assembly_.runtime.ticks(), {.triggerEvent = feedback::kBagTrigger,
+                                                               .endpoint = feedback::Endpoint::sableBag,
+                                                               .input = "",
+                                                               .request = request,
+                                                               .uuid = uuid});
+  // The first fetch may be under way before there are user GUIDs.
+  std::optional<UUID> userGuid;
+  if (assembly_.guidController != nullptr) userGuid = assembly_.guidController->currentUserGUID();
+  const auto first = std::make_shared<SableFeedback>(std::move(start), 0, userGuid, userAgent_);
+  return {uuid, std::make_shared<ClientSession>(assembly_, first)};
+}
+
+void SableBagController::fetchDidComplete(const FetchRecord& record, const HTTPResult& result) {
   log().info("resp: {}", result.response ? result.response->description() : "(null)");
-  const Expected<Bag> bag = bagFromResult(userAgent, result);
+  record.add(feedback::endNetworkSearch(assembly_.runtime.ticks(), feedback::endOf(result, record.uuid)));
+  const Expected<Bag> bag = bagFromResult(result);
   if (bag) {
     cacheBagState(*bag, false);
     assembly_.tally.add("com.kestrel.sabled.bag.fetches", 1);
   } else {
+    record.add(feedback::error(assembly_.runtime.ticks(), bag.error()));
     assembly_.tally.add("com.kestrel.sabled.bag.fetchesfailed", 1);
   }
+  record.session->sessionComplete();
   fetchInProgress_ = false;
 }
 
-Expected<SableBagController::Bag> SableBagController::bagFromResult(const std::string& userAgent,
-                                                                    const HTTPResult& result) {
+Expected<SableBagController::Bag> SableBagController::bagFromResult(const HTTPResult& result) {
   if (result.error) {
     log().error("Error fetching bag: {}", result.error->description());
     return tl::unexpected(*result.error);
@@ -266,7 +297,7 @@ Expected<SableBagController::Bag> SableBagController::bagFromResult(const std::s
     return tl::unexpected(networkError("not JSON object"));
   }
   log().info("Got bag: {}", *result.data);
-  return std::make_shared<const SBLBag>(cacheBagDictionary(std::move(*parsed)), userAgent);
+  return std::make_shared<const SBLBag>(cacheBagDictionary(std::move(*parsed)), userAgent_);
 }
 
 }  // namespace sable

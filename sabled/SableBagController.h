@@ -61,8 +61,11 @@ class SableBagController {
   bool _isRefreshRequiredForCachedBag(const Dictionary& cached);
   void _handleRefreshNotification();
   void _fetchBagStateWithVersion(const std::string& version);
-  void fetchDidComplete(const std::string& userAgent, const platform::HTTPResult& result);
-  Expected<Bag> bagFromResult(const std::string& userAgent, const platform::HTTPResult& result);
+  struct FetchRecord;
+  /// Opens the session of a fetch.
+  FetchRecord beginRecord(const platform::HTTPRequest& request) const;
+  void fetchDidComplete(const FetchRecord& record, const platform::HTTPResult& result);
+  Expected<Bag> bagFromResult(const platform::HTTPResult& result);
   Bag inMemoryBag() const;
 
   Assembly& assembly_;
