@@ -178,7 +178,10 @@ TEST(Folders, ADaemonThatCanKeepNothingStillAnswers) {
   const std::string log = world.daemonErrors();
   EXPECT_EQ(occurrences(log, "counters are kept in memory only"), 1u) << log;
   // The bag misses its folder twice, to read and to write; session files miss it once.
-  EXPECT_EQ(occurrences(log, "Z error "), 6u) << log;
+  // The session that notes when the clients go misses its file, perhaps later.
+  const auto sessions = occurrences(log, "Could not get a file url");
+  EXPECT_LE(sessions, 1u) << log;
+  EXPECT_EQ(occurrences(log, "Z error ") - sessions, 6u) << log;
 }
 
 TEST(BagFile, IsABinaryPropertyListForItsOwnerOnly) {
