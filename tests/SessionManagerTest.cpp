@@ -18,7 +18,6 @@
 namespace sable::test {
 namespace {
 
-using feedback::SessionEndReason;
 using Records = std::vector<std::string>;
 
 class Sessions : public testing::Test {
