@@ -26,6 +26,7 @@ class Sessions : public testing::Test {
   void start(bool shared = true) {
     device.platform.userDefaults().setByUser("SBLSharedSession", shared);
     device.start();
+    ended();  // the bag's fetch was one
     for (const auto name : {kSBLSessionSoftLimitNotification, kSBLSessionMaxLimitNotification,
                             kSBLUserGUIDChangeNotification}) {
       observations.push_back(device.assembly().notificationCenter.observe(
