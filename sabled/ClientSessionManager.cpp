@@ -79,7 +79,7 @@ void ClientSessionManager::Sessions::add(const std::shared_ptr<SableFeedback>& f
 }
 
 bool ClientSessionManager::Sessions::isWanted(const SableFeedback& feedback) const {
-  const auto bag = assembly_.bagController->currentBag();
+  const auto bag = assembly_.bagController->inMemoryBag();
   return bag == nullptr || SBLBag(bag->rawBag(), feedback.userAgent()).feedbackEnabled();
 }
 

@@ -47,6 +47,8 @@ class SableBagController {
   /// The bag, which may be stale, or null after starting a fetch.
   std::shared_ptr<const SBLBag> currentBag();
   std::optional<std::string> warmURL();
+  /// The bag as it is held, or null; whether it is stale is not looked at, which costs a request's URL.
+  std::shared_ptr<const SBLBag> inMemoryBag() const;
 
   /// What the service announced: {"bag": newest version}. Fetches when the bag in memory is older.
   void forceFetchBag(const Dictionary& announcement);
@@ -66,7 +68,6 @@ class SableBagController {
   FetchRecord beginRecord(const platform::HTTPRequest& request) const;
   void fetchDidComplete(const FetchRecord& record, const platform::HTTPResult& result);
   Expected<Bag> bagFromResult(const platform::HTTPResult& result);
-  Bag inMemoryBag() const;
 
   Assembly& assembly_;
   const std::string userAgent_;
