@@ -54,7 +54,7 @@ class ClientSessionManager::Sessions : public std::enable_shared_from_this<Sessi
   std::shared_ptr<FeedbackSession> session;
 
  private:
-  bool isWanted(const SableFeedback& feedback) const;
+  bool isWanted(const SableFeedback& feedback);
   SessionEvent eventOf(const SableFeedback& feedback) const;
   void _setNewSession(const std::shared_ptr<SableFeedback>& feedback);
   void _flushSessionWithReason(SessionEndReason reason, platform::Function<void()> callback);
@@ -69,6 +69,7 @@ class ClientSessionManager::Sessions : public std::enable_shared_from_this<Sessi
   Assembly& assembly_;
   std::uint64_t sessionCounter_ = 0;  ///< tells a timer whether its session is still the current one
   SessionEndReason flushReason_ = SessionEndReason::noPreviousSession;
+  std::shared_ptr<const SBLBag> bagOfLastAgent_;  ///< kept, for a client reports many things in a row
 };
 
 void ClientSessionManager::Sessions::add(const std::shared_ptr<SableFeedback>& feedback) {
@@ -78,9 +79,14 @@ void ClientSessionManager::Sessions::add(const std::shared_ptr<SableFeedback>& f
   expirationTime = assembly_.runtime.now() + kSessionIdleTime;
 }
 
-bool ClientSessionManager::Sessions::isWanted(const SableFeedback& feedback) const {
+bool ClientSessionManager::Sessions::isWanted(const SableFeedback& feedback) {
   const auto bag = assembly_.bagController->inMemoryBag();
-  return bag == nullptr || SBLBag(bag->rawBag(), feedback.userAgent()).feedbackEnabled();
+  if (bag == nullptr) return true;
+  if (bagOfLastAgent_ == nullptr || bagOfLastAgent_->rawBag() != bag->rawBag() ||
+      bagOfLastAgent_->userAgent() != feedback.userAgent()) {
+    bagOfLastAgent_ = std::make_shared<const SBLBag>(bag->rawBag(), feedback.userAgent());
+  }
+  return bagOfLastAgent_->feedbackEnabled();
 }
 
 SessionEvent ClientSessionManager::Sessions::eventOf(const SableFeedback& feedback) const {
