@@ -82,6 +82,13 @@ TEST_F(Requests, TheBagIsAskedForWithWhatItsUrlDependsOn) {
                                      {"X-Kestrel-Languages", R"(["en-GB","de","fr"])"}}));
 }
 
+TEST_F(Requests, AWarmUpCarriesNothingAtAll) {
+  const json request = only("/warm", {"report", "RKSearchViewAppearFeedback", "viewAppearEvent=2"});
+  EXPECT_EQ(request["method"], "GET");
+  EXPECT_EQ(items(request), Pairs());
+  EXPECT_EQ(headers(request), Pairs());
+}
+
 TEST_F(Requests, ASearchCarriesTheWholeContext) {
   const json request = only("/search", {"search", "weather; now", "--trigger", "8"});
   EXPECT_EQ(items(request), (Pairs{{"24h", "1"},
