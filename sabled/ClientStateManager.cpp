@@ -142,9 +142,9 @@ void ClientStateManager::handleEndpointCall(platform::RelayCall call) {
   using platform::RelayRecord;
   if (call.method == SBLEndpointRelay::loadImages) {
     return loadImages(decodeImageDescriptions(std::get<platform::RelayRecords>(call.arguments[0])),
-                      std::get<std::uint64_t>(call.arguments[1]), [&](Images images) {
+                      std::get<std::uint64_t>(call.arguments[1]), [&](const Images& images) {
                         platform::RelayDataMap map;
-                        for (auto& [name, image] : images) map.entries.emplace_back(name, std::move(image));
+                        for (const auto& [name, image] : images) map.entries.emplace_back(name, image);
                         call.reply(std::move(map));
                       });
   }

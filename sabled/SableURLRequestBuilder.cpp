@@ -56,12 +56,11 @@ void SableURLRequestBuilder::forceQueryItemsFromArray(const std::vector<URLQuery
   for (const URLQueryItem& item : items) forceQueryItem(item);
 }
 
-void SableURLRequestBuilder::defaultQueryItem(URLQueryItem item) {
+void SableURLRequestBuilder::defaultQueryItem(const URLQueryItem& item) {
   if (trace_ != nullptr) {
     trace_->noteDefault(Place::queryItem, item.name, item.value.value_or(""), queryItemValue(item.name));
   }
-  std::string name = item.name;
-  queryItems_.try_emplace(std::move(name), std::move(item));
+  queryItems_.try_emplace(item.name, item);
 }
 
 void SableURLRequestBuilder::defaultQueryItemWithName(std::string_view name,

@@ -32,7 +32,7 @@ class SableURLRequestBuilder {
   void forceQueryItem(platform::URLQueryItem item);
   void forceQueryItemWithName(std::string_view name, std::optional<std::string> value);
   void forceQueryItemsFromArray(const std::vector<platform::URLQueryItem>& items);
-  void defaultQueryItem(platform::URLQueryItem item);
+  void defaultQueryItem(const platform::URLQueryItem& item);
   void defaultQueryItemWithName(std::string_view name, std::optional<std::string> value);
 
   bool containsHttpHeaderWithName(std::string_view name) const;
