@@ -60,7 +60,7 @@ void throughput(double least, int argc, char** argv) {
   world.startDaemon();
   Client first(world.socket());
   first.search(kTyped, Client::Outcome::answer);
-  const RawServer server(world.path("raw.sock"), first.sizes(kTyped, Client::Outcome::answer));
+  const RawServer server(world.path("raw.sock"), first.sizes(kTyped, Client::Outcome::answer), 1);
   std::vector<double> raw, daemon;
   for (int round = 0; round < kThroughputRounds; ++round) {
     raw.push_back(callsPerSecond(kClients, kCallsInARound, [&] {

@@ -18,8 +18,10 @@ constexpr int kClients = 8;
 constexpr int kThroughputRounds = 10;
 
 struct Setup {
+  explicit Setup(unsigned threads = RawServer::kThreads) : server(world.path("raw.sock"), sizes(), threads) {}
+
   World world;
-  RawServer server{world.path("raw.sock"), sizes()};
+  RawServer server;
 
  private:
   Client::Sizes sizes() {
@@ -53,7 +55,7 @@ void roundTrips(Placement placement, std::optional<double> bound, int argc, char
 }
 
 void throughput(const std::string& name, int argc, char** argv) {
-  const Setup setup;
+  const Setup setup(1);
   std::vector<double> raw, daemon;
   for (int round = 0; round < kThroughputRounds; ++round) {
     raw.push_back(callsPerSecond(kClients, kCallsInARound, [&] {

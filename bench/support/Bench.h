@@ -185,7 +185,11 @@ int connectTo(const std::string& path);
 /// The floor of a call: the same numbers of bytes through a Unix socket, served by raw_server.
 class RawServer {
  public:
-  RawServer(std::string path, Client::Sizes sizes);
+  /// For round trips as many threads as the daemon has, so that the scheduler places both alike. The
+  /// calls of many clients are held against the plainest server, with one.
+  static constexpr unsigned kThreads = 2;
+
+  RawServer(std::string path, Client::Sizes sizes, unsigned threads = kThreads);
   pid_t pid() const { return process_.pid(); }
   int connect() const;
   /// One call.

@@ -134,17 +134,17 @@ int connectTo(const std::string& path) {
   return -1;
 }
 
-RawServer::RawServer(std::string path, Client::Sizes sizes)
+RawServer::RawServer(std::string path, Client::Sizes sizes, unsigned threads)
     : path_(std::move(path)), sizes_(sizes), listener_(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0)) {
   const sockaddr_un address = addressOf(path_);
   if (::bind(listener_, reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0 ||
       ::listen(listener_, 16) != 0) {
     fail("the floor's server cannot listen");
   }
-  process_ = Child([this] {
+  process_ = Child([this, threads] {
     ::dup2(listener_, STDIN_FILENO);
     ::execl(RAW_SERVER_PROGRAM, "raw_server", std::to_string(sizes_.request).c_str(),
-            std::to_string(sizes_.reply).c_str(), nullptr);
+            std::to_string(sizes_.reply).c_str(), std::to_string(threads).c_str(), nullptr);
   });
   ::close(listener_);
 }

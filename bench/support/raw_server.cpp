@@ -1,11 +1,10 @@
 // The floor of a call, a program as the daemon is one, so that the scheduler treats it the same way: answers
-// so many bytes for so many, on the connections of the listening socket that is its standard input. Threads
-// wait on a one-shot epoll set, as many as the daemon's.
+// so many bytes for so many, on the connections of the listening socket that is its standard input, with so
+// many threads that wait on a one-shot epoll set.
 #include <sys/epoll.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cstdlib>
 #include <thread>
 
@@ -40,10 +39,10 @@ struct Server {
 }  // namespace
 
 int main(int argc, char** argv) {
-  if (argc != 3) return 2;
+  if (argc != 4) return 2;
   const Server server{std::strtoul(argv[1], nullptr, 10), std::strtoul(argv[2], nullptr, 10)};
   server.wait(EPOLL_CTL_ADD, STDIN_FILENO);
-  for (unsigned i = 1; i < std::max(2U, std::thread::hardware_concurrency()); ++i) {
+  for (unsigned long i = 1; i < std::strtoul(argv[3], nullptr, 10); ++i) {
     std::thread([&] { server.serve(); }).detach();
   }
   server.serve();
