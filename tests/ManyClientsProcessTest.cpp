@@ -113,9 +113,11 @@ TEST_F(ManyClients, ThoseWhoLeaveLeaveNothingBehind) {
   const auto descriptorsBefore = descriptors();
   const std::int64_t before = residentKiB();
   cycle(kCycles);
-  // A search is answered after all who came before have been accepted, not after they are gone.
+  // A search is answered after all who came before have been accepted, not after they are gone; answered
+  // from the cache, it may be quicker than their end.
+  constexpr int kPatience = 20'000;
   TestClient last(runtime_, world_.address());
-  for (int i = 0; i < 100 && descriptors() > descriptorsBefore + 4; ++i) last.search("dog");
+  for (int i = 0; i < kPatience && descriptors() > descriptorsBefore + 4; ++i) last.search("dog");
   EXPECT_LE(descriptors(), descriptorsBefore + 4);
   if (!kSanitized) {
     EXPECT_LT(residentKiB() - before, 4 << 10);
