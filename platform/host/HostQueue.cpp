@@ -2,6 +2,8 @@
 
 #include <fmt/core.h>
 
+#include <thread>
+
 #include "platform/ProgrammingError.h"
 #include "platform/host/RunningQueue.h"
 
@@ -10,6 +12,7 @@ namespace sable::platform::host {
 namespace {
 
 constexpr int kItemsInARow = 32;  // then other queues have a turn
+constexpr int kLooksBeforeSleep = 20;
 
 }  // namespace
 
@@ -48,6 +51,12 @@ bool HostQueue::tryRunInline(Function<void()>& work) {
 void HostQueue::runSync(Function<void()> work) {
   if (isCurrent()) programmingError(fmt::format("sync onto queue {} from its own work", label_));
   Lock lock(mutex_);
+  // Most work is over sooner than this thread could fall asleep and be woken.
+  for (int i = 0; i < kLooksBeforeSleep && state_ == State::running && items_.empty(); ++i) {
+    lock.unlock();
+    std::this_thread::yield();
+    lock.lock();
+  }
   const RunningQueue running(this);
   if (state_ == State::running || !items_.empty()) {
     Waiter waiter;
