@@ -38,6 +38,11 @@ const platform::LogHandle& log() {
   return SableLogForCategory(SableLoggingCategoryConnection);
 }
 
+/// What was typed before the newest search is no longer of interest.
+bool isNewer(std::uint64_t queryId, std::uint64_t newest) {
+  return queryId > newest;
+}
+
 }  // namespace
 
 ClientConnection::ClientConnection(Assembly& assembly, std::shared_ptr<platform::RelayConnection> connection)
@@ -256,9 +261,10 @@ void ClientConnection::explain(platform::RelayCall& call) {
   fillDefaults(*request);
   SearchExplanation why;
   const std::uint64_t newest = currentQueryId_.load();
-  const bool isNewer = why.gate("query id", fmt::format("{}", request->queryId),
-                                fmt::format("greater than {}", newest), request->queryId > newest);
-  if (isNewer) state_->explain(*request, why);
+  if (why.gate("query id", fmt::format("{}", request->queryId), fmt::format("greater than {}", newest),
+               isNewer(request->queryId, newest))) {
+    state_->explain(*request, why);
+  }
   call.reply(why.json());
 }
 
@@ -266,7 +272,7 @@ void ClientConnection::search(const SBLSearchRequest& request, SBLReplyHandler r
   SBLTracePoint(kTraceSearchStart);
   const std::uint64_t queryId = request.queryId;
   std::uint64_t current = currentQueryId_.load();
-  if (queryId <= current || !currentQueryId_.compare_exchange_strong(current, queryId)) {
+  if (!isNewer(queryId, current) || !currentQueryId_.compare_exchange_strong(current, queryId)) {
     reply(queryId, std::nullopt, std::nullopt);
     SBLTracePoint(kTraceSearchEnd);
     return;
