@@ -25,9 +25,9 @@ class RelayInlet {
   [[nodiscard]] int start();
 
   /// Lets sd-bus read on, which must have read all that it was let. Adds to `messages` those whose end it
-  /// will find. 0: there is nothing to read, and sd-bus must not try unless after detach(); -ECONNRESET: the
-  /// peer left; -EBADMSG: that is no message; -EMSGSIZE: it is too large; -EOPNOTSUPP: descriptors came with
-  /// it.
+  /// will find. 0: there is nothing to read before the socket is readable again, and sd-bus must not try
+  /// unless after detach(); -ECONNRESET: the peer left; -EBADMSG: that is no message; -EMSGSIZE: it is too
+  /// large; -EOPNOTSUPP: descriptors came with it.
   [[nodiscard]] int admit(std::size_t& messages);
 
   /// Whether sd-bus reads the socket itself: then it must stop at the last of the messages.
@@ -55,6 +55,7 @@ class RelayInlet {
   std::string line_;    // of the handshake, that has not come whole
   std::string fixed_;   // bytes of a message's fixed part that has not come whole
   std::size_t messageLeft_ = 0;
+  bool lookedToTheEnd_ = false;  // of what had come when it was let read
 };
 
 }  // namespace sable::platform::host
