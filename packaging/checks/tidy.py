@@ -67,7 +67,7 @@ def main(build):
     commands = [c for c in json.loads(pathlib.Path(build, "compile_commands.json").read_text())
                 if os.path.relpath(c["file"], ROOT).split("/")[0] in PRODUCT]
     version = subprocess.run(["clang-tidy", "--version"], capture_output=True, text=True, check=True).stdout
-    common = version + (ROOT / ".clang-tidy").read_text()
+    common = version + "".join(path.read_text() for path in (ROOT / ".clang-tidy", ROOT / "tools/.clang-tidy"))
     headers = recorded_headers(build)
     STAMPS.mkdir(parents=True, exist_ok=True)
     due = {key(c, headers.get(object_of(c), []), common): c for c in commands}
