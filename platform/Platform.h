@@ -7,6 +7,7 @@
 namespace sable::platform {
 
 class AccountStore;
+class ActivityScheduler;
 class CountryConfiguration;
 class DeviceInfo;
 class FileManager;
@@ -45,6 +46,7 @@ class Platform {
   virtual HTTPSessions& httpSessions() = 0;
   virtual Transactions& transactions() = 0;
   virtual MemoryPressure& memoryPressure() = 0;
+  virtual ActivityScheduler& activityScheduler() = 0;
 
   virtual DeviceInfo& deviceInfo() = 0;
   virtual LocaleInfo& localeInfo() = 0;

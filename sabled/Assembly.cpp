@@ -6,6 +6,7 @@
 #include "platform/NotificationCenter.h"
 #include "platform/Tally.h"
 #include "platform/UserDefaults.h"
+#include "sabled/BackgroundFlusher.h"
 #include "sabled/ClientSessionManager.h"
 #include "sabled/ClientStateManager.h"
 #include "sabled/ImageFetcher.h"

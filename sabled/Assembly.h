@@ -11,6 +11,7 @@ class HTTPSession;
 
 namespace sable {
 
+class BackgroundFlusher;
 class ClientSessionManager;
 class ClientStateManager;
 class ImageFetcher;
@@ -42,6 +43,7 @@ class Assembly {
   // Destroyed in reverse order: what is built on others goes first.
   std::unique_ptr<SBLNetworkRequestFactory> requestFactory;
   std::unique_ptr<SablePersistentStorage> persistentStorage;
+  std::unique_ptr<BackgroundFlusher> backgroundFlusher;
   std::unique_ptr<SableUserGUIDController> guidController;
   /// Of the daemon itself, and of all clients where they share a session.
   std::unique_ptr<ClientSessionManager> clientSessionManager;

@@ -30,6 +30,7 @@ struct Folders {
   std::filesystem::path userFacts() const { return config / "facts.toml"; }
   std::filesystem::path counters() const { return state / "counters.tally"; }
   std::filesystem::path interactions() const { return state / "activity" / "interactions.jsonl"; }
+  std::filesystem::path activityRuns() const { return state / "activity" / "runs.json"; }
 
   /// Each folder is the first that is set of: its own variable (SABLED_RUNTIME_DIR, SABLED_CACHES_DIR,
   /// SABLED_STATE_DIR, SABLED_CONFIG_DIR; SABLED_PROFILE for the profile's file), the XDG variable

@@ -9,6 +9,7 @@
 #include "platform/Log.h"
 #include "platform/ManagedConfiguration.h"
 #include "platform/MapsService.h"
+#include "platform/TimedActivityScheduler.h"
 #include "platform/host/ConfigurationSchema.h"
 #include "platform/host/LocaleNames.h"
 
@@ -26,8 +27,8 @@ struct Subject {
   Answer answer = nullptr;
 };
 
-const std::array<Subject, 7>& subjects() {
-  static const std::array<Subject, 7> all{
+const std::array<Subject, 8>& subjects() {
+  static const std::array<Subject, 8> all{
       Subject{kCurrentLocaleDidChangeNotification,
               {"calendar", "measurement_system", "temperature_unit", "preferred_languages", "system_language",
                "hour_cycle_24"},
@@ -41,6 +42,7 @@ const std::array<Subject, 7>& subjects() {
               {"managed_account", "music_subscription_status", "storefront"}},
       Subject{kMapsServiceDidChangeNotification, {"geo_session_id", "geo_environment", "geo_metadata"}},
       Subject{kLocationFactsDidChangeNotification, {"location"}},
+      Subject{kPowerSourceDidChangeNotification, {"on_battery"}},
   };
   return all;
 }

@@ -8,6 +8,7 @@
 #include "platform/ScriptLanguageTagger.h"
 #include "platform/host/FactFacilities.h"
 #include "platform/host/Folders.h"
+#include "platform/host/HostActivityScheduler.h"
 #include "platform/host/HostDeviceInfo.h"
 #include "platform/host/HostFacts.h"
 #include "platform/host/HostFileManager.h"
@@ -82,6 +83,7 @@ struct HostPlatform::Facilities {
   Lazy<HostAccountStore> accountStore;
   Lazy<HostMapsService> mapsService;
   Lazy<HostUserActivity> userActivity;
+  Lazy<HostActivityScheduler> activityScheduler;
 };
 
 HostPlatform::HostPlatform(HostPlatformConfiguration configuration)
@@ -145,6 +147,13 @@ MemoryPressure& HostPlatform::memoryPressure() {
   MemoryPressurePaths paths;
   paths.file = pressureFile(facilities_->hostFacts());
   return facilities_->memoryPressure.get(facilities_->runtime.reactor(), std::move(paths));
+}
+
+ActivityScheduler& HostPlatform::activityScheduler() {
+  auto& facilities = *facilities_;
+  return facilities.activityScheduler.get(facilities.runtime, facilities.notificationCenter,
+                                          facilities.hostFacts(), facilities.fileManager,
+                                          facilities.folders.activityRuns());
 }
 
 DeviceInfo& HostPlatform::deviceInfo() {

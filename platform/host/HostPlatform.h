@@ -33,6 +33,7 @@ class HostPlatform final : public Platform {
   HTTPSessions& httpSessions() override;
   Transactions& transactions() override;
   MemoryPressure& memoryPressure() override;
+  ActivityScheduler& activityScheduler() override;
 
   DeviceInfo& deviceInfo() override;
   LocaleInfo& localeInfo() override;

@@ -4,6 +4,7 @@
 #include "platform/NotificationCenter.h"
 #include "platform/Platform.h"
 #include "platform/ScriptLanguageTagger.h"
+#include "platform/simulated/SimulatedActivityScheduler.h"
 #include "platform/simulated/SimulatedFacts.h"
 #include "platform/simulated/SimulatedFileManager.h"
 #include "platform/simulated/SimulatedHTTP.h"
@@ -37,6 +38,7 @@ class SimulatedPlatform final : public Platform {
   SimulatedHTTPSessions& httpSessions() override { return httpSessions_; }
   SimulatedTransactions& transactions() override { return transactions_; }
   SimulatedMemoryPressure& memoryPressure() override { return memoryPressure_; }
+  SimulatedActivityScheduler& activityScheduler() override { return activityScheduler_; }
 
   SimulatedDeviceInfo& deviceInfo() override { return deviceInfo_; }
   SimulatedLocaleInfo& localeInfo() override { return localeInfo_; }
@@ -77,6 +79,7 @@ class SimulatedPlatform final : public Platform {
   SimulatedProcess process_{runtime_};
   SimulatedRelay relay_{runtime_};
   SimulatedHTTPSessions httpSessions_{runtime_};
+  SimulatedActivityScheduler activityScheduler_{runtime_, notificationCenter_};
 };
 
 }  // namespace sable::platform::simulated
