@@ -3,6 +3,7 @@
 #include <cstdint>
 #include <optional>
 #include <string_view>
+#include <tl/expected.hpp>
 
 namespace sable {
 
@@ -18,6 +19,9 @@ class ArchivedDataIterator {
   /// The payload of the next record; nothing, and a log line, when there is none that is whole.
   std::optional<std::string_view> readNextObject();
 
+  /// Passes over the next record; false when there is none that is whole. Logs nothing.
+  bool skipNextObject() { return next().has_value(); }
+
   /// Whether a length could follow. Its payload, which may be missing, is not looked at: then
   /// readNextObject() tells.
   bool hasMore() const { return data_.size() - position_ >= kArchivedLengthBytes; }
@@ -25,6 +29,8 @@ class ArchivedDataIterator {
   std::uint64_t position() const { return position_; }
 
  private:
+  tl::expected<std::string_view, std::string_view> next();
+
   const std::string_view data_;
   std::uint64_t position_ = 0;  ///< never past the end
 };

@@ -12,6 +12,7 @@
 #include "sabled/Assembly.h"
 #include "sabled/ClientNames.h"
 #include "sabled/DaemonFeedback.h"
+#include "sabled/FeedbackLedger.h"
 #include "sabled/FileContainer.h"
 #include "sabled/ParsedMessage.h"
 #include "sabled/SableFeedback.h"
@@ -161,13 +162,12 @@ void ClientSession::addFeedback(std::shared_ptr<SableFeedback> feedback) {
 }
 
 void ClientSession::_addFeedback(const std::shared_ptr<SableFeedback>& feedback) {
+  ledger::take(assembly_.tally, *feedback);
   platform::Function<void()> done;
   if (assembly_.testFeedbacks) done = keepWhenWritten(feedback);
-  if (storageHandle_) {
-    storageHandle_->writeFeedback(*feedback, std::move(done));
-  } else if (done) {
-    done();
-  }
+  if (storageHandle_) return storageHandle_->writeFeedback(*feedback, std::move(done));
+  ledger::count(assembly_.tally, SBLLedgerEntry::noFile);
+  if (done) done();
 }
 
 /// Keeps the feedback once the marker that this returns has run. Readers wait for it; a marker that

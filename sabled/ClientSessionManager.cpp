@@ -8,6 +8,7 @@
 #include "sabled/Assembly.h"
 #include "sabled/ClientSession.h"
 #include "sabled/ClientSessionShared.h"
+#include "sabled/FeedbackLedger.h"
 #include "sabled/SableBagController.h"
 #include "sabled/SableFeedback.h"
 #include "sabled/SableLogging.h"
@@ -73,7 +74,7 @@ class ClientSessionManager::Sessions : public std::enable_shared_from_this<Sessi
 };
 
 void ClientSessionManager::Sessions::add(const std::shared_ptr<SableFeedback>& feedback) {
-  if (!isWanted(*feedback)) return;
+  if (!isWanted(*feedback)) return ledger::count(assembly_.tally, SBLLedgerEntry::bagDisabled);
   feedback->setUserGuid(guidController.currentUserGUID());
   _updateState(feedback, eventOf(*feedback));
   expirationTime = assembly_.runtime.now() + kSessionIdleTime;
@@ -224,6 +225,7 @@ ClientSessionManager::ClientSessionManager(Assembly& assembly, SableUserGUIDCont
 ClientSessionManager::~ClientSessionManager() = default;
 
 void ClientSessionManager::addSableFeedback(std::shared_ptr<SableFeedback> feedback) {
+  ledger::take(assembly_.tally, *feedback);
   sessions_->queue->async(
       [sessions = sessions_, feedback = std::move(feedback),
        transaction = assembly_.platform.transactions().open("addFeedback")] { sessions->add(feedback); });

@@ -5,6 +5,7 @@
 
 #include "sabled/Assembly.h"
 #include "sabled/ClientSession.h"
+#include "sabled/FeedbackLedger.h"
 #include "sabled/SableFeedback.h"
 
 namespace sable {
@@ -40,7 +41,9 @@ ClientSessionShared::~ClientSessionShared() = default;
 
 void ClientSessionShared::addFeedback(std::shared_ptr<SableFeedback> feedback) {
   sessionQueue_->async([state = state_, feedback = std::move(feedback)] {
-    if (feedback && !feedback->userAgent().empty()) state->add(feedback);
+    if (!feedback) return;
+    if (feedback->userAgent().empty()) return ledger::count(state->assembly.tally, SBLLedgerEntry::noAgent);
+    state->add(feedback);
   });
 }
 

@@ -2,7 +2,13 @@
 
 #include <algorithm>
 
+#include "sabled/SableFeedback.h"
+
 namespace sable::ledger {
+
+void take(platform::Tally& tally, SableFeedback& feedback) {
+  if (feedback.enterLedger()) count(tally, SBLLedgerEntry::taken);
+}
 
 void countFile(platform::Tally& tally, SBLLedgerEntry entry, std::int64_t records) {
   count(tally, entry, records);

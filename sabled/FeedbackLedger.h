@@ -13,11 +13,18 @@
 /// Who sends what SablePersistentStorage has handed over counts each of these records once, as unsent,
 /// uploaded or refused: as many as ClientSession::getSessionFeedbacks() has, for the envelope may add
 /// some. The number goes with the upload, for the process that hears of its end may be another.
+namespace sable {
+class SableFeedback;
+}
+
 namespace sable::ledger {
 
 inline void count(platform::Tally& tally, SBLLedgerEntry entry, std::int64_t records = 1) {
   if (records != 0) tally.add(counterOf(entry), records);
 }
+
+/// Counts the feedback as taken, unless it was counted before on its way.
+void take(platform::Tally& tally, SableFeedback& feedback);
 
 /// Counts the records of a file that is gone, and the file.
 void countFile(platform::Tally& tally, SBLLedgerEntry entry, std::int64_t records);

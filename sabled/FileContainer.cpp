@@ -2,6 +2,7 @@
 
 #include <simdjson.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <cstring>
@@ -13,6 +14,7 @@
 #include "sabled/ArchivedDataIterator.h"
 #include "sabled/Assembly.h"
 #include "sabled/ClientSession.h"
+#include "sabled/FeedbackLedger.h"
 #include "sabled/SableFeedback.h"
 #include "sabled/SableLogging.h"
 
@@ -39,22 +41,25 @@ Expected<std::string_view> mmapFileHandle(platform::ReadableFile& fileHandle) {
   return data;
 }
 
-/// Reads the records after the first two, up to one that cannot be used.
-void decodeFeedbacks(ArchivedDataIterator& records, std::size_t dataLength, ClientSession& session) {
+/// Reads the records after the first two, up to one that cannot be used; says how many.
+std::uint64_t decodeFeedbacks(ArchivedDataIterator& records, std::size_t dataLength, ClientSession& session) {
   const auto userGuid = session.userGuid();
+  std::uint64_t count = 0;
   while (records.hasMore()) {
     const auto record = records.readNextObject();
-    if (!record) return;
+    if (!record) break;
     auto feedback = SableFeedback::parse(*record);
     if (!feedback) {
       log().error("{}", feedback.error().reason);
       log().error("could not unarchive feedback range {} size {}", records.position(), dataLength);
-      return;
+      break;
     }
     feedback->setUserAgent(session.agent());
     feedback->setUserGuid(userGuid);
     session.addSessionFeedbacks(std::make_shared<SableFeedback>(*std::move(feedback)));
+    ++count;
   }
+  return count;
 }
 
 }  // namespace
@@ -87,8 +92,14 @@ void FileContainer::writeSessionHeader(const ClientSession& session) {
 
 void FileContainer::writeFeedback(const SableFeedback& feedback, platform::Function<void()> done) {
   queue_->async([self = shared_from_this(), data = feedback.data(), done = std::move(done)]() mutable {
-    if (!self->fileHandle_) return;
-    self->_archiveData(data);
+    auto& tally = self->assembly_.tally;
+    if (!self->fileHandle_) return ledger::count(tally, self->endOfLaterRecords_);
+    if (self->_archiveData(data)) {
+      ++self->records_;
+      ledger::count(tally, SBLLedgerEntry::written);
+    } else {
+      ledger::count(tally, self->endOfLaterRecords_);
+    }
     if (done) done();
   });
 }
@@ -121,6 +132,7 @@ bool FileContainer::hasRoomFor(std::uint64_t bytes) {
   }
   // A file that would just be full counts as too long.
   if (*offset + bytes < maxFileSize_) return true;
+  endOfLaterRecords_ = SBLLedgerEntry::sizeLimit;
   assembly_.tally.add("com.kestrel.sabled.filesizeexceeded", 1);
   log().error("bytes written ({}) + feedback ({}) exceeds max session size ({})", *offset, bytes,
               maxFileSize_);
@@ -143,6 +155,7 @@ std::shared_ptr<ClientSession> FileContainer::read() {
 
 std::shared_ptr<ClientSession> FileContainer::readFile() {
   log().debug("reading file url {}", fileUrl_.native());
+  end_ = SBLLedgerEntry::damaged;
   if (fileHandle_) {
     log().fault("file is already open closing it {}", fileUrl_.native());
     _closeFile();
@@ -153,6 +166,7 @@ std::shared_ptr<ClientSession> FileContainer::readFile() {
     return nullptr;
   }
   if (attributes->size > maxFileSize_) {
+    end_ = SBLLedgerEntry::tooLarge;
     assembly_.tally.add("com.kestrel.sabled.filetoolarge", 1);
     log().error("Session too big to process");
     return nullptr;
@@ -190,6 +204,7 @@ std::shared_ptr<ClientSession> FileContainer::decode(std::string_view data) {
     return nullptr;
   }
   if (*version != version_) {
+    end_ = SBLLedgerEntry::otherVersion;
     log().error("version not supported: {}", version->substr(0, kLoggedVersionBytes));
     return nullptr;
   }
@@ -199,8 +214,34 @@ std::shared_ptr<ClientSession> FileContainer::decode(std::string_view data) {
     log().error("client session not stored");
     return nullptr;
   }
-  decodeFeedbacks(records, data.size(), *session);
+  readRecords_ = decodeFeedbacks(records, data.size(), *session);
+  end_ = SBLLedgerEntry::handedOver;
   return session;
+}
+
+std::uint64_t FileContainer::countRecords() {
+  records_ = recordsInSessionFile(assembly_.fileManager, fileUrl_);
+  return records_;
+}
+
+void FileContainer::closeAccount() {
+  queue_->assertIsCurrent();
+  const auto in = static_cast<std::int64_t>(records_);
+  if (end_ != SBLLedgerEntry::handedOver) return ledger::countFile(assembly_.tally, end_, in);
+  const auto read = static_cast<std::int64_t>(readRecords_);
+  ledger::count(assembly_.tally, SBLLedgerEntry::handedOver, read);
+  if (read < in) ledger::countFile(assembly_.tally, SBLLedgerEntry::damaged, in - read);
+}
+
+std::uint64_t recordsInSessionFile(platform::FileManager& fileManager, const std::filesystem::path& fileUrl) {
+  const auto file = fileManager.openForReading(fileUrl);
+  const auto data = file ? (*file)->map(kMaximumMappedBytes) : tl::unexpected(file.error());
+  if (!data) return 0;
+  ArchivedDataIterator records(*data);
+  constexpr std::uint64_t kVersionAndRoot = 2;
+  std::uint64_t count = 0;
+  while (records.skipNextObject()) ++count;
+  return count - std::min(count, kVersionAndRoot);
 }
 
 }  // namespace sable

@@ -6,6 +6,7 @@
 #include <string>
 #include <string_view>
 
+#include "SableKit/SBLFeedbackLedger.h"
 #include "platform/FileManager.h"
 #include "platform/Function.h"
 #include "platform/Runtime.h"
@@ -57,6 +58,13 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
   /// logged. Waits for the disk.
   std::shared_ptr<ClientSession> read();
 
+  // For the storage, on its queue.
+  /// Counts the records of a file that was found, whether or not this daemon can read them; a torn
+  /// one does not count. Logs nothing.
+  std::uint64_t countRecords();
+  /// Tells the ledger what became of the records, now that the file has been deleted.
+  void closeAccount();
+
   void _close();
   void _closeFile();  ///< on the storage's queue
 
@@ -73,7 +81,14 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
   const std::shared_ptr<platform::SerialQueue> queue_;
   const std::uint64_t maxFileSize_;
 
-  std::unique_ptr<platform::AppendableFile> fileHandle_;  ///< on queue_; null when closed
+  // On queue_.
+  std::unique_ptr<platform::AppendableFile> fileHandle_;  ///< null when closed
+  std::uint64_t records_ = 0, readRecords_ = 0;           ///< feedback in the file; as far as it was read
+  SBLLedgerEntry endOfLaterRecords_ = SBLLedgerEntry::unwritten;  ///< of those that find the file closed
+  SBLLedgerEntry end_ = SBLLedgerEntry::damaged;  ///< of those in the file, by the last read()
 };
+
+/// The feedback records in a session file, as FileContainer::countRecords().
+std::uint64_t recordsInSessionFile(platform::FileManager& fileManager, const std::filesystem::path& fileUrl);
 
 }  // namespace sable

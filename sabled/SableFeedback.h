@@ -6,6 +6,7 @@
 #include <span>
 #include <string>
 #include <string_view>
+#include <utility>
 
 #include "platform/Dictionary.h"
 #include "platform/UUID.h"
@@ -45,6 +46,8 @@ class SableFeedback {
   void setUserGuid(std::optional<UUID> guid) { userGuid_ = guid; }
   const std::string& userAgent() const { return userAgent_; }
   void setUserAgent(std::string agent) { userAgent_ = std::move(agent); }
+  /// Marks it as taken into the ledger of feedback; says whether it was not before.
+  bool enterLedger() { return !std::exchange(isInLedger_, true); }
   /// Milliseconds since the first record of the session.
   std::uint64_t relTimestamp() const { return relTimestamp_; }
   void setRelTimestamp(std::uint64_t milliseconds) { relTimestamp_ = milliseconds; }
@@ -65,6 +68,7 @@ class SableFeedback {
   std::uint64_t relTimestamp_ = 0;
   std::optional<UUID> userGuid_;
   std::string userAgent_;
+  bool isInLedger_ = false;
 };
 
 }  // namespace sable

@@ -12,6 +12,7 @@
 #include "platform/Tally.h"
 #include "platform/UserDefaults.h"
 #include "sabled/Assembly.h"
+#include "sabled/FeedbackLedger.h"
 #include "sabled/FileContainer.h"
 #include "sabled/SableLogging.h"
 #include "sabled/UserAgent.h"
@@ -47,6 +48,7 @@ SablePersistentStorage::SablePersistentStorage(Assembly& assembly)
       maxFileAge_(platform::fromSeconds(
           assembly.userDefaults.number(kSBLSessionMaxAge).value_or(kDefaultMaxFileAge))) {
   _scanCacheDirectory();
+  settleLedger();
 }
 
 std::shared_ptr<FileContainer> SablePersistentStorage::createFileContainerForWriting() {
@@ -97,6 +99,7 @@ void SablePersistentStorage::deleteSessionWithFileContainer(const std::shared_pt
   queue_->sync([&] {
     std::erase(fileContainers_, container);
     _deleteSessionFile(*container);
+    container->closeAccount();
   });
 }
 
@@ -131,12 +134,7 @@ void SablePersistentStorage::scanFile(const std::string& name) {
     log().error("Attribute fetch error {}", attributes.error().description());
     return;
   }
-  if (assembly_.runtime.now() - attributes->creationDate > maxFileAge_) {
-    assembly_.tally.add("com.kestrel.sabled.filetooold", 1);
-    if (const auto removed = assembly_.fileManager.remove(fileUrl); !removed)
-      log().error("file removing error {}", removed.error().description());
-    return;
-  }
+  if (deleteIfTooOld(fileUrl, attributes->creationDate)) return;
   // A name without a number of ours is one that we never give, so that it need not be passed over.
   std::uint32_t number = 0;
   const char* end = name.data() + name.size();
@@ -144,6 +142,28 @@ void SablePersistentStorage::scanFile(const std::string& name) {
     handleId_ = std::max(handleId_.load(), number + 1);
   fileContainers_.push_back(
       std::make_shared<FileContainer>(assembly_, fileUrl, version_, queue_, maxFileSize_));
+}
+
+bool SablePersistentStorage::deleteIfTooOld(const std::filesystem::path& fileUrl,
+                                            platform::WallTime creationDate) {
+  if (assembly_.runtime.now() - creationDate <= maxFileAge_) return false;
+  assembly_.tally.add("com.kestrel.sabled.filetooold", 1);
+  const auto records = static_cast<std::int64_t>(recordsInSessionFile(assembly_.fileManager, fileUrl));
+  if (const auto removed = assembly_.fileManager.remove(fileUrl); !removed)
+    log().error("file removing error {}", removed.error().description());
+  ledger::countFile(assembly_.tally, SBLLedgerEntry::tooOld, records);
+  return true;
+}
+
+/// What is on the disk says what became of the records that the last run had not yet counted. Later,
+/// but before a first write: nobody who starts up waits for the files to be read.
+void SablePersistentStorage::settleLedger() {
+  queue_->async([&tally = assembly_.tally, found = fileContainers_,
+                 before = SBLFeedbackLedger(assembly_.tally.snapshot())] {
+    std::uint64_t stored = 0;
+    for (const auto& container : found) stored += container->countRecords();
+    ledger::settleStored(tally, before, static_cast<std::int64_t>(stored));
+  });
 }
 
 }  // namespace sable

@@ -42,6 +42,8 @@ class SablePersistentStorage {
   std::optional<std::filesystem::path> _newFileUrl();
   void _scanCacheDirectory();
   void scanFile(const std::string& name);
+  bool deleteIfTooOld(const std::filesystem::path& fileUrl, platform::WallTime creationDate);
+  void settleLedger();
   void _deleteSessionFile(const FileContainer& container);
 
   Assembly& assembly_;
