@@ -130,6 +130,10 @@ std::string URL::host() const {
   return host;
 }
 
+std::string URL::path() const {
+  return part(handleFor(text_).get(), CURLUPART_PATH);
+}
+
 std::vector<URLQueryItem> URL::queryItems() const {
   std::vector<URLQueryItem> items;
   const std::string query = part(handleFor(text_).get(), CURLUPART_QUERY);

@@ -28,6 +28,7 @@ class URL {
 
   std::string scheme() const;  ///< lower case
   std::string host() const;    ///< lower case, without brackets
+  std::string path() const;    ///< as it is written; "/" where there is none
 
   /// Items in order, percent-decoded.
   std::vector<URLQueryItem> queryItems() const;

@@ -12,7 +12,7 @@ namespace sable::platform {
 
 /// Typed settings by key. Precedence: profile, then user, then what the daemon wrote, then the
 /// registered default. A value of another type than asked for counts as absent and is reported
-/// once at error level. Any thread; reads do not block on the disk.
+/// once at error level. Any thread; reads of the daemon's own domain do not block on the disk.
 class UserDefaults {
  public:
   virtual ~UserDefaults() = default;
@@ -27,6 +27,10 @@ class UserDefaults {
   virtual std::optional<WallTime> date(std::string_view key) const = 0;
   virtual std::optional<Dictionary> array(std::string_view key) const = 0;
   virtual std::optional<Dictionary> dictionary(std::string_view key) const = 0;
+
+  /// A setting of a domain that the user's programs share, as it is now; nullopt when it is absent or
+  /// no boolean. May block on the disk.
+  virtual std::optional<bool> sharedBoolean(std::string_view domain, std::string_view key) const = 0;
 
   /// Writes a value of the daemon's own (below profile and user). Null removes it. Becomes durable
   /// at the latest with synchronize().

@@ -10,6 +10,7 @@
 #include "sabled/ClientSessionManager.h"
 #include "sabled/ClientStateManager.h"
 #include "sabled/ImageFetcher.h"
+#include "sabled/Lookup.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SableBagController.h"
 #include "sabled/SablePersistentStorage.h"

@@ -15,6 +15,7 @@ class BackgroundFlusher;
 class ClientSessionManager;
 class ClientStateManager;
 class ImageFetcher;
+class Lookup;
 class SBLNetworkRequestFactory;
 class SableBagController;
 class SablePersistentStorage;
@@ -48,6 +49,7 @@ class Assembly {
   /// Of the daemon itself, and of all clients where they share a session.
   std::unique_ptr<ClientSessionManager> clientSessionManager;
   std::unique_ptr<ImageFetcher> imageFetcher;
+  std::unique_ptr<Lookup> lookup;
   std::unique_ptr<SableBagController> bagController;
   std::unique_ptr<ClientStateManager> clientStateManager;
 

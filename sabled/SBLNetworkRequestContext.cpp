@@ -16,6 +16,7 @@
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SableBagController.h"
 #include "sabled/SableLogging.h"
+#include "sabled/SplitText.h"
 #include "sabled/UserAgent.h"
 
 // The context half of the factory: what requests say about the device, kept current.
@@ -38,16 +39,6 @@ std::string firstThreeAsJSON(const std::vector<std::string>& languages) {
   Dictionary list = Dictionary::array();
   for (std::size_t i = 0; i < languages.size() && i < 3; ++i) list.push_back(languages[i]);
   return list.empty() ? std::string() : compactJSON(list);
-}
-
-std::vector<std::string> split(std::string_view text, char separator) {
-  std::vector<std::string> pieces;
-  for (std::size_t start = 0;;) {
-    const std::size_t end = text.find(separator, start);
-    pieces.emplace_back(text.substr(start, end - start));
-    if (end == std::string_view::npos) return pieces;
-    start = end + 1;
-  }
 }
 
 constexpr std::size_t kMaximumSubscriptionBytes = 64u << 10;

@@ -10,6 +10,7 @@
 #include "platform/UserDefaults.h"
 #include "sabled/ClientStateManager.h"
 #include "sabled/ImageFetcher.h"
+#include "sabled/Lookup.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SableBagController.h"
 #include "sabled/SableLogging.h"
@@ -57,6 +58,7 @@ void SableDaemon::createServices() {
   assembly_.persistentStorage = std::make_unique<SablePersistentStorage>(assembly_);
   assembly_.tally.add("com.kestrel.sabled.launch", 1);
   assembly_.imageFetcher = std::make_unique<ImageFetcher>(assembly_);
+  assembly_.lookup = std::make_unique<Lookup>(assembly_);
   assembly_.bagController = std::make_unique<SableBagController>(assembly_);
   assembly_.clientStateManager = std::make_unique<ClientStateManager>(assembly_);
   service_ = std::make_unique<SableService>(assembly_);

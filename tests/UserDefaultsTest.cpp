@@ -223,16 +223,38 @@ TEST_F(UserDefaultsTest, ReadersAndWritersOfManyThreadsDoNotDisturbEachOther) {
   EXPECT_EQ(readFile(folders.ownSettings()), "own0 = 199\nown1 = 199\nown2 = 199\nown3 = 199\n");
 }
 
+TEST_F(UserDefaultsTest, ASharedDomainHasAFileOfItsOwnThatIsReadWhenAsked) {
+  const auto file = folders.config / "com.example.shared.toml";
+  const auto defaults = open();
+  const auto read = [&](std::string_view text) {
+    writeFile(file, text);
+    return defaults->sharedBoolean("com.example.shared", "Flag");
+  };
+  EXPECT_FALSE(defaults->sharedBoolean("com.example.shared", "Flag"));
+  writeFile(folders.userSettings(), "Flag = true");
+  EXPECT_EQ(read("Flag = true"), true);
+  EXPECT_EQ(read("Flag = false"), false);
+  EXPECT_EQ(read("Other = true"), std::nullopt) << "another domain's value does not show through";
+  EXPECT_EQ(read("Flag = 1"), std::nullopt);
+  EXPECT_TRUE(log.contains(file.native() + ":1:1: Flag is not a boolean"));
+  EXPECT_EQ(read("Flag = false"), false);
+  EXPECT_EQ(read("Flag = "), false) << "what does not parse keeps the last good content";
+  EXPECT_EQ(log.count(LogLevel::error), 2u);
+}
+
 TEST_F(UserDefaultsTest, CheckingNamesFileLineColumnAndKey) {
   EXPECT_TRUE(host::checkConfiguration(folders).empty());
   writeFile(folders.profileSettings, "SBLSessionMaxAge = 3600\nSBLUseBramble = 1\n");
   writeFile(folders.userSettings(), "SBLBagURL = \"http://127.0.0.1/bag\"\n\n SBLBagUrl = \"x\"\n");
+  writeFile(folders.sharedSettings("com.kestrel.lookup.shared"), "LookupSuggestionsDisabled = \"no\"\n");
   writeFile(folders.systemFacts, "locale = \"en_GB\"\n[location]\nlatitude = 1.0\n");
   writeFile(folders.userFacts(), "preferred_languages = [\"en\", 5]\n");
   EXPECT_EQ(host::checkConfiguration(folders),
             (std::vector<std::string>{
                 folders.profileSettings.native() + ":2:1: SBLUseBramble: not a boolean",
                 folders.userSettings().native() + ":3:2: SBLBagUrl: unknown",
+                folders.config.native() +
+                    "/com.kestrel.lookup.shared.toml:1:1: LookupSuggestionsDisabled: not a boolean",
                 folders.userFacts().native() + ":1:1: preferred_languages: not an array of strings",
             }));
   writeFile(folders.userSettings(), "a = \"\n");

@@ -30,6 +30,9 @@ constexpr std::array kSettings{
     KnownKey{"TraceEnabled", boolean},
 };
 
+/// Of the domain that the clients of lookups share.
+constexpr std::array kLookupSettings{KnownKey{"LookupSuggestionsDisabled", boolean}};
+
 constexpr std::array kFacts{
     KnownKey{"product_type", string},
     KnownKey{"product_name", string},
@@ -171,6 +174,7 @@ std::vector<std::string> checkConfiguration(const Folders& folders) {
   std::vector<std::string> problems;
   checkFile(folders.profileSettings, knownSettings(), problems);
   checkFile(folders.userSettings(), knownSettings(), problems);
+  checkFile(folders.sharedSettings("com.kestrel.lookup.shared"), kLookupSettings, problems);
   checkFile(folders.systemFacts, knownFacts(), problems);
   checkFile(folders.userFacts(), knownFacts(), problems);
   return problems;

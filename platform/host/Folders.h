@@ -4,6 +4,7 @@
 #include <functional>
 #include <optional>
 #include <string>
+#include <string_view>
 
 namespace sable::platform::host {
 
@@ -26,6 +27,7 @@ struct Folders {
 
   std::filesystem::path socket() const { return runtime / "relay.sock"; }
   std::filesystem::path userSettings() const { return config / "defaults.toml"; }
+  std::filesystem::path sharedSettings(std::string_view domain) const { return (config / domain) += ".toml"; }
   std::filesystem::path ownSettings() const { return state / "defaults.toml"; }
   std::filesystem::path userFacts() const { return config / "facts.toml"; }
   std::filesystem::path counters() const { return state / "counters.tally"; }

@@ -29,6 +29,7 @@ class TOMLUserDefaults::Store : public std::enable_shared_from_this<Store> {
   Store(const Folders& folders, Runtime& runtime, FileManager& fileManager)
       : fileManager_(fileManager),
         queue_(runtime.serialQueue("com.kestrel.sabled.defaults", QualityOfService::background)),
+        folders_(folders),
         profile_(folders.profileSettings),
         user_(folders.userSettings()),
         ownPath_(folders.ownSettings()) {
@@ -68,6 +69,20 @@ class TOMLUserDefaults::Store : public std::enable_shared_from_this<Store> {
       if (hasType(found->second, type)) return found->second;
       reportType(key, found->second, type, path);
     }
+    return std::nullopt;
+  }
+
+  std::optional<bool> findShared(std::string_view domain, std::string_view key) {
+    const std::lock_guard lock(sharing_);
+    auto known = shared_.find(domain);
+    if (known == shared_.end())
+      known = shared_.emplace(domain, TOMLFile(folders_.sharedSettings(domain))).first;
+    TOMLFile& file = known->second;
+    file.reload();
+    const auto found = file.content().find(key);
+    if (found == file.content().end()) return std::nullopt;
+    if (found->second.value->is_boolean()) return found->second.value->get<bool>();
+    reportType(key, found->second, ValueType::boolean, &file.path());
     return std::nullopt;
   }
 
@@ -147,6 +162,10 @@ class TOMLUserDefaults::Store : public std::enable_shared_from_this<Store> {
 
   std::mutex reloading_;
 
+  const Folders folders_;
+  std::mutex sharing_;
+  std::map<std::string, TOMLFile, std::less<>> shared_;  ///< by domain
+
   mutable std::shared_mutex mutex_;
   TOMLFile profile_, user_;
   const std::filesystem::path ownPath_;
@@ -215,6 +234,10 @@ std::optional<Dictionary> TOMLUserDefaults::array(std::string_view key) const {
 std::optional<Dictionary> TOMLUserDefaults::dictionary(std::string_view key) const {
   const auto found = store_->find(key, ValueType::table);
   return found ? std::optional(*found->value) : std::nullopt;
+}
+
+std::optional<bool> TOMLUserDefaults::sharedBoolean(std::string_view domain, std::string_view key) const {
+  return store_->findShared(domain, key);
 }
 
 void TOMLUserDefaults::set(std::string_view key, const Dictionary& value) {

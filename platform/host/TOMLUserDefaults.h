@@ -11,7 +11,8 @@ namespace sable::platform::host {
 
 /// Settings in TOML files: the profile's, the user's, and the daemon's own in the state folder
 /// (Folders names them). The first two are read again when they change; the last is read once and
-/// replaced a second after a value was set, and by synchronize().
+/// replaced a second after a value was set, and by synchronize(). A shared domain's file, DOMAIN.toml
+/// in the config folder, is read when it is asked for.
 class TOMLUserDefaults final : public UserDefaults {
  public:
   /// All that is named must outlive this.
@@ -31,6 +32,7 @@ class TOMLUserDefaults final : public UserDefaults {
   std::optional<WallTime> date(std::string_view key) const override;
   std::optional<Dictionary> array(std::string_view key) const override;
   std::optional<Dictionary> dictionary(std::string_view key) const override;
+  std::optional<bool> sharedBoolean(std::string_view domain, std::string_view key) const override;
 
   void set(std::string_view key, const Dictionary& value) override;
   void setDate(std::string_view key, WallTime value) override;

@@ -75,6 +75,12 @@ std::optional<Dictionary> SimulatedUserDefaults::dictionary(std::string_view key
   return found == nullptr ? std::nullopt : std::optional(*found->value);
 }
 
+std::optional<bool> SimulatedUserDefaults::sharedBoolean(std::string_view domain,
+                                                         std::string_view key) const {
+  const auto found = shared_.find({std::string(domain), std::string(key)});
+  return found == shared_.end() ? std::nullopt : std::optional(found->second);
+}
+
 void SimulatedUserDefaults::set(std::string_view key, const Dictionary& value) {
   put(own, key, value);
 }

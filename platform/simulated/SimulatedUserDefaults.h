@@ -6,6 +6,7 @@
 #include <optional>
 #include <set>
 #include <string>
+#include <utility>
 
 #include "platform/UserDefaults.h"
 
@@ -23,6 +24,7 @@ class SimulatedUserDefaults final : public UserDefaults {
   std::optional<WallTime> date(std::string_view key) const override;
   std::optional<Dictionary> array(std::string_view key) const override;
   std::optional<Dictionary> dictionary(std::string_view key) const override;
+  std::optional<bool> sharedBoolean(std::string_view domain, std::string_view key) const override;
 
   void set(std::string_view key, const Dictionary& value) override;
   void setDate(std::string_view key, WallTime value) override;
@@ -31,6 +33,11 @@ class SimulatedUserDefaults final : public UserDefaults {
   /// What the user or the profile sets; null takes it back.
   void setByUser(std::string_view key, const Dictionary& value) { put(user, key, value); }
   void setByProfile(std::string_view key, const Dictionary& value) { put(profile, key, value); }
+
+  /// A setting of a domain that programs share.
+  void setShared(std::string_view domain, std::string_view key, bool value) {
+    shared_[{std::string(domain), std::string(key)}] = value;
+  }
 
   int synchronizations() const { return synchronizations_; }
 
@@ -46,6 +53,7 @@ class SimulatedUserDefaults final : public UserDefaults {
   const Value* find(std::string_view key, std::string_view type, Is is) const;
 
   std::array<std::map<std::string, Value, std::less<>>, 4> layers_;
+  std::map<std::pair<std::string, std::string>, bool> shared_;
   mutable std::set<std::string, std::less<>> reported_;
   int synchronizations_ = 0;
 };
