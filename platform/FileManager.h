@@ -24,21 +24,26 @@ class AppendableFile {
   virtual Expected<void> append(std::string_view head, std::string_view body) = 0;
 };
 
-/// A regular file open for reading; closed with the object. One thread at a time.
-class ReadableFile {
- public:
-  virtual ~ReadableFile() = default;
-  /// All bytes of the file, fetched when they are looked at and valid as long as this object:
-  /// nobody can take them away meanwhile by cutting the file. EFBIG when it is longer than
-  /// `maximumBytes`. Once.
-  virtual Expected<std::string_view> map(std::size_t maximumBytes) = 0;
-};
-
 struct FileAttributes {
   std::uint64_t size = 0;  ///< bytes
   /// When the file came to be; for a copy that kept its time of change, that time, and so too
   /// where the file system does not know better.
   WallTime creationDate;
+};
+
+/// A regular file open for reading; closed with the object. One thread at a time.
+class ReadableFile {
+ public:
+  virtual ~ReadableFile() = default;
+  /// Of this very file, whatever stands under its name by now.
+  virtual Expected<FileAttributes> attributes() = 0;
+  /// A descriptor of it, open for reading only and set to its beginning, to be handed to another
+  /// program; closed with its last holder.
+  virtual Expected<std::shared_ptr<const int>> descriptor() = 0;
+  /// All bytes of the file, fetched when they are looked at and valid as long as this object:
+  /// nobody can take them away meanwhile by cutting the file. EFBIG when it is longer than
+  /// `maximumBytes`. Once.
+  virtual Expected<std::string_view> map(std::size_t maximumBytes) = 0;
 };
 
 /// Files of the daemon. Errors are of kPOSIXErrorDomain. May block on the disk. Any thread.
@@ -59,6 +64,12 @@ class FileManager {
   /// Replaces the file whole, with permissions 0600: readers see the old bytes or the new ones,
   /// also after a power cut, never a mixture.
   virtual Expected<void> writeAtomically(const std::filesystem::path& path, std::string_view bytes) = 0;
+
+  /// Moves the regular file `replacement` to `path`, whatever stood there, with permissions 0600: readers
+  /// see the old bytes or the new ones, also after a power cut or a kill, never a mixture. Between file
+  /// systems it is copied first. On failure `path` is as it was, and `replacement` is still there.
+  virtual Expected<void> replaceItem(const std::filesystem::path& path,
+                                     const std::filesystem::path& replacement) = 0;
 
   virtual Expected<void> remove(const std::filesystem::path& path) = 0;
 

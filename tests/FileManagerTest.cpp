@@ -85,6 +85,30 @@ TEST_P(FileManagerContract, AFileGrowsAtItsEndAndIsMappedWhole) {
   EXPECT_EQ(readable->map(100'008), "head" + std::string(100'000, 'x') + "tail");
 }
 
+TEST_P(FileManagerContract, AFileTakesThePlaceOfAnotherAndWhoHasTheOldOneOpenKeepsIt) {
+  const auto parent = *files->cachesDirectory();
+  const auto file = parent / std::string(255, 'n'), arrived = parent / "arrived";
+  EXPECT_EQ(errorOf(files->replaceItem(file, arrived)), ENOENT);
+  ASSERT_TRUE(files->writeAtomically(arrived, "old"));
+  ASSERT_TRUE(files->replaceItem(file, arrived));
+  EXPECT_EQ(errorOf(files->read(arrived, 10)), ENOENT);
+  const auto old = *files->openForReading(file);
+
+  ASSERT_TRUE(files->writeAtomically(arrived, "newer"));
+  EXPECT_EQ(errorOf(files->replaceItem(parent / "missing" / "file", arrived)), ENOENT);
+  ASSERT_TRUE(files->createDirectory(parent / "folder"));
+  EXPECT_EQ(errorOf(files->replaceItem(parent / "folder", arrived)), EISDIR);
+  ASSERT_TRUE(files->replaceItem(file, arrived));
+  EXPECT_EQ(*files->read(file, 10), "newer");
+  EXPECT_EQ(old->attributes()->size, 3u);
+
+  const auto descriptor = old->descriptor();
+  ASSERT_TRUE(descriptor);
+  char bytes[10];
+  EXPECT_EQ(read(**descriptor, bytes, sizeof bytes), 3) << "from its beginning";
+  EXPECT_LT(write(**descriptor, "x", 1), 0) << "for reading only";
+}
+
 TEST_P(FileManagerContract, AFolderIsListedInOrderAndIsNoFile) {
   const auto parent = *files->cachesDirectory();
   EXPECT_EQ(files->list(parent), std::vector<std::string>{});
@@ -254,6 +278,46 @@ TEST_F(HostFileManagerTest, AFailedWriteLeavesTheOldFileAndNoRest) {
   EXPECT_EQ(errorOf(files.writeAtomically(folder / "closed/folder", "x")), EISDIR);
   EXPECT_FALSE(std::filesystem::exists(folder / "closed/.folder.new"));
   EXPECT_EQ(errorOf(files.writeAtomically(folder / "missing/file", "x")), ENOENT);
+}
+
+/// A folder on another file system than the temporary one; empty where this host has no such.
+struct OtherFileSystem {
+  OtherFileSystem() {
+    std::string name = "/dev/shm/sabled-test.XXXXXX";
+    struct stat here {
+    }, there{};
+    if (stat(std::filesystem::temp_directory_path().c_str(), &here) != 0 || stat("/dev/shm", &there) != 0)
+      return;
+    if (here.st_dev != there.st_dev && mkdtemp(name.data()) != nullptr) path = name;
+  }
+  ~OtherFileSystem() {
+    if (!path.empty()) std::filesystem::remove_all(path);
+  }
+  std::filesystem::path path;
+};
+
+TEST_F(HostFileManagerTest, AFileFromAnotherFileSystemArrivesWholeOrNotAtAll) {
+  const OtherFileSystem other;
+  if (other.path.empty()) GTEST_SKIP() << "needs a second file system";
+  const std::string bytes(200'000, 'n');
+  writeFile(folder / "file", "old");
+  writeFile(other.path / "arrived", bytes);
+  const auto ignored = std::signal(SIGXFSZ, SIG_IGN);
+  rlimit old{};
+  getrlimit(RLIMIT_FSIZE, &old);
+  const rlimit small{100'000, old.rlim_max};
+  setrlimit(RLIMIT_FSIZE, &small);
+  const auto failed = files.replaceItem(folder / "file", other.path / "arrived");
+  setrlimit(RLIMIT_FSIZE, &old);
+  std::signal(SIGXFSZ, ignored);
+  EXPECT_EQ(errorOf(failed), EFBIG) << "the disk was full half-way";
+  EXPECT_EQ(readFile(folder / "file"), "old");
+  EXPECT_FALSE(std::filesystem::exists(folder / ".file.new"));
+
+  ASSERT_TRUE(files.replaceItem(folder / "file", other.path / "arrived"));
+  EXPECT_EQ(readFile(folder / "file"), bytes);
+  EXPECT_EQ(modeOf(folder / "file"), 0600u);
+  EXPECT_FALSE(std::filesystem::exists(other.path / "arrived"));
 }
 
 TEST(FoldersTest, TheFirstVariableThatIsSetDecides) {

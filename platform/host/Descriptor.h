@@ -2,6 +2,7 @@
 
 #include <unistd.h>
 
+#include <memory>
 #include <utility>
 
 namespace sable::platform::host {
@@ -28,5 +29,13 @@ class Descriptor {
  private:
   int number_ = -1;
 };
+
+/// Held by several, closed with the last of them.
+inline std::shared_ptr<const int> sharedDescriptor(Descriptor descriptor) {
+  return {new int(descriptor.release()), [](const int* number) {
+            close(*number);
+            delete number;
+          }};
+}
 
 }  // namespace sable::platform::host

@@ -6,8 +6,11 @@
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
+#include <climits>
 #include <cstdio>
+#include <functional>
 
 #include "platform/host/OpenFiles.h"
 #include "platform/host/TrustedPath.h"
@@ -20,6 +23,12 @@ using Path = std::filesystem::path;
 
 tl::unexpected<Error> failed(int number, const Path& path) {
   return tl::unexpected(posixError(number, path.native()));
+}
+
+/// Of a name that leaves no room for more, only the beginning: files that share it take turns.
+std::string replacementName(const std::string& name) {
+  constexpr std::string_view kAround = "..new";
+  return "." + name.substr(0, NAME_MAX - kAround.size()) + ".new";
 }
 
 /// 0, or an errno value.
@@ -55,14 +64,30 @@ Expected<Descriptor> openReplacement(int folder, const std::string& name, const 
 }
 
 /// 0, or an errno value.
-int writeWhole(int file, std::string_view bytes) {
-  if (ftruncate(file, 0) != 0) return errno;
+int writeAll(int file, std::string_view bytes) {
   while (!bytes.empty()) {
     const ssize_t count = ::write(file, bytes.data(), bytes.size());
     if (count < 0 && errno == EINTR) continue;
     if (count < 0) return errno;
     bytes.remove_prefix(static_cast<std::size_t>(count));
   }
+  return 0;
+}
+
+/// 0, or an errno value.
+int copyAll(int from, int to) {
+  std::array<char, 65536> bytes;
+  for (;;) {
+    const ssize_t count = ::read(from, bytes.data(), bytes.size());
+    if (count < 0 && errno == EINTR) continue;
+    if (count < 0) return errno;
+    if (count == 0) return 0;
+    if (const int number = writeAll(to, {bytes.data(), static_cast<std::size_t>(count)}); number != 0)
+      return number;
+  }
+}
+
+int synchronize(int file) {
   return fsync(file) == 0 ? 0 : errno;
 }
 
@@ -71,14 +96,26 @@ int synchronizeFolder(int folder) {
   return readable && fsync(readable.number()) == 0 ? 0 : errno;
 }
 
-/// 0, or why a file of this mode is not for reading and writing.
-int refusalOf(mode_t mode) {
-  if (S_ISREG(mode)) return 0;
-  return S_ISLNK(mode) ? ELOOP : S_ISDIR(mode) ? EISDIR : EINVAL;
-}
+/// Replaces the file `path` by what `write` puts into an empty one; it returns 0 or an errno value.
+Expected<void> replaceWith(const Path& path, const std::function<int(int file)>& write) {
+  const auto folder = openTrustedFolder(path.parent_path(), MissingFolders::fail);
+  if (!folder) return tl::unexpected(folder.error());
+  const std::string name = path.filename();
+  const std::string newName = replacementName(name);
+  const auto file = openReplacement(folder->number(), newName, path);
+  if (!file) return tl::unexpected(file.error());
 
-WallTime timeOf(const struct statx_timestamp& time) {
-  return WallTime(std::chrono::seconds(time.tv_sec) + std::chrono::nanoseconds(time.tv_nsec));
+  int number = ftruncate(file->number(), 0) == 0 ? write(file->number()) : errno;
+  if (number == 0) number = synchronize(file->number());
+  if (number == 0 && renameat(folder->number(), newName.c_str(), folder->number(), name.c_str()) != 0) {
+    number = errno;
+  }
+  if (number != 0) {
+    unlinkat(folder->number(), newName.c_str(), 0);
+    return failed(number, path);
+  }
+  if (number = synchronizeFolder(folder->number()); number != 0) return failed(number, path);
+  return {};
 }
 
 }  // namespace
@@ -104,23 +141,26 @@ Expected<std::string> HostFileManager::read(const Path& path, std::size_t maximu
 }
 
 Expected<void> HostFileManager::writeAtomically(const Path& path, std::string_view bytes) {
-  const auto folder = openTrustedFolder(path.parent_path(), MissingFolders::fail);
-  if (!folder) return tl::unexpected(folder.error());
-  const std::string name = path.filename();
-  const std::string newName = "." + name + ".new";
-  const auto file = openReplacement(folder->number(), newName, path);
-  if (!file) return tl::unexpected(file.error());
+  return replaceWith(path, [bytes](int file) { return writeAll(file, bytes); });
+}
 
-  int number = writeWhole(file->number(), bytes);
-  if (number == 0 && renameat(folder->number(), newName.c_str(), folder->number(), name.c_str()) != 0) {
-    number = errno;
+Expected<void> HostFileManager::replaceItem(const Path& path, const Path& replacement) {
+  const auto file = openTrustedFile(replacement, LastLink::refuse);
+  if (!file) return tl::unexpected(file.error());
+  const auto source = openTrustedFolder(replacement.parent_path(), MissingFolders::fail);
+  const auto folder = openTrustedFolder(path.parent_path(), MissingFolders::fail);
+  if (!source || !folder) return tl::unexpected(source ? folder.error() : source.error());
+  if (fchmod(file->number(), S_IRUSR | S_IWUSR) != 0) return failed(errno, replacement);
+  if (const int number = synchronize(file->number()); number != 0) return failed(number, replacement);
+  const std::string oldName = replacement.filename(), newName = path.filename();
+  if (renameat(source->number(), oldName.c_str(), folder->number(), newName.c_str()) == 0) {
+    const int number = synchronizeFolder(folder->number());
+    return number == 0 ? Expected<void>() : failed(number, path);
   }
-  if (number != 0) {
-    unlinkat(folder->number(), newName.c_str(), 0);
-    return failed(number, path);
-  }
-  if (number = synchronizeFolder(folder->number()); number != 0) return failed(number, path);
-  return {};
+  if (errno != EXDEV) return failed(errno, path);
+  auto copied = replaceWith(path, [&file](int to) { return copyAll(file->number(), to); });
+  if (copied) unlinkat(source->number(), oldName.c_str(), 0);
+  return copied;
 }
 
 Expected<void> HostFileManager::remove(const Path& path) {
@@ -160,15 +200,7 @@ Expected<std::unique_ptr<ReadableFile>> HostFileManager::openForReading(const Pa
 Expected<FileAttributes> HostFileManager::attributes(const Path& path) {
   const auto folder = openTrustedFolder(path.parent_path(), MissingFolders::fail);
   if (!folder) return tl::unexpected(folder.error());
-  struct statx status {};
-  if (statx(folder->number(), path.filename().c_str(), AT_SYMLINK_NOFOLLOW,
-            STATX_TYPE | STATX_SIZE | STATX_MTIME | STATX_BTIME, &status) != 0) {
-    return failed(errno, path);
-  }
-  if (const int number = refusalOf(status.stx_mode); number != 0) return failed(number, path);
-  WallTime created = timeOf(status.stx_mtime);
-  if ((status.stx_mask & STATX_BTIME) != 0) created = std::min(created, timeOf(status.stx_btime));
-  return FileAttributes{status.stx_size, created};
+  return attributesAt(folder->number(), path.filename().c_str(), AT_SYMLINK_NOFOLLOW, path);
 }
 
 Expected<std::vector<std::string>> HostFileManager::list(const Path& path) {

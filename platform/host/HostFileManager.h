@@ -16,6 +16,8 @@ class HostFileManager final : public FileManager {
   Expected<void> createDirectory(const std::filesystem::path& path) override;
   Expected<std::string> read(const std::filesystem::path& path, std::size_t maximumBytes) override;
   Expected<void> writeAtomically(const std::filesystem::path& path, std::string_view bytes) override;
+  Expected<void> replaceItem(const std::filesystem::path& path,
+                             const std::filesystem::path& replacement) override;
   Expected<void> remove(const std::filesystem::path& path) override;
   Expected<void> createFile(const std::filesystem::path& path) override;
   Expected<std::unique_ptr<AppendableFile>> openForAppending(const std::filesystem::path& path) override;

@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <sys/uio.h>
 
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <csignal>
@@ -26,7 +27,28 @@ bool takeReadLease(int file) {
   return fcntl(file, F_SETSIG, SIGURG) == 0 && fcntl(file, F_SETLEASE, F_RDLCK) == 0;
 }
 
+WallTime timeOf(const struct statx_timestamp& time) {
+  return WallTime(std::chrono::seconds(time.tv_sec) + std::chrono::nanoseconds(time.tv_nsec));
+}
+
 }  // namespace
+
+int refusalOf(mode_t mode) {
+  if (S_ISREG(mode)) return 0;
+  return S_ISLNK(mode) ? ELOOP : S_ISDIR(mode) ? EISDIR : EINVAL;
+}
+
+Expected<FileAttributes> attributesAt(int folder, const char* name, int flags,
+                                      const std::filesystem::path& path) {
+  struct statx status {};
+  if (statx(folder, name, flags, STATX_TYPE | STATX_SIZE | STATX_MTIME | STATX_BTIME, &status) != 0)
+    return tl::unexpected(posixError(errno, path.native()));
+  if (const int number = refusalOf(status.stx_mode); number != 0)
+    return tl::unexpected(posixError(number, path.native()));
+  WallTime created = timeOf(status.stx_mtime);
+  if ((status.stx_mask & STATX_BTIME) != 0) created = std::min(created, timeOf(status.stx_btime));
+  return FileAttributes{status.stx_size, created};
+}
 
 Expected<std::uint64_t> HostAppendableFile::size() {
   struct stat status {};
@@ -50,6 +72,17 @@ Expected<void> HostAppendableFile::append(std::string_view head, std::string_vie
 
 HostReadableFile::~HostReadableFile() {
   if (mapping_ != nullptr) munmap(mapping_, mappedBytes_);
+}
+
+Expected<FileAttributes> HostReadableFile::attributes() {
+  return attributesAt(file_.number(), "", AT_EMPTY_PATH, path_);
+}
+
+Expected<std::shared_ptr<const int>> HostReadableFile::descriptor() {
+  Descriptor own(fcntl(file_.number(), F_DUPFD_CLOEXEC, 0));
+  if (!own) return tl::unexpected(posixError(errno, path_.native()));
+  if (lseek(own.number(), 0, SEEK_SET) < 0) return tl::unexpected(posixError(errno, path_.native()));
+  return sharedDescriptor(std::move(own));
 }
 
 Expected<std::string_view> HostReadableFile::map(std::size_t maximumBytes) {

@@ -1,11 +1,21 @@
 #pragma once
 
+#include <sys/types.h>
+
 #include <filesystem>
 
 #include "platform/FileManager.h"
 #include "platform/host/Descriptor.h"
 
 namespace sable::platform::host {
+
+/// 0, or the errno value for why a file of this mode is not for reading and writing.
+int refusalOf(mode_t mode);
+
+/// What statx(2) says of the file `name` in `folder`, or with AT_EMPTY_PATH of `folder` itself; `path`
+/// names it in errors. What is no regular file is an error.
+Expected<FileAttributes> attributesAt(int folder, const char* name, int flags,
+                                      const std::filesystem::path& path);
 
 class HostAppendableFile final : public AppendableFile {
  public:
@@ -34,6 +44,8 @@ class HostReadableFile final : public ReadableFile {
   HostReadableFile(const HostReadableFile&) = delete;
   HostReadableFile& operator=(const HostReadableFile&) = delete;
 
+  Expected<FileAttributes> attributes() override;
+  Expected<std::shared_ptr<const int>> descriptor() override;
   Expected<std::string_view> map(std::size_t maximumBytes) override;
 
  private:

@@ -10,6 +10,7 @@
 #include <cstring>
 
 #include "platform/RelaySupport.h"
+#include "platform/host/Descriptor.h"
 
 namespace sable::platform::host {
 
@@ -301,14 +302,11 @@ class Reader {
     if (!enter('a', "h")) return read;
     int carried = -1;
     if (good(sd_bus_message_read_basic(message_, 'h', &carried))) {
-      const int own = ::fcntl(carried, F_DUPFD_CLOEXEC, 3);
-      if (own < 0) {
-        error_ = -errno;
+      Descriptor own(::fcntl(carried, F_DUPFD_CLOEXEC, 3));
+      if (own) {
+        read.descriptor = sharedDescriptor(std::move(own));
       } else {
-        read.descriptor = {new int(own), [](const int* held) {
-                             ::close(*held);
-                             delete held;
-                           }};
+        error_ = -errno;
       }
     }
     leave();

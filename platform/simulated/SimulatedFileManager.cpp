@@ -1,5 +1,9 @@
 #include "platform/simulated/SimulatedFileManager.h"
 
+#include <fcntl.h>
+#include <sys/mman.h>
+#include <unistd.h>
+
 #include <cerrno>
 
 namespace sable::platform::simulated {
@@ -38,8 +42,22 @@ class SimulatedFileManager::Appendable final : public AppendableFile {
 
 class SimulatedFileManager::Readable final : public ReadableFile {
  public:
-  Readable(std::string bytes, const Path& path) : bytes_(std::move(bytes)), path_(path) {}
+  Readable(std::string bytes, WallTime created, const Path& path)
+      : bytes_(std::move(bytes)), created_(created), path_(path) {}
 
+  Expected<FileAttributes> attributes() override { return FileAttributes{bytes_.size(), created_}; }
+  /// Of the system's own: who is handed it reads it with the system's means.
+  Expected<std::shared_ptr<const int>> descriptor() override {
+    const int memory = memfd_create("simulated", MFD_CLOEXEC | MFD_ALLOW_SEALING);
+    const std::shared_ptr<const int> held(new int(memory), [](const int* number) {
+      close(*number);
+      delete number;
+    });
+    if (memory < 0 || pwrite(memory, bytes_.data(), bytes_.size(), 0) < 0 ||
+        fcntl(memory, F_ADD_SEALS, F_SEAL_WRITE) != 0)
+      return failed(errno, path_);
+    return held;
+  }
   Expected<std::string_view> map(std::size_t maximumBytes) override {
     if (bytes_.size() > maximumBytes) return failed(EFBIG, path_);
     return std::string_view(bytes_);
@@ -47,6 +65,7 @@ class SimulatedFileManager::Readable final : public ReadableFile {
 
  private:
   const std::string bytes_;
+  const WallTime created_;
   const Path path_;
 };
 
@@ -96,6 +115,15 @@ Expected<void> SimulatedFileManager::writeAtomically(const Path& path, std::stri
   return {};
 }
 
+Expected<void> SimulatedFileManager::replaceItem(const Path& path, const Path& replacement) {
+  const auto from = find(replacement);
+  if (!from) return tl::unexpected(from.error());
+  const auto created = creationDates_.at(replacement.lexically_normal());
+  if (auto written = writeAtomically(path, **from); !written) return written;
+  creationDates_.insert_or_assign(path.lexically_normal(), created);
+  return path.lexically_normal() == replacement.lexically_normal() ? Expected<void>() : remove(replacement);
+}
+
 Expected<void> SimulatedFileManager::remove(const Path& path) {
   if (auto checked = check(path); !checked) return checked;
   const Path file = path.lexically_normal();
@@ -119,7 +147,7 @@ Expected<std::unique_ptr<AppendableFile>> SimulatedFileManager::openForAppending
 Expected<std::unique_ptr<ReadableFile>> SimulatedFileManager::openForReading(const Path& path) {
   const auto file = find(path);
   if (!file) return tl::unexpected(file.error());
-  return std::make_unique<Readable>(**file, path);
+  return std::make_unique<Readable>(**file, creationDates_.at(path.lexically_normal()), path);
 }
 
 Expected<FileAttributes> SimulatedFileManager::attributes(const Path& path) {
