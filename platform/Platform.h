@@ -8,6 +8,7 @@ namespace sable::platform {
 
 class AccountStore;
 class ActivityScheduler;
+class ApplicationRegistry;
 class CountryConfiguration;
 class DeviceInfo;
 class FileManager;
@@ -56,6 +57,7 @@ class Platform {
   virtual ManagedConfiguration& managedConfiguration() = 0;
   virtual AccountStore& accountStore() = 0;
   virtual MapsService& mapsService() = 0;
+  virtual ApplicationRegistry& applicationRegistry() = 0;
   virtual LanguageTagger& languageTagger() = 0;
   virtual NetworkServiceProxy& networkServiceProxy() = 0;
   virtual UserActivity& userActivity() = 0;

@@ -38,7 +38,7 @@ bool isBeingWritten(const Path& path) {
 struct FileWatcher::State {
   struct Folder {
     Path path;
-    std::set<std::string, std::less<>> names;  ///< what in it is of interest
+    std::set<std::string, std::less<>> names;  ///< what in it is of interest; "": everything
   };
 
   /// Takes watches so that every file's folder, or what is there of the way to it, is covered.
@@ -61,11 +61,23 @@ struct FileWatcher::State {
         covered.try_emplace(number, Folder{folder, {}}).first->second.names.insert(below.filename());
         // What was missing a moment ago may have appeared before the watch was taken.
         std::error_code ignored;
+        if (below == file && !file.has_filename()) coverFoldersIn(folder, covered);
         if (below == file || --attempts == 0 || !std::filesystem::is_directory(below, ignored)) return;
         below = file;
       } else {
         below = folder;
       }
+    }
+  }
+
+  void coverFoldersIn(const Path& folder, std::map<int, Folder>& covered) {
+    std::error_code error;
+    for (std::filesystem::recursive_directory_iterator at(folder, error), end; !error && at != end;
+         at.increment(error)) {
+      std::error_code ignored;
+      if (at->is_symlink(ignored) || !at->is_directory(ignored)) continue;
+      const int number = inotify_add_watch(inotify.number(), at->path().c_str(), kMask);
+      if (number >= 0) covered.try_emplace(number, Folder{at->path(), {""}});
     }
   }
 
@@ -76,7 +88,8 @@ struct FileWatcher::State {
     if ((event.mask & kFolderGone) != 0) return true;
     if (event.len == 0) return false;
     const std::string_view name = static_cast<const char*>(event.name);
-    if (!folder->second.names.contains(name)) return false;
+    const auto& names = folder->second.names;
+    if (!names.contains(name) && !names.contains("")) return false;
     return (event.mask & IN_CREATE) == 0 || !isBeingWritten(folder->second.path / name);
   }
 
@@ -120,7 +133,7 @@ FileWatcher::FileWatcher(Reactor& reactor, std::vector<Path> files, std::functio
   state_->changed = std::move(changed);
   state_->inotify = Descriptor(inotify_init1(IN_NONBLOCK | IN_CLOEXEC));
   if (!state_->inotify) {
-    platformLog().error("changes of settings and facts go unseen: {}", posixError(errno, "inotify").reason);
+    platformLog().error("changes of files go unseen: {}", posixError(errno, "inotify").reason);
     return;
   }
   state_->cover();

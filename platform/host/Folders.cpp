@@ -5,6 +5,7 @@
 
 #include <array>
 #include <cstdlib>
+#include <sstream>
 
 #include "platform/Subsystem.h"
 
@@ -40,6 +41,15 @@ Path homeFolder(const Environment& environment) {
   return "/";
 }
 
+std::vector<Path> dataFolders(const Environment& environment, const Path& home) {
+  std::vector<Path> folders{xdgFolder(environment, "XDG_DATA_HOME").value_or(home / ".local" / "share")};
+  std::istringstream list(environment("XDG_DATA_DIRS").value_or("/usr/local/share:/usr/share"));
+  for (std::string folder; std::getline(list, folder, ':');) {
+    if (folder.starts_with('/')) folders.emplace_back(std::move(folder));
+  }
+  return folders;
+}
+
 }  // namespace
 
 std::optional<std::string> processEnvironment(const char* name) {
@@ -65,6 +75,7 @@ Folders Folders::fromEnvironment(const Environment& environment) {
   folders.state =
       given("SABLED_STATE_DIR").value_or(below("XDG_STATE_HOME", home / ".local" / "state") / kName);
   folders.config = given("SABLED_CONFIG_DIR").value_or(below("XDG_CONFIG_HOME", home / ".config") / kName);
+  folders.data = dataFolders(environment, home);
   folders.profileSettings = given("SABLED_PROFILE").value_or(etc / "defaults.toml");
   folders.systemFacts = etc / "facts.toml";
   return folders;

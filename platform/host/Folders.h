@@ -5,6 +5,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 namespace sable::platform::host {
 
@@ -21,6 +22,8 @@ struct Folders {
   std::filesystem::path caches;      ///< ours below it (0700)
   std::filesystem::path state;       ///< what must survive (0700)
   std::filesystem::path config;      ///< what the user writes
+  /// Where programs put what others may read, the more important first.
+  std::vector<std::filesystem::path> data;
 
   std::filesystem::path profileSettings;  ///< a file, as are all below
   std::filesystem::path systemFacts;
@@ -36,7 +39,8 @@ struct Folders {
 
   /// Each folder is the first that is set of: its own variable (SABLED_RUNTIME_DIR, SABLED_CACHES_DIR,
   /// SABLED_STATE_DIR, SABLED_CONFIG_DIR; SABLED_PROFILE for the profile's file), the XDG variable
-  /// (where absolute: XDG Base Directory Specification), the usual place below the home folder.
+  /// (where absolute: XDG Base Directory Specification), the usual place below the home folder. Data
+  /// folders are those of XDG_DATA_HOME and XDG_DATA_DIRS.
   static Folders fromEnvironment(const Environment& environment = processEnvironment);
 };
 

@@ -4,6 +4,7 @@
 #include <nlohmann/json.hpp>
 
 #include "platform/AccountStore.h"
+#include "platform/ApplicationRegistry.h"
 #include "platform/CountryConfiguration.h"
 #include "platform/LocaleInfo.h"
 #include "platform/Log.h"
@@ -27,8 +28,8 @@ struct Subject {
   Answer answer = nullptr;
 };
 
-const std::array<Subject, 8>& subjects() {
-  static const std::array<Subject, 8> all{
+const std::array<Subject, 9>& subjects() {
+  static const std::array<Subject, 9> all{
       Subject{kCurrentLocaleDidChangeNotification,
               {"calendar", "measurement_system", "temperature_unit", "preferred_languages", "system_language",
                "hour_cycle_24"},
@@ -43,6 +44,7 @@ const std::array<Subject, 8>& subjects() {
       Subject{kMapsServiceDidChangeNotification, {"geo_session_id", "geo_environment", "geo_metadata"}},
       Subject{kLocationFactsDidChangeNotification, {"location"}},
       Subject{kPowerSourceDidChangeNotification, {"on_battery"}},
+      Subject{kApplicationsDidChangeNotification, {"applications"}},
   };
   return all;
 }
@@ -142,11 +144,19 @@ std::optional<std::vector<std::string>> HostFacts::strings(std::string_view key)
   return stringsMember(*facts(), key);
 }
 
-std::shared_ptr<const Dictionary> HostFacts::table(std::string_view key) const {
+std::shared_ptr<const Dictionary> HostFacts::find(std::string_view key,
+                                                  bool (Dictionary::*is)() const noexcept) const {
   auto all = facts();
   const auto found = all->find(key);
-  if (found == all->end() || !found->is_object()) return nullptr;
+  if (found == all->end() || !((*found).*is)()) return nullptr;
   return {std::move(all), &*found};
+}
+
+std::shared_ptr<const Dictionary> HostFacts::table(std::string_view key) const {
+  return find(key, &Dictionary::is_object);
+}
+std::shared_ptr<const Dictionary> HostFacts::tables(std::string_view key) const {
+  return find(key, &Dictionary::is_array);
 }
 
 std::string HostFacts::localeIdentifier() const {

@@ -43,6 +43,8 @@ class HostFacts {
   std::optional<std::vector<std::string>> strings(std::string_view key) const;
   /// Null when there is none.
   std::shared_ptr<const Dictionary> table(std::string_view key) const;
+  /// Likewise, an array.
+  std::shared_ptr<const Dictionary> tables(std::string_view key) const;
 
   // What several facilities are asked about: the fact, else the host's answer.
   std::string localeIdentifier() const;
@@ -61,6 +63,7 @@ class HostFacts {
 
   void reload();
   std::shared_ptr<const Dictionary> facts() const;
+  std::shared_ptr<const Dictionary> find(std::string_view key, bool (Dictionary::*is)() const noexcept) const;
   std::vector<std::string> answers() const;
 
   const HostSources sources_;

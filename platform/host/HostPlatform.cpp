@@ -9,6 +9,7 @@
 #include "platform/host/FactFacilities.h"
 #include "platform/host/Folders.h"
 #include "platform/host/HostActivityScheduler.h"
+#include "platform/host/HostApplicationRegistry.h"
 #include "platform/host/HostDeviceInfo.h"
 #include "platform/host/HostFacts.h"
 #include "platform/host/HostFileManager.h"
@@ -82,6 +83,7 @@ struct HostPlatform::Facilities {
   Lazy<HostManagedConfiguration> managedConfiguration;
   Lazy<HostAccountStore> accountStore;
   Lazy<HostMapsService> mapsService;
+  Lazy<HostApplicationRegistry> applicationRegistry;
   Lazy<HostUserActivity> userActivity;
   Lazy<HostActivityScheduler> activityScheduler;
 };
@@ -183,6 +185,12 @@ AccountStore& HostPlatform::accountStore() {
 }
 MapsService& HostPlatform::mapsService() {
   return facilities_->mapsService.get(facilities_->runtime, facilities_->hostFacts());
+}
+
+ApplicationRegistry& HostPlatform::applicationRegistry() {
+  auto& facilities = *facilities_;
+  return facilities.applicationRegistry.get(facilities.folders, facilities.hostFacts(),
+                                            facilities.runtime.reactor(), facilities.notificationCenter);
 }
 
 UserActivity& HostPlatform::userActivity() {

@@ -43,6 +43,7 @@ class HostPlatform final : public Platform {
   ManagedConfiguration& managedConfiguration() override;
   AccountStore& accountStore() override;
   MapsService& mapsService() override;
+  ApplicationRegistry& applicationRegistry() override;
   LanguageTagger& languageTagger() override;
   NetworkServiceProxy& networkServiceProxy() override;
   UserActivity& userActivity() override;

@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "platform/AccountStore.h"
+#include "platform/ApplicationRegistry.h"
 #include "platform/CountryConfiguration.h"
 #include "platform/DeviceInfo.h"
 #include "platform/InputModes.h"
@@ -182,6 +183,28 @@ class SimulatedMapsService final : public MapsService {
   std::optional<std::string> metadata_;
   std::size_t current_ = 0;
   int resets_ = 0;
+};
+
+class SimulatedApplicationRegistry final : public ApplicationRegistry {
+ public:
+  explicit SimulatedApplicationRegistry(NotificationCenter& center) : center_(center) {}
+
+  /// The user installs, updates and removes applications; these are there afterwards.
+  void change(std::vector<InstalledApplication> applications) {
+    applications_ = std::move(applications);
+    center_.post({kApplicationsDidChangeNotification, this, {}});
+  }
+  std::vector<InstalledApplication> installedApplications() override {
+    ++enumerations_;
+    return applications_;
+  }
+
+  int enumerations() const { return enumerations_; }
+
+ private:
+  NotificationCenter& center_;
+  std::vector<InstalledApplication> applications_;
+  int enumerations_ = 0;
 };
 
 }  // namespace sable::platform::simulated

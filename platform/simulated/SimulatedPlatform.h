@@ -48,6 +48,7 @@ class SimulatedPlatform final : public Platform {
   SimulatedManagedConfiguration& managedConfiguration() override { return managedConfiguration_; }
   SimulatedAccountStore& accountStore() override { return accountStore_; }
   SimulatedMapsService& mapsService() override { return mapsService_; }
+  SimulatedApplicationRegistry& applicationRegistry() override { return applicationRegistry_; }
   ScriptLanguageTagger& languageTagger() override { return languageTagger_; }
   ConfiguredServiceProxy& networkServiceProxy() override { return networkServiceProxy_; }
   SimulatedUserActivity& userActivity() override { return userActivity_; }
@@ -70,6 +71,7 @@ class SimulatedPlatform final : public Platform {
   SimulatedManagedConfiguration managedConfiguration_{notificationCenter_};
   SimulatedAccountStore accountStore_{notificationCenter_};
   SimulatedMapsService mapsService_{notificationCenter_};
+  SimulatedApplicationRegistry applicationRegistry_{notificationCenter_};
   ScriptLanguageTagger languageTagger_;
   ConfiguredServiceProxy networkServiceProxy_;
   SimulatedUserActivity userActivity_;
