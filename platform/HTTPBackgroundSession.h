@@ -48,7 +48,7 @@ class HTTPBackgroundSessionDelegate {
 
 struct HTTPBackgroundSessionConfiguration {
   std::string identifier;      ///< names the session's tasks on disk
-  bool discretionary = false;  ///< wait while the device is on battery and low, or the network is metered
+  bool discretionary = false;  ///< wait while the device is on battery, or the network is metered
   bool allowsExpensiveNetworkAccess = true;            ///< run while the network is metered
   Duration requestTimeout = std::chrono::seconds(60);  ///< of one attempt, without a byte of progress
   Duration resourceTimeout =
@@ -57,10 +57,18 @@ struct HTTPBackgroundSessionConfiguration {
 };
 
 /// Transfers that outlive the process. An accepted task is on disk before the call returns, is tried
-/// again with growing pauses (first within 5 s, then doubling to an hour, with jitter, not before a
-/// Retry-After of RFC 9110 section 10.2.3 where a 503 or 429 carries one) until a response
-/// arrives or its resource time-out is over, and is resumed by the next process
-/// that makes the session. Any thread; the calls that accept a task wait for the disk.
+/// again after transport errors and a 503 or 429 with Retry-After (platform/TransferRetry.h), until
+/// another response has arrived whole or its resource time-out is over, and is resumed by the next
+/// process that makes the session. Any thread; the calls that accept a task wait for the disk.
+///
+///     accepted --resume--> waiting --due, and allowed--> running --whole response, hopeless error--> ended
+///                            ^                              |                                          |
+///                            '---- pause: error, "later" ---'                            delegate called,
+///                            noted
+///
+/// Where the process is killed, whatever runs is waiting in the next one: a body that the service has
+/// taken while we died is sent once more. Where it is killed after the delegate has been called and
+/// before that is noted, some milliseconds, the delegate hears of the end once more.
 class HTTPBackgroundSession {
  public:
   virtual ~HTTPBackgroundSession() = default;
@@ -70,7 +78,8 @@ class HTTPBackgroundSession {
   /// work this upload stands for, see hasAccepted(). Begins with resume(), or with the next process.
   virtual Expected<std::int64_t> uploadTask(const HTTPRequest& request, const std::filesystem::path& body,
                                             std::string description, std::string_view token) = 0;
-  /// Accepts a download, to be run within `window` when the device has time for it.
+  /// Accepts a download, to be run within `window` when the device has time for it: a discretionary
+  /// session's waits no longer than that for external power.
   virtual Expected<std::int64_t> downloadTask(const HTTPRequest& request, std::string description,
                                               Duration window) = 0;
   /// Whether an upload with this token was ever accepted: running, waiting, or ended within the

@@ -159,10 +159,20 @@ class HTTPSession {
   virtual void purgeMemoryCache() = 0;
 };
 
+// platform/HTTPBackgroundSession.h
+class HTTPBackgroundSession;
+class HTTPBackgroundSessionDelegate;
+struct HTTPBackgroundSessionConfiguration;
+
 class HTTPSessions {
  public:
   virtual ~HTTPSessions() = default;
   virtual std::unique_ptr<HTTPSession> session(HTTPSessionConfiguration configuration) = 0;
+  /// Goes on with the transfers that an earlier process has left under the configuration's identifier;
+  /// costs next to nothing where there are none. `delegate` outlives the session, and may be called
+  /// before this returns. One session of an identifier at a time.
+  virtual std::unique_ptr<HTTPBackgroundSession> backgroundSession(
+      HTTPBackgroundSessionConfiguration configuration, HTTPBackgroundSessionDelegate& delegate) = 0;
 };
 
 }  // namespace sable::platform

@@ -2,8 +2,9 @@
 
 #include "SableKit/SBLConstants.h"
 #include "platform/FileManager.h"
-#include "platform/HTTPSession.h"
+#include "platform/HTTPBackgroundSession.h"
 #include "platform/NotificationCenter.h"
+#include "platform/ProgrammingError.h"
 #include "platform/Tally.h"
 #include "platform/UserDefaults.h"
 #include "sabled/BackgroundFlusher.h"
@@ -64,6 +65,33 @@ platform::HTTPSession& Assembly::bagSession() {
     bagSession_ = platform.httpSessions().session(configuration);
   });
   return *bagSession_;
+}
+
+platform::HTTPBackgroundSession& Assembly::downloadURLSession() {
+  std::call_once(downloadURLSessionOnce_, [this] {
+    if (downloadSessionDelegate == nullptr) platform::programmingError("downloads without a delegate");
+    platform::HTTPBackgroundSessionConfiguration configuration;
+    configuration.identifier = "com.kestrel.sabled";
+    configuration.discretionary = true;
+    configuration.allowsExpensiveNetworkAccess = false;
+    downloadURLSession_ =
+        platform.httpSessions().backgroundSession(std::move(configuration), *downloadSessionDelegate);
+  });
+  return *downloadURLSession_;
+}
+
+platform::HTTPBackgroundSession& Assembly::uploadURLSession() {
+  std::call_once(uploadURLSessionOnce_, [this] {
+    if (uploadSessionDelegate == nullptr) platform::programmingError("uploads without a delegate");
+    platform::HTTPBackgroundSessionConfiguration configuration;
+    configuration.identifier = "com.kestrel.sabled.flusher.webpipe";
+    configuration.discretionary = true;
+    configuration.requestTimeout = std::chrono::seconds(300);
+    configuration.resourceTimeout = std::chrono::seconds(604800);
+    uploadURLSession_ =
+        platform.httpSessions().backgroundSession(std::move(configuration), *uploadSessionDelegate);
+  });
+  return *uploadURLSession_;
 }
 
 }  // namespace sable

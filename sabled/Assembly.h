@@ -6,8 +6,10 @@
 #include "platform/Platform.h"
 
 namespace sable::platform {
+class HTTPBackgroundSession;
+class HTTPBackgroundSessionDelegate;
 class HTTPSession;
-}
+}  // namespace sable::platform
 
 namespace sable {
 
@@ -62,9 +64,19 @@ class Assembly {
   platform::HTTPSession& urlSession();  ///< searches, warm-up, images; with a response cache
   platform::HTTPSession& bagSession();  ///< bag fetches; without a cache
 
+  // Background sessions, likewise. Their delegates are services: each sets its own here before anyone
+  // asks for the session, and asks for it itself at start-up, so that what an earlier process has left
+  // goes on. It must be ready to be called by then, on the session's callback queue.
+  platform::HTTPBackgroundSessionDelegate* downloadSessionDelegate = nullptr;  ///< downloadManager
+  platform::HTTPBackgroundSessionDelegate* uploadSessionDelegate = nullptr;    ///< backgroundFlusher
+  platform::HTTPBackgroundSession& downloadURLSession();                       ///< resources
+  platform::HTTPBackgroundSession& uploadURLSession();                         ///< feedback
+
  private:
-  std::once_flag urlSessionOnce_, bagSessionOnce_;
+  // Destroyed first: delegates outlive their sessions.
+  std::once_flag urlSessionOnce_, bagSessionOnce_, downloadURLSessionOnce_, uploadURLSessionOnce_;
   std::unique_ptr<platform::HTTPSession> urlSession_, bagSession_;
+  std::unique_ptr<platform::HTTPBackgroundSession> downloadURLSession_, uploadURLSession_;
 };
 
 }  // namespace sable

@@ -458,7 +458,9 @@ class ScriptedSession : public ::testing::Test {
   }
 
   simulated::SimulatedRuntime runtime_;
-  simulated::SimulatedHTTPSessions sessions_{runtime_};
+  NotificationCenter center_;
+  simulated::SimulatedFileManager files_{runtime_};
+  simulated::SimulatedHTTPSessions sessions_{runtime_, center_, files_};
   simulated::ScriptedService& service_ = sessions_.service();
   std::unique_ptr<HTTPSession> session_;
   std::vector<HTTPResult> results_;

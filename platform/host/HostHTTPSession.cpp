@@ -6,6 +6,7 @@
 #include <unordered_map>
 #include <vector>
 
+#include "platform/HTTPBackgroundSession.h"
 #include "platform/host/CurlMulti.h"
 #include "platform/host/CurlTransfer.h"
 #include "platform/host/ResponseCache.h"
@@ -344,6 +345,11 @@ void HostHTTPSession::purgeMemoryCache() {
 std::unique_ptr<HTTPSession> HostHTTPSessions::session(HTTPSessionConfiguration configuration) {
   return std::make_unique<HostHTTPSession>(runtime_, std::move(configuration),
                                            cacheFolder_ / "http" / "cache.db");
+}
+
+std::unique_ptr<HTTPBackgroundSession> HostHTTPSessions::backgroundSession(HTTPBackgroundSessionConfiguration,
+                                                                           HTTPBackgroundSessionDelegate&) {
+  return nullptr;
 }
 
 }  // namespace sable::platform::host

@@ -46,6 +46,9 @@ class HostHTTPSessions final : public HTTPSessions {
       : runtime_(runtime), cacheFolder_(std::move(cacheFolder)) {}
 
   std::unique_ptr<HTTPSession> session(HTTPSessionConfiguration configuration) override;
+  /// Null: transfers that outlive the process are the next step.
+  std::unique_ptr<HTTPBackgroundSession> backgroundSession(HTTPBackgroundSessionConfiguration configuration,
+                                                           HTTPBackgroundSessionDelegate& delegate) override;
 
  private:
   HostRuntime& runtime_;

@@ -2,6 +2,9 @@
 
 #include <algorithm>
 
+#include "platform/NotificationCenter.h"
+#include "platform/simulated/SimulatedTransfers.h"
+
 namespace sable::platform::simulated {
 namespace {
 
@@ -80,7 +83,8 @@ class SimulatedTask final : public HTTPDataTask, public std::enable_shared_from_
     result.timing.responseBodyBytes = static_cast<std::int64_t>(std::min(size, limit));
     result.timing.requestBodyBytes = request_.body ? static_cast<std::int64_t>(request_.body->size()) : 0;
     result.timing.protocol = "http/1.1";
-    result.response = HTTPResponse{request_.url, answer_.status, answer_.headers, false};
+    result.response = HTTPResponse{answer_.url.empty() ? request_.url : answer_.url, answer_.status,
+                                   answer_.headers, false};
     result.data = makeData(answer_.body.substr(0, limit));
     if (size > limit) {
       result.error = httpError(HTTPErrorCode::responseTooLarge, "body is larger than allowed");
@@ -145,10 +149,39 @@ Scripted ScriptedService::answer(RecordedRequest request) {
   return answer;
 }
 
+SimulatedHTTPSessions::SimulatedHTTPSessions(Runtime& runtime, NotificationCenter& center, FileManager& files)
+    : runtime_(runtime), center_(center), files_(files), disk_(std::make_shared<SimulatedTransferDisk>()) {}
+
+SimulatedHTTPSessions::~SimulatedHTTPSessions() = default;
+
 std::unique_ptr<HTTPSession> SimulatedHTTPSessions::session(HTTPSessionConfiguration configuration) {
   auto queue = runtime_.serialQueue(configuration.label);
   return std::make_unique<SimulatedHTTPSession>(
       Shared{runtime_, service_, std::move(configuration), std::move(queue)});
+}
+
+std::unique_ptr<HTTPBackgroundSession> SimulatedHTTPSessions::backgroundSession(
+    HTTPBackgroundSessionConfiguration configuration, HTTPBackgroundSessionDelegate& delegate) {
+  HTTPSessionConfiguration attempts;
+  attempts.label = configuration.identifier;
+  attempts.maximumResponseBytes = configuration.maximumDownloadBytes;
+  auto host =
+      std::make_unique<SimulatedTransferHost>(disk_, files_, session(std::move(attempts)), configuration);
+  return std::make_unique<BackgroundTransfers>(runtime_, center_, std::move(host), std::move(configuration),
+                                               delegate);
+}
+
+void SimulatedHTTPSessions::setConditions(const TransferConditions& conditions) {
+  disk_->conditions = conditions;
+  center_.post({kTransferConditionsDidChangeNotification, this, {}});
+}
+
+void SimulatedHTTPSessions::failAccepting(int number) {
+  disk_->failure = number;
+}
+
+std::vector<BackgroundTransfer> SimulatedHTTPSessions::pendingTransfers() const {
+  return disk_->unreported("");
 }
 
 }  // namespace sable::platform::simulated

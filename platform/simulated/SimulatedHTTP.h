@@ -6,15 +6,20 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/BackgroundTransfers.h"
+#include "platform/FileManager.h"
 #include "platform/HTTPSession.h"
 
 namespace sable::platform::simulated {
+
+struct SimulatedTransferDisk;
 
 /// What the scripted service answers: a response, or an error in its place.
 struct Scripted {
   int status = 200;
   HTTPHeaders headers;
   std::string body;
+  std::string url;                  ///< after redirects; the request's when empty
   std::optional<Duration> latency;  ///< the service's default when absent
   std::optional<HTTPErrorCode> error;
 };
@@ -68,16 +73,32 @@ class ScriptedService {
 
 /// Sessions that talk to a ScriptedService. They keep the contract of HTTPSession: limits, time-outs,
 /// cancelling, invalid requests; a cache is claimed as configured, but nothing is stored.
+/// What background sessions keep, they keep here: a daemon that is made anew on the device goes on
+/// with what an earlier one has left. The bodies of uploads come from `files`, the responses of
+/// downloads go there.
 class SimulatedHTTPSessions final : public HTTPSessions {
  public:
-  explicit SimulatedHTTPSessions(Runtime& runtime) : runtime_(runtime) {}
+  SimulatedHTTPSessions(Runtime& runtime, NotificationCenter& center, FileManager& files);
+  ~SimulatedHTTPSessions() override;
 
   ScriptedService& service() { return service_; }
   std::unique_ptr<HTTPSession> session(HTTPSessionConfiguration configuration) override;
+  std::unique_ptr<HTTPBackgroundSession> backgroundSession(HTTPBackgroundSessionConfiguration configuration,
+                                                           HTTPBackgroundSessionDelegate& delegate) override;
+
+  /// What discretionary transfers wait for becomes this.
+  void setConditions(const TransferConditions& conditions);
+  /// From now on no transfer is accepted, with this errno value; 0 ends that.
+  void failAccepting(int number);
+  /// The transfers whose end no delegate has heard of.
+  std::vector<BackgroundTransfer> pendingTransfers() const;
 
  private:
   Runtime& runtime_;
+  NotificationCenter& center_;
+  FileManager& files_;
   ScriptedService service_;
+  const std::shared_ptr<SimulatedTransferDisk> disk_;
 };
 
 }  // namespace sable::platform::simulated

@@ -80,7 +80,7 @@ class SimulatedPlatform final : public Platform {
   SimulatedRuntime runtime_;
   SimulatedProcess process_{runtime_};
   SimulatedRelay relay_{runtime_};
-  SimulatedHTTPSessions httpSessions_{runtime_};
+  SimulatedHTTPSessions httpSessions_{runtime_, notificationCenter_, fileManager_};
   SimulatedActivityScheduler activityScheduler_{runtime_, notificationCenter_};
 };
 
