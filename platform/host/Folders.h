@@ -28,6 +28,8 @@ struct Folders {
   std::filesystem::path profileSettings;  ///< a file, as are all below
   std::filesystem::path systemFacts;
 
+  /// Ours rather than everybody's: a daemon that is confined may write nowhere else.
+  std::filesystem::path temporary() const { return caches / "temporary"; }
   std::filesystem::path socket() const { return runtime / "relay.sock"; }
   std::filesystem::path userSettings() const { return config / "defaults.toml"; }
   std::filesystem::path sharedSettings(std::string_view domain) const { return (config / domain) += ".toml"; }

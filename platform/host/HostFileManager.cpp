@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <climits>
 #include <cstdio>
+#include <cstdlib>
 #include <functional>
 
 #include "platform/host/OpenFiles.h"
@@ -169,6 +170,34 @@ Expected<void> HostFileManager::remove(const Path& path) {
   const std::string name = path.filename();
   if (unlinkat(folder->number(), name.c_str(), 0) != 0) return failed(errno, path);
   return {};
+}
+
+Expected<void> HostFileManager::rename(const Path& path, const std::string& name) {
+  const auto folder = openTrustedFolder(path.parent_path(), MissingFolders::fail);
+  if (!folder) return tl::unexpected(folder.error());
+  const std::string oldName = path.filename();
+  if (renameat(folder->number(), oldName.c_str(), folder->number(), name.c_str()) != 0) {
+    return failed(errno, path);
+  }
+  return {};
+}
+
+Expected<Path> HostFileManager::temporaryDirectory() {
+  if (auto created = createDirectory(folders_.temporary()); !created) {
+    return tl::unexpected(std::move(created.error()));
+  }
+  return folders_.temporary();
+}
+
+Expected<Path> HostFileManager::createUniqueFile(const Path& path) {
+  // Refuses a folder that somebody else has prepared; nobody else can change it afterwards.
+  if (const auto folder = openTrustedFolder(path.parent_path(), MissingFolders::fail); !folder) {
+    return tl::unexpected(folder.error());
+  }
+  std::string name = path;
+  const Descriptor file(mkostemp(name.data(), O_CLOEXEC));
+  if (!file) return failed(errno, path);
+  return name;
 }
 
 Expected<void> HostFileManager::createFile(const Path& path) {

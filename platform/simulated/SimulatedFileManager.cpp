@@ -132,6 +132,31 @@ Expected<void> SimulatedFileManager::remove(const Path& path) {
   return {};
 }
 
+Expected<void> SimulatedFileManager::rename(const Path& path, const std::string& name) {
+  const auto file = find(path);
+  if (!file) return tl::unexpected(file.error());
+  const Path from = path.lexically_normal(), to = from.parent_path() / name;
+  if (directories_.contains(to)) return failed(EISDIR, path);
+  files_.insert_or_assign(to, std::move(**file));
+  creationDates_.insert_or_assign(to, creationDates_.at(from));
+  if (from != to) files_.erase(from);
+  return {};
+}
+
+Expected<Path> SimulatedFileManager::temporaryDirectory() {
+  const Path path = "/home/user/.cache/com.kestrel.sabled/temporary";
+  if (auto created = createDirectory(path); !created) return tl::unexpected(created.error());
+  return path;
+}
+
+Expected<Path> SimulatedFileManager::createUniqueFile(const Path& path) {
+  std::string name = path;
+  const std::string number = std::to_string(1'000'000 + uniqueNames_++).substr(1);
+  name.replace(name.size() - number.size(), number.size(), number);
+  if (auto created = createFile(name); !created) return tl::unexpected(created.error());
+  return name;
+}
+
 Expected<void> SimulatedFileManager::createFile(const Path& path) {
   const auto file = find(path);
   if (file || file.error().code == EISDIR) return failed(EEXIST, path);

@@ -22,6 +22,9 @@ class SimulatedFileManager final : public FileManager {
   Expected<void> replaceItem(const std::filesystem::path& path,
                              const std::filesystem::path& replacement) override;
   Expected<void> remove(const std::filesystem::path& path) override;
+  Expected<void> rename(const std::filesystem::path& path, const std::string& name) override;
+  Expected<std::filesystem::path> temporaryDirectory() override;
+  Expected<std::filesystem::path> createUniqueFile(const std::filesystem::path& path) override;
   Expected<void> createFile(const std::filesystem::path& path) override;
   Expected<std::unique_ptr<AppendableFile>> openForAppending(const std::filesystem::path& path) override;
   Expected<std::unique_ptr<ReadableFile>> openForReading(const std::filesystem::path& path) override;
@@ -46,6 +49,7 @@ class SimulatedFileManager final : public FileManager {
   std::map<std::filesystem::path, WallTime> creationDates_;
   std::set<std::filesystem::path> directories_{"/"};
   int failure_ = 0;
+  unsigned uniqueNames_ = 0;
 };
 
 }  // namespace sable::platform::simulated
