@@ -32,6 +32,17 @@ constexpr std::array kEndpointMethods{
     RelayMethod{"LoadImages", "aa{sv}t", "a{say}"},
 };
 
+constexpr std::array kFlusherListenerMethods{
+    RelayMethod{"InitiateConnectionWithIntent", "t", ""},
+};
+
+constexpr std::array kFlusherListenerRelayMethods{
+    RelayMethod{"WorkDone", "", ""},
+    RelayMethod{"ReceiveFeedback", "s", ""},
+    RelayMethod{"ReceiveSessions", "as", ""},
+    RelayMethod{"Dropped", "t", ""},
+};
+
 }  // namespace
 
 const platform::RelayInterface kSBLDaemonRelay{"com.kestrel.SBLDaemonRelay", "/com/kestrel/sabled",
@@ -42,5 +53,9 @@ const platform::RelayInterface kSBLClientRelay{"com.kestrel.SBLClientRelay", "/c
                                                kClientMethods};
 const platform::RelayInterface kSBLEndpointRelay{"com.kestrel.SBLEndpointRelay", "/com/kestrel/endpoint",
                                                  kEndpointMethods};
+const platform::RelayInterface kSBLFlusherListener{"com.kestrel.SBLFlusherListener", "/com/kestrel/flusher",
+                                                   kFlusherListenerMethods};
+const platform::RelayInterface kSBLFlusherListenerRelay{"com.kestrel.SBLFlusherListenerRelay",
+                                                        "/com/kestrel/client", kFlusherListenerRelayMethods};
 
 }  // namespace sable

@@ -49,4 +49,24 @@ struct SBLEndpointRelay {
   };
 };
 
+/// Exported by the daemon on the endpoint that `listenToFlusher` answers with.
+extern const platform::RelayInterface kSBLFlusherListener;
+struct SBLFlusherListener {
+  enum Method : std::size_t {
+    initiateConnectionWithIntent,  ///< t intent: 0 watch sessions, 1 watch feedback, 2 stop, 3 dump
+  };
+};
+
+/// Implemented by the tool at the other end of that endpoint. It answers each call when it is ready
+/// for more.
+extern const platform::RelayInterface kSBLFlusherListenerRelay;
+struct SBLFlusherListenerRelay {
+  enum Method : std::size_t {
+    workDone,         ///< what stop or dump asked for is done
+    receiveFeedback,  ///< s feedback as JSON
+    receiveSessions,  ///< as envelopes as JSON
+    dropped,          ///< t records that were left out here, for the tool did not keep up
+  };
+};
+
 }  // namespace sable

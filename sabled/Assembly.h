@@ -20,6 +20,7 @@ class ImageFetcher;
 class Lookup;
 class SBLNetworkRequestFactory;
 class SableBagController;
+class SableFlusherRelay;
 class SablePersistentStorage;
 class SableUserGUIDController;
 
@@ -50,6 +51,7 @@ class Assembly {
   std::unique_ptr<SableUserGUIDController> guidController;
   /// Of the daemon itself, and of all clients where they share a session.
   std::unique_ptr<ClientSessionManager> clientSessionManager;
+  std::unique_ptr<SableFlusherRelay> flusherRelayListener;
   std::unique_ptr<ImageFetcher> imageFetcher;
   std::unique_ptr<Lookup> lookup;
   std::unique_ptr<SableBagController> bagController;

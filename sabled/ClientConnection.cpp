@@ -19,6 +19,7 @@
 #include "sabled/KeyboardLocale.h"
 #include "sabled/RequestReply.h"
 #include "sabled/SableBagController.h"
+#include "sabled/SableFlusherRelay.h"
 #include "sabled/SableLogging.h"
 #include "sabled/SearchExplanation.h"
 #include "sabled/UserAgent.h"
@@ -96,7 +97,7 @@ void ClientConnection::handleInvocation(platform::RelayCall call) {
       return feedback(std::move(call.reply));
     case SBLDaemonRelay::listenToFlusher:
       _ensureState();
-      return call.reply.fail("org.freedesktop.DBus.Error.NotSupported", "this daemon uploads no sessions");
+      return call.reply(assembly_.flusherRelayListener->endpoint());
     case SBLDaemonRelay::listSessions:
       return listSessions(std::move(call.reply));
     case SBLDaemonRelay::fileHandleAndAttributesForResource:
@@ -307,6 +308,15 @@ void ClientConnection::fileHandleAndAttributesForResource(const std::string& ide
   reply(platform::RelayFile{}, RelayRecord{},
         encodeError(makeSBLError(SBLErrorCode::daemonSide,
                                  "identifier: " + identifier + " exception: no download manager")));
+}
+
+void ClientConnection::flushSession(platform::Function<void(const std::optional<std::string>&)> callback) {
+  connection_->queue().async([self = shared_from_this(), callback = std::move(callback)]() mutable {
+    auto* manager = self->state_ == nullptr ? nullptr : self->state_->sessionManager();
+    if (manager == nullptr) return callback(std::nullopt);
+    manager->flushSession([agent = self->state_->userAgent().value_or(""),
+                           callback = std::move(callback)]() mutable { callback(agent); });
+  });
 }
 
 void ClientConnection::flushSessionInvalidation(platform::Function<void(bool)> callback) {

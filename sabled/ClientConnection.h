@@ -44,6 +44,10 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   const platform::RelayConnection& connection() const { return *connection_; }
   const std::shared_ptr<ClientState>& state() const { return state_; }
 
+  /// Ends the session that the client's feedback goes into, also where others share it; calls back, later
+  /// and on any queue, with the client's user agent, or with nothing where no sessions are kept for it.
+  void flushSession(platform::Function<void(const std::optional<std::string>&)> callback);
+
   /// Ends the client's session, where it has one of its own; tells whether it did, on any queue.
   /// Called when the connection has ended.
   void flushSessionInvalidation(platform::Function<void(bool)> callback);

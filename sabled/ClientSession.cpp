@@ -16,6 +16,7 @@
 #include "sabled/FileContainer.h"
 #include "sabled/ParsedMessage.h"
 #include "sabled/SableFeedback.h"
+#include "sabled/SableFlusherRelay.h"
 #include "sabled/SableLogging.h"
 #include "sabled/SablePersistentStorage.h"
 #include "sabled/SableUserGUIDController.h"
@@ -162,6 +163,8 @@ void ClientSession::addFeedback(std::shared_ptr<SableFeedback> feedback) {
 }
 
 void ClientSession::_addFeedback(const std::shared_ptr<SableFeedback>& feedback) {
+  if (assembly_.flusherRelayListener)
+    assembly_.flusherRelayListener->sendDataToReceivingStreamListener(feedback);
   ledger::take(assembly_.tally, *feedback);
   platform::Function<void()> done;
   if (assembly_.testFeedbacks) done = keepWhenWritten(feedback);

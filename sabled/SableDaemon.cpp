@@ -13,6 +13,7 @@
 #include "sabled/Lookup.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SableBagController.h"
+#include "sabled/SableFlusherRelay.h"
 #include "sabled/SableLogging.h"
 #include "sabled/SablePersistentStorage.h"
 #include "sabled/SableService.h"
@@ -32,7 +33,8 @@ Expected<void> SableDaemon::start() {
   registerDefaults();
   createServices();
   if (auto opened = openListener(); !opened) {
-    assembly_.clientStateManager.reset();  // and with it the endpoint that nobody will be told of
+    assembly_.clientStateManager.reset();  // and with them the endpoints that nobody will be told of
+    assembly_.flusherRelayListener.reset();
     return opened;
   }
   installLaunchEventHandlers();

@@ -13,6 +13,7 @@
 #include "sabled/ClientNames.h"
 #include "sabled/ClientSessionManager.h"
 #include "sabled/ClientState.h"
+#include "sabled/SableFlusherRelay.h"
 #include "sabled/SableLogging.h"
 #include "sabled/SableUserGUIDController.h"
 
@@ -31,6 +32,8 @@ SableService::SableService(Assembly& assembly)
   assembly_.guidController = std::make_unique<SableUserGUIDController>(assembly_);
   assembly_.clientSessionManager = std::make_unique<ClientSessionManager>(
       assembly_, *assembly_.guidController, std::string(kSBLServiceName));
+  assembly_.flusherRelayListener =
+      std::make_unique<SableFlusherRelay>(assembly_, [this] { return getClientConnections(); });
 }
 
 SableService::~SableService() = default;
