@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 
 #include "platform/Relay.h"
 
@@ -53,8 +54,16 @@ struct SBLEndpointRelay {
 extern const platform::RelayInterface kSBLFlusherListener;
 struct SBLFlusherListener {
   enum Method : std::size_t {
-    initiateConnectionWithIntent,  ///< t intent: 0 watch sessions, 1 watch feedback, 2 stop, 3 dump
+    initiateConnectionWithIntent,  ///< t intent, an SBLFlusherIntent
   };
+};
+
+/// What a tool asks for; travels as a number: never renumber.
+enum class SBLFlusherIntent : std::uint64_t {
+  watchSessions = 0,  ///< receive every session's envelope when it is uploaded
+  watchFeedback = 1,  ///< receive every feedback when it is added
+  stop = 2,           ///< upload nothing from here on
+  dump = 3,           ///< end all sessions, upload what there is, and go on uploading
 };
 
 /// Implemented by the tool at the other end of that endpoint. It answers each call when it is ready

@@ -70,17 +70,17 @@ void SableFlusherRelay::initiateConnectionWithIntent(std::uint64_t intent, const
                                                      platform::RelayReply reply) {
   // Of several tools the one that speaks is meant, not one that has connected in between.
   flusherrelayQueue_->sync([&] { remoteObject_ = tool; });
-  switch (static_cast<FlusherIntent>(intent)) {
-    case FlusherIntent::watchSessions:
+  switch (static_cast<SBLFlusherIntent>(intent)) {
+    case SBLFlusherIntent::watchSessions:
       flusherrelayQueue_->sync([&] { listenToSessions(tool); });
       break;
-    case FlusherIntent::watchFeedback:
+    case SBLFlusherIntent::watchFeedback:
       flusherrelayQueue_->sync([&] { listenToFeedback(tool); });
       break;
-    case FlusherIntent::stop:
+    case SBLFlusherIntent::stop:
       stop(tool);
       break;
-    case FlusherIntent::dump:
+    case SBLFlusherIntent::dump:
       dump(tool);
       break;
     default:

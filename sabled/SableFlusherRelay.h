@@ -17,14 +17,6 @@ class ClientConnection;
 class FlusherTool;
 class SableFeedback;
 
-/// What a tool asks of the flusher control channel; part of its interface: never renumber.
-enum class FlusherIntent : std::uint64_t {
-  watchSessions = 0,  ///< receive every session's envelope when it is uploaded
-  watchFeedback = 1,  ///< receive every feedback when it is added
-  stop = 2,           ///< upload nothing from here on
-  dump = 3,           ///< end all sessions, upload what there is, and go on uploading
-};
-
 /// The flusher control channel: an anonymous endpoint over which a diagnostic tool watches and steers
 /// the feedback pipeline. Each stream has one listener, the tool that last asked for it. Any thread;
 /// nothing here waits for a tool.

@@ -223,6 +223,15 @@ void addFeedback(CLI::App& app, Invocation& invocation) {
   session.add_option("FILE", *path, "The file")->required()->type_name("");
 }
 
+void addFlusher(CLI::App& app, Invocation& invocation) {
+  const auto sent = std::make_shared<bool>(false);
+  add(app, invocation, "watch", "Show feedback as it is added", [sent](const Context& context) {
+    return runWatch(context, *sent);
+  }).add_flag("--sent", *sent, "Sessions as they are uploaded, in place of feedback");
+  add(app, invocation, "stop", "Upload nothing until the next dump", runStop);
+  add(app, invocation, "dump", "End all sessions, upload them, and go on uploading", runDump);
+}
+
 void addOptions(CLI::App& app, Options& options) {
   app.add_option("--socket", options.socket, "The daemon's socket")->type_name("PATH");
   app.add_option("--identifier", options.identifier, "The client's identifier")
@@ -250,6 +259,7 @@ std::variant<Invocation, ExitCode> readCommandLine(int argc, const char* const* 
   addAnyRequest(app, invocation);
   addQuestions(app, invocation);
   addFeedback(app, invocation);
+  addFlusher(app, invocation);
   try {
     app.parse(argc, argv);
   } catch (const CLI::Success& success) {

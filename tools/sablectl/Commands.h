@@ -40,6 +40,13 @@ struct FeedbackReport {
 };
 ExitCode runReport(const Context& context, const FeedbackReport& report);
 
+// The flusher control channel.
+/// Shows every feedback as it is added, or every session as it is uploaded (`sent`), until the daemon
+/// goes or an interrupt ends the process.
+ExitCode runWatch(const Context& context, bool sent);
+ExitCode runStop(const Context& context);
+ExitCode runDump(const Context& context);
+
 // What its files tell.
 /// A session file, as far as it can be read; kExitError where that is not to its end.
 ExitCode runSessionFile(const Context& context, const std::filesystem::path& path);

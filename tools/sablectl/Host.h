@@ -33,6 +33,8 @@ struct Host {
   std::function<platform::RelayEndpoint(const std::filesystem::path&)> endpointOf;
   std::function<Expected<std::map<std::string, std::int64_t>>(const std::filesystem::path&)> readCounters;
   std::function<std::vector<platform::Availability>()> availability;
+  /// From here on an interrupt or a request to terminate is the orderly end of the process.
+  std::function<void()> exitOnInterrupt;
 };
 
 }  // namespace sable::sablectl

@@ -1,3 +1,6 @@
+#include <unistd.h>
+
+#include <csignal>
 #include <cstdio>
 
 #include "platform/host/Folders.h"
@@ -35,6 +38,11 @@ std::vector<sable::platform::Availability> probe(const host::Folders& folders, h
           host::HostMemoryPressure(runtime.reactor()).availability()};
 }
 
+/// Lines are written whole and at once: nothing is lost.
+void exitOnInterrupt() {
+  for (const int number : {SIGINT, SIGTERM}) std::signal(number, [](int) { _exit(kExitSuccess); });
+}
+
 ExitCode run(const Invocation& invocation) {
   const auto folders = host::Folders::fromEnvironment();
   const auto socket = invocation.options.socket.empty()
@@ -57,6 +65,7 @@ ExitCode run(const Invocation& invocation) {
       .endpointOf = [](const std::filesystem::path& path) { return host::endpointOf(path.native()); },
       .readCounters = host::MappedTally::snapshotOf,
       .availability = [&folders, &runtime] { return probe(folders, runtime); },
+      .exitOnInterrupt = exitOnInterrupt,
   };
   const Output output = Output::standard(invocation.options.json);
   const ExitCode code = invocation.command({machine, invocation.options, output});
