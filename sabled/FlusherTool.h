@@ -1,7 +1,5 @@
 #pragma once
 
-#include <sys/types.h>
-
 #include <cstddef>
 #include <cstdint>
 #include <deque>
@@ -39,7 +37,7 @@ class FlusherTool : public std::enable_shared_from_this<FlusherTool> {
   /// Counts records that were left out.
   void leaveOut(std::uint64_t records);
 
-  pid_t pid() const { return connection_->peer().pid; }
+  platform::RelayPeer peer() const { return connection_->peer(); }
 
  private:
   struct Waiting {

@@ -93,13 +93,13 @@ void SableFlusherRelay::initiateConnectionWithIntent(std::uint64_t intent, const
 void SableFlusherRelay::listenToSessions(const Tool& tool) {
   sendingStreamListener_ = tool;
   sending_ = true;
-  log().standard("new listener for flusher client sessions, delegate: process {}", tool->pid());
+  log().standard("new listener for flusher client sessions, delegate: process {}", tool->peer().pid);
 }
 
 void SableFlusherRelay::listenToFeedback(const Tool& tool) {
   receivingStreamListener_ = tool;
   receiving_ = true;
-  log().standard("new listener for client feedbacks, delegate: process {}", tool->pid());
+  log().standard("new listener for client feedbacks, delegate: process {}", tool->peer().pid);
 }
 
 void SableFlusherRelay::stop(const Tool& tool) {

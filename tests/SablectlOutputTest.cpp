@@ -7,6 +7,7 @@
 #include "tools/sablectl/ImageFile.h"
 #include "tools/sablectl/RecordDocument.h"
 #include "tools/sablectl/RequestRecord.h"
+#include "tools/sablectl/StreamRows.h"
 #include "tools/sablectl/Text.h"
 
 // What sablectl makes of what comes from outside: nothing harmful, columns that hold, and a JSON
@@ -192,6 +193,43 @@ TEST(RecordDocument, BecomesATable) {
   EXPECT_EQ(tableLines(recordDocuments({one, two})),
             (std::vector<std::string>{"identifier  open", "a\\u001b", "b           true"}));
   EXPECT_EQ(tableLines(Dictionary::array()), std::vector<std::string>{"none"});
+}
+
+TEST(StreamRows, HoldTheirColumnsTheirWidthAndNothingHarmful) {
+  Output output;
+  output.width = 80;
+  const platform::WallTime time(std::chrono::milliseconds(7));
+  const auto row = [&](const char* feedback) {
+    return feedbackRow(output, time, Dictionary::parse(feedback));
+  };
+  const std::string::size_type what = feedbackHeading(output).find("what");
+  const struct {
+    const char* feedback;
+    std::string_view cells;  // behind the time
+  } cases[] = {
+      {R"({"type": "search_start", "query_id": 4, "results": [1, 2], "more": {"a": 1}, "trigger_event": "tap",
+           "input": "w", "timestamp": 12})",
+       "search_start                  4  input=w  trigger_event=tap  results=[2]  more={1}"},
+      {R"({"type": "error", "query_id": 0, "a": null, "b": false, "c": "", "d": "unknown", "e": -1})",
+       "error                            e=-1"},
+      {R"({"uuid": "79A14834-90CD-4DE4-AD1B-9B2F33E4C7D1", "x\u001b": "\u202e"})",
+       "                                 uuid=79A14834  x\\u001b=\\u202e"},
+      {R"("no object")", "                                 no object"},
+  };
+  for (const auto& [feedback, cells] : cases) {
+    EXPECT_EQ(row(feedback).substr(what - 33), cut(cells, output.width - (what - 33))) << feedback;
+    EXPECT_LE(displayWidth(row(feedback)), output.width);
+  }
+  const std::string session = sessionRow(output, time,
+                                         {{"fb", {1, 2, 3}},
+                                          {"agent", "Rover/1"},
+                                          {"user_guid", "79A14834-90CD"},
+                                          {"previous_session_end_reason", "idle"}});
+  EXPECT_EQ(session.substr(14), "      3  79A14834  idle                     Rover/1");
+  EXPECT_EQ(sessionHeading(output).find("agent"), session.find("Rover/1"));
+  EXPECT_EQ(sessionRow(output, time, {{"other", 1}}).substr(14), R"({"other":1})");
+  EXPECT_EQ(droppedRow(output, time, 3).substr(14),
+            "3 records left out: they came faster than they were read");
 }
 
 }  // namespace

@@ -11,6 +11,7 @@
 #include "platform/Process.h"
 #include "platform/Relay.h"
 #include "platform/Runtime.h"
+#include "platform/TimedActivityScheduler.h"
 
 namespace sable::sablectl {
 
@@ -33,6 +34,8 @@ struct Host {
   std::function<platform::RelayEndpoint(const std::filesystem::path&)> endpointOf;
   std::function<Expected<std::map<std::string, std::int64_t>>(const std::filesystem::path&)> readCounters;
   std::function<std::vector<platform::Availability>()> availability;
+  /// What the daemon has planned in the background; empty where it has noted nothing.
+  std::function<platform::ActivityRecord()> readActivities;
   /// From here on an interrupt or a request to terminate is the orderly end of the process.
   std::function<void()> exitOnInterrupt;
 };

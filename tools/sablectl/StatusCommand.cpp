@@ -101,6 +101,24 @@ Dictionary bagStatus(const Host& host) {
   return status;
 }
 
+Dictionary activitiesStatus(const Host& host) {
+  const auto now = host.runtime.now();
+  const auto distance = [](const auto& time, const auto& seconds) {
+    return time ? Dictionary(seconds(*time)) : Dictionary(nullptr);
+  };
+  Dictionary activities = Dictionary::array();
+  for (const auto& [identifier, times] : host.readActivities()) {
+    Dictionary one;
+    one["identifier"] = identifier;
+    one["last_run_seconds_ago"] =
+        distance(times.lastRun, [&](auto time) { return secondsBetween(time, now); });
+    one["next_run_in_seconds"] =
+        distance(times.nextRun, [&](auto time) { return secondsBetween(now, time); });
+    activities.push_back(std::move(one));
+  }
+  return activities;
+}
+
 Dictionary facilitiesStatus(const Host& host) {
   Dictionary facilities = Dictionary::array();
   for (const auto& [facility, available, detail] : host.availability()) {
@@ -132,6 +150,18 @@ std::string bagText(const Dictionary& bag) {
   return text;
 }
 
+std::string lastRunText(const Dictionary& activity) {
+  const auto ago = integerMember(activity, "last_run_seconds_ago");
+  return ago ? fmt::format("ran {} ago", duration(*ago)) : "has not run";
+}
+
+std::string nextRunText(const Dictionary& activity) {
+  const auto rest = integerMember(activity, "next_run_in_seconds");
+  if (!rest) return "nothing planned";
+  return *rest < 0 ? fmt::format("was due {} ago", duration(*rest))
+                   : fmt::format("next in {}", duration(*rest));
+}
+
 std::string openerText(const Dictionary& daemon) {
   if (daemon["pid"].is_null()) return "unknown";
   const Dictionary& executable = daemon["executable"];
@@ -160,6 +190,10 @@ void print(const Output& output, const Dictionary& status) {
                                                  : "cannot be seen"});
   }
   section("Files", places);
+  Rows activities;
+  for (const Dictionary& one : status["activities"])
+    activities.push_back({plainText(one["identifier"]), lastRunText(one), nextRunText(one)});
+  if (!activities.empty()) section("In the background", activities);
   Rows facilities;
   for (const Dictionary& one : status["facilities"]) {
     facilities.push_back({plainText(one["facility"]),
@@ -180,6 +214,7 @@ ExitCode runStatus(const Context& context) {
   status["daemon"] = daemonStatus(context, code);
   status["bag"] = bagStatus(context.host);
   status["places"] = placesStatus(context.host);
+  status["activities"] = activitiesStatus(context.host);
   status["facilities"] = facilitiesStatus(context.host);
   if (context.output.json) {
     context.output.document(status);

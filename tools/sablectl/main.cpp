@@ -4,6 +4,7 @@
 #include <cstdio>
 
 #include "platform/host/Folders.h"
+#include "platform/host/HostActivityScheduler.h"
 #include "platform/host/HostFacts.h"
 #include "platform/host/HostFileManager.h"
 #include "platform/host/HostLocation.h"
@@ -38,6 +39,12 @@ std::vector<sable::platform::Availability> probe(const host::Folders& folders, h
           host::HostMemoryPressure(runtime.reactor()).availability()};
 }
 
+sable::platform::ActivityRecord activitiesIn(host::HostFileManager& fileManager,
+                                             const std::filesystem::path& file) {
+  const auto text = fileManager.read(file, host::kMaximumActivityRecordBytes);
+  return text ? host::decodeActivityRecord(*text) : sable::platform::ActivityRecord();
+}
+
 /// Lines are written whole and at once: nothing is lost.
 void exitOnInterrupt() {
   for (const int number : {SIGINT, SIGTERM}) std::signal(number, [](int) { _exit(kExitSuccess); });
@@ -65,6 +72,7 @@ ExitCode run(const Invocation& invocation) {
       .endpointOf = [](const std::filesystem::path& path) { return host::endpointOf(path.native()); },
       .readCounters = host::MappedTally::snapshotOf,
       .availability = [&folders, &runtime] { return probe(folders, runtime); },
+      .readActivities = [&] { return activitiesIn(fileManager, folders.activityRuns()); },
       .exitOnInterrupt = exitOnInterrupt,
   };
   const Output output = Output::standard(invocation.options.json);
