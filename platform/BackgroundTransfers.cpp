@@ -7,6 +7,7 @@
 
 #include "platform/Log.h"
 #include "platform/NotificationCenter.h"
+#include "platform/TimedActivityScheduler.h"
 #include "platform/TimerSet.h"
 #include "platform/TransferRetry.h"
 
@@ -81,18 +82,19 @@ class BackgroundTransfers::Core : public std::enable_shared_from_this<Core> {
 
   // The queue's.
   const std::unique_ptr<BackgroundTransferHost> host_;
-  NotificationCenter::Token conditionsChanged_;
+  NotificationCenter::Token powerChanged_, costChanged_;
   std::map<std::int64_t, Entry> entries_;  // until their end has been reported
   Timer timer_;
 };
 
 void BackgroundTransfers::Core::start(NotificationCenter& center) {
-  conditionsChanged_ = center.observe(std::string(kTransferConditionsDidChangeNotification),
-                                      [weak = weak_from_this(), queue = queue_](const Notification&) {
-                                        queue->async([weak] {
-                                          if (const auto self = weak.lock()) self->goOn();
-                                        });
-                                      });
+  const auto look = [weak = weak_from_this(), queue = queue_](const Notification&) {
+    queue->async([weak] {
+      if (const auto self = weak.lock()) self->goOn();
+    });
+  };
+  powerChanged_ = center.observe(std::string(kPowerSourceDidChangeNotification), look);
+  costChanged_ = center.observe(std::string(kNetworkCostDidChangeNotification), look);
   queue_->async([self = shared_from_this()] {
     if (self->closed_) return;
     for (BackgroundTransfer& transfer : self->host_->unreported()) {
@@ -107,6 +109,7 @@ void BackgroundTransfers::Core::start(NotificationCenter& center) {
 
 Expected<std::int64_t> BackgroundTransfers::Core::accept(BackgroundTransfer transfer, std::string_view token,
                                                          const std::filesystem::path& body) {
+  if (auto error = invalidity(transfer.task.originalRequest)) return tl::unexpected(std::move(*error));
   transfer.accepted = runtime_.now();
   const auto identifier = host_->accept(transfer, token, body);
   if (!identifier) {
@@ -192,17 +195,19 @@ void BackgroundTransfers::Core::expire(Entry& entry) {
 void BackgroundTransfers::Core::begin(Entry& entry) {
   const std::int64_t identifier = entry.transfer.task.identifier;
   const int attempts = ++entry.transfer.attempts;
-  const auto weak = weak_from_this();
+  entry.transfer.running = true;
+  host_->note(entry.transfer);
+  // Whoever calls these must not be the last to hold us: we hold him.
   entry.attempt = host_->attempt(
       entry.transfer,
-      [weak, identifier](std::int64_t sent, std::int64_t expected) {
-        if (const auto self = weak.lock()) self->progressed(identifier, sent, expected);
+      [weak = weak_from_this(), queue = queue_, identifier](std::int64_t sent, std::int64_t expected) {
+        queue->async([weak, identifier, sent, expected] {
+          if (const auto self = weak.lock()) self->progressed(identifier, sent, expected);
+        });
       },
-      [weak, identifier, attempts](HTTPResult result) {
-        const auto self = weak.lock();
-        if (!self) return;
-        self->queue_->async([weak, identifier, attempts, result = std::move(result)]() mutable {
-          if (const auto core = weak.lock()) core->finished(identifier, attempts, std::move(result));
+      [weak = weak_from_this(), queue = queue_, identifier, attempts](HTTPResult result) {
+        queue->async([weak, identifier, attempts, result = std::move(result)]() mutable {
+          if (const auto self = weak.lock()) self->finished(identifier, attempts, std::move(result));
         });
       });
   entry.attempt->resume();
@@ -210,14 +215,10 @@ void BackgroundTransfers::Core::begin(Entry& entry) {
 
 void BackgroundTransfers::Core::progressed(std::int64_t identifier, std::int64_t sent,
                                            std::int64_t expected) {
-  queue_->async([weak = weak_from_this(), identifier, sent, expected] {
-    const auto self = weak.lock();
-    if (!self) return;
-    const auto found = self->entries_.find(identifier);
-    if (found == self->entries_.end() || found->second.transfer.ended) return;
-    self->callbackQueue_->async([self, task = found->second.transfer.task, sent, expected] {
-      if (!self->closed_) self->delegate_.didSendBodyData(task, sent, expected);
-    });
+  const auto found = entries_.find(identifier);
+  if (found == entries_.end() || found->second.transfer.ended) return;
+  callbackQueue_->async([self = shared_from_this(), task = found->second.transfer.task, sent, expected] {
+    if (!self->closed_) self->delegate_.didSendBodyData(task, sent, expected);
   });
 }
 
@@ -227,6 +228,7 @@ void BackgroundTransfers::Core::finished(std::int64_t identifier, int attempts, 
   Entry& entry = found->second;
   if (entry.transfer.ended || entry.transfer.attempts != attempts) return;
   entry.attempt = nullptr;
+  entry.transfer.running = false;
   if (result.response) entry.transfer.task.currentURL = result.response->url;
   entry.transfer.task.response = std::move(result.response);
   if (result.error) {
@@ -254,6 +256,7 @@ void BackgroundTransfers::Core::again(Entry& entry, Duration pause, const std::s
 
 void BackgroundTransfers::Core::end(Entry& entry, std::optional<Error> error) {
   entry.attempt = nullptr;
+  entry.transfer.running = false;
   entry.transfer.ended = true;
   entry.transfer.error = std::move(error);
   entry.transfer.lastAttempt = runtime_.now();
@@ -331,7 +334,8 @@ double BackgroundTransfers::Core::chance() {
 void BackgroundTransfers::Core::close() {
   closed_ = true;
   timer_.cancel();
-  conditionsChanged_.reset();
+  powerChanged_.reset();
+  costChanged_.reset();
   for (auto& [identifier, entry] : entries_) {
     if (entry.attempt) entry.attempt->cancel();
   }

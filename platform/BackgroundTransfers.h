@@ -13,8 +13,8 @@ namespace sable::platform {
 
 class NotificationCenter;
 
-/// Posted when the device goes onto battery or off it, or its network becomes metered or stops being so.
-inline constexpr std::string_view kTransferConditionsDidChangeNotification = "TransferConditionsDidChange";
+/// Posted when the device's network becomes metered or stops being so.
+inline constexpr std::string_view kNetworkCostDidChangeNotification = "NetworkCostDidChange";
 
 /// How often a transfer that waits for better conditions looks for them where the host does not tell.
 inline constexpr Duration kConditionsLook = std::chrono::minutes(15);
@@ -27,6 +27,7 @@ struct BackgroundTransfer {
   int attempts = 0;        ///< that were begun
   WallTime lastAttempt{};  ///< when one last ended
   Duration pause{};        ///< from there to the next one
+  bool running = false;
   bool ended = false;
   std::optional<Error> error;  ///< of its end
 };
@@ -51,7 +52,7 @@ class BackgroundTransferHost {
   /// power cut. Its identifier.
   virtual Expected<std::int64_t> accept(const BackgroundTransfer& transfer, std::string_view token,
                                         const std::filesystem::path& body) = 0;
-  /// Keeps attempts, pause and end.
+  /// Keeps attempts, pause, whether it runs, and its end.
   virtual void note(const BackgroundTransfer& transfer) = 0;
   /// Nobody needs to hear of it again; its files are gone with that.
   virtual void noteReported(const BackgroundTransfer& transfer) = 0;
@@ -79,7 +80,8 @@ class BackgroundTransferHost {
 /// every process gives each transfer at least one attempt's time.
 class BackgroundTransfers final : public HTTPBackgroundSession {
  public:
-  /// All references outlive the session.
+  /// `center` posts that notification, and kPowerSourceDidChangeNotification. All references outlive the
+  /// session.
   BackgroundTransfers(Runtime& runtime, NotificationCenter& center,
                       std::unique_ptr<BackgroundTransferHost> host,
                       HTTPBackgroundSessionConfiguration configuration,

@@ -76,6 +76,7 @@ class HTTPBackgroundSession {
   /// Accepts an upload of the file as it is now; the session takes its own copy, the file may be
   /// removed at once. `description` comes back with the task. A `token` that is not empty marks the
   /// work this upload stands for, see hasAccepted(). Begins with resume(), or with the next process.
+  /// An invalid request, a body that cannot be read and a disk that is full are errors of this call.
   virtual Expected<std::int64_t> uploadTask(const HTTPRequest& request, const std::filesystem::path& body,
                                             std::string description, std::string_view token) = 0;
   /// Accepts a download, to be run within `window` when the device has time for it: a discretionary

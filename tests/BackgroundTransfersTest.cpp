@@ -245,9 +245,12 @@ TEST_F(VirtualTransfers, DiscretionaryOnesWaitForPowerAndAFreeNetwork) {
 TEST_F(VirtualTransfers, CancelledAndRefusedOnesLoseNothingElse) {
   service_.on("/", answering(200));
   platform_.httpSessions().failAccepting(ENOSPC);
-  EXPECT_EQ(session_->downloadTask({}, "x", 1h).error().code, ENOSPC);
+  HTTPRequest request;
+  request.url = kURL;
+  EXPECT_EQ(session_->downloadTask(request, "x", 1h).error().code, ENOSPC);
   platform_.httpSessions().failAccepting(0);
-  EXPECT_FALSE(session_->uploadTask({}, "/tmp/missing", "x", ""));
+  EXPECT_EQ(session_->uploadTask(request, "/tmp/missing", "x", "").error().code, ENOENT);
+  EXPECT_EQ(session_->downloadTask({}, "x", 1h).error().domain, kHTTPErrorDomain);
 
   const auto cancelled = upload("a");
   upload("b");

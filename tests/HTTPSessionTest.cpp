@@ -8,6 +8,7 @@
 #include "platform/ConfiguredServiceProxy.h"
 #include "platform/HTTPSession.h"
 #include "platform/host/HostHTTPSession.h"
+#include "platform/simulated/SimulatedFileManager.h"
 #include "platform/simulated/SimulatedHTTP.h"
 #include "platform/simulated/SimulatedRuntime.h"
 #include "tests/support/LoopbackServer.h"
@@ -66,7 +67,8 @@ class HostSession : public ::testing::Test {
 
   HostRuntime runtime_{2};
   LoopbackServer server_{runtime_};
-  HostHTTPSessions sessions_{runtime_, std::filesystem::path()};
+  NotificationCenter center_;
+  HostHTTPSessions sessions_{runtime_, std::filesystem::path(), {center_, nullptr, {}}};
 };
 
 TEST_F(HostSession, ResponsesArriveWhole) {

@@ -300,7 +300,8 @@ TEST_F(CacheInAFolder, WithoutAFileMemoryStillServes) {
 TEST_F(CacheInAFolder, ASessionAsksTheServerOnlyForWhatItMust) {
   HostRuntime runtime(2);
   tests::LoopbackServer server(runtime);
-  HostHTTPSessions sessions(runtime, folder_);
+  NotificationCenter center;
+  HostHTTPSessions sessions(runtime, folder_, {center, nullptr, {}});
   HTTPSessionConfiguration configuration;
   configuration.label = "cached";
   configuration.allowsCache = true;

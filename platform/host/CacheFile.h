@@ -1,15 +1,13 @@
 #pragma once
 
-#include <sqlite3.h>
-
 #include <filesystem>
-#include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
 
 #include "platform/host/CacheRules.h"
+#include "platform/host/SQLiteStatement.h"
 
 namespace sable::platform::host {
 
@@ -45,11 +43,6 @@ class CacheFile {
   static std::size_t sizeOf(const StoredResponse& response);
 
  private:
-  struct Closer {
-    void operator()(sqlite3* database) const { sqlite3_close_v2(database); }
-  };
-  class Statement;
-
   bool open();
   int openDatabase();
   int execute(const char* sql);
@@ -59,7 +52,7 @@ class CacheFile {
 
   const std::filesystem::path path_;
   const std::size_t capacity_;
-  std::unique_ptr<sqlite3, Closer> database_;
+  SQLiteDatabase database_;
   std::int64_t bytes_ = 0;
   std::int64_t lastUse_ = 0;
   bool discarded_ = false;

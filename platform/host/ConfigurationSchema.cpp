@@ -19,6 +19,7 @@ constexpr std::array kSettings{
     KnownKey{"SBLDefaultBagURLCN", string},
     KnownKey{"SBLDonateInteractions", boolean},
     KnownKey{"SBLHashtagImagesVisible", boolean},
+    KnownKey{"SBLKeepUploads", boolean},
     KnownKey{"SBLNewsVisible", boolean},
     KnownKey{"SBLNoParallax", boolean},
     KnownKey{"SBLNoQueryCache", boolean},

@@ -1,6 +1,9 @@
 #include "platform/host/CurlTransfer.h"
 
+#include <unistd.h>
+
 #include <algorithm>
+#include <cerrno>
 #include <string_view>
 
 #include "platform/host/CurlOutcome.h"
@@ -19,12 +22,14 @@ bool isBlank(std::string_view text) {
 }  // namespace
 
 CurlTransfer::CurlTransfer(const Runtime& runtime, const HTTPSessionConfiguration& configuration,
-                           const HTTPRequest& request, HTTPHeaders conditions, std::string proxyURL)
+                           const HTTPRequest& request, HTTPHeaders conditions, std::string proxyURL,
+                           TransferFiles* files)
     : runtime_(runtime),
       configuration_(configuration),
       request_(request),
       conditions_(std::move(conditions)),
       proxyURL_(std::move(proxyURL)),
+      files_(files),
       timeout_(fromSeconds(std::clamp(request_.timeout, 0.001, kLongestTimeout))),
       maximumBytes_(std::min(configuration_.maximumResponseBytes, request_.maximumResponseBytes)) {}
 
@@ -71,13 +76,10 @@ void CurlTransfer::setRequest() {
   const bool posts = request_.method == "POST";
   if (request_.method == "HEAD") {
     curl_easy_setopt(easy, CURLOPT_NOBODY, 1L);
-  } else if (posts || request_.body) {
-    curl_easy_setopt(easy, CURLOPT_POST, 1L);
-    curl_easy_setopt(easy, CURLOPT_POSTFIELDS, request_.body ? request_.body->data() : "");
-    curl_easy_setopt(easy, CURLOPT_POSTFIELDSIZE_LARGE,
-                     static_cast<curl_off_t>(request_.body ? request_.body->size() : 0));
+  } else if (posts || sendsBody()) {
+    setBody();
   }
-  if (!posts && request_.method != "HEAD" && (request_.body || request_.method != "GET")) {
+  if (!posts && request_.method != "HEAD" && (sendsBody() || request_.method != "GET")) {
     curl_easy_setopt(easy, CURLOPT_CUSTOMREQUEST, request_.method.c_str());
   }
   curl_easy_setopt(
@@ -90,22 +92,56 @@ void CurlTransfer::setRequest() {
         return static_cast<CurlTransfer*>(self)->takeHeader({bytes, count});
       });
   curl_easy_setopt(easy, CURLOPT_HEADERDATA, this);
-  if (!request_.body) return;
+}
+
+void CurlTransfer::setBody() {
+  CURL* easy = easy_.get();
+  curl_easy_setopt(easy, CURLOPT_POST, 1L);
+  curl_easy_setopt(easy, CURLOPT_POSTFIELDSIZE_LARGE, static_cast<curl_off_t>(bodyBytes()));
+  if (files_ != nullptr && files_->body) {
+    // Sent again where a redirect or a connection that had gone stale asks for it.
+    curl_easy_setopt(easy, CURLOPT_POSTREDIR, static_cast<long>(CURL_REDIR_POST_301 | CURL_REDIR_POST_302));
+    curl_easy_setopt(
+        easy, CURLOPT_READFUNCTION, +[](char* bytes, std::size_t, std::size_t count, void* self) {
+          const ssize_t got = ::read(static_cast<TransferFiles*>(self)->body.number(), bytes, count);
+          return got < 0 ? std::size_t{CURL_READFUNC_ABORT} : static_cast<std::size_t>(got);
+        });
+    curl_easy_setopt(easy, CURLOPT_READDATA, files_);
+    curl_easy_setopt(
+        easy, CURLOPT_SEEKFUNCTION, +[](void* self, curl_off_t offset, int origin) -> int {
+          const int body = static_cast<TransferFiles*>(self)->body.number();
+          return ::lseek(body, offset, origin) < 0 ? CURL_SEEKFUNC_FAIL : CURL_SEEKFUNC_OK;
+        });
+    curl_easy_setopt(easy, CURLOPT_SEEKDATA, files_);
+  } else {
+    curl_easy_setopt(easy, CURLOPT_POSTFIELDS, request_.body ? request_.body->data() : "");
+  }
+  if (!sendsBody()) return;
   curl_easy_setopt(easy, CURLOPT_NOPROGRESS, 0L);
   curl_easy_setopt(
       easy, CURLOPT_XFERINFOFUNCTION,
-      +[](void* context, curl_off_t, curl_off_t, curl_off_t, curl_off_t uploaded) -> int {
-        auto* self = static_cast<CurlTransfer*>(context);
-        if (std::exchange(self->uploaded_, uploaded) != uploaded) self->noteProgress();
+      +[](void* self, curl_off_t, curl_off_t, curl_off_t, curl_off_t uploaded) -> int {
+        static_cast<CurlTransfer*>(self)->sent(uploaded);
         return 0;
       });
   curl_easy_setopt(easy, CURLOPT_XFERINFODATA, this);
 }
 
+void CurlTransfer::sent(curl_off_t bytes) {
+  if (std::exchange(uploaded_, bytes) == bytes) return;
+  noteProgress();
+  if (files_ != nullptr && files_->progress) files_->progress(bytes, files_->bodyBytes);
+}
+
+std::size_t CurlTransfer::bodyBytes() const {
+  if (files_ != nullptr && files_->body) return static_cast<std::size_t>(files_->bodyBytes);
+  return request_.body ? request_.body->size() : 0;
+}
+
 void CurlTransfer::setHeaders() {
   addHeaders(request_.headers);
   addHeaders(conditions_);
-  if (request_.body || request_.method == "POST") {
+  if (sendsBody() || request_.method == "POST") {
     // A name without a value takes libcurl's own field out.
     for (const char* unwanted : {"Expect", "Content-Type"}) {
       if (request_.headers.find(unwanted) == nullptr) addHeaderLine(std::string(unwanted) + ':');
@@ -129,18 +165,36 @@ void CurlTransfer::addHeaderLine(const std::string& line) {
 
 std::size_t CurlTransfer::takeBody(const char* bytes, std::size_t count) {
   noteProgress();
-  if (!bodyBegun_) {
-    bodyBegun_ = true;
+  if (!std::exchange(bodyBegun_, true) && files_ == nullptr) {
     curl_off_t announced = -1;
     curl_easy_getinfo(easy_.get(), CURLINFO_CONTENT_LENGTH_DOWNLOAD_T, &announced);
     const auto limit = static_cast<curl_off_t>(maximumBytes_);
     if (announced > 0) body_.reserve(static_cast<std::size_t>(std::min(announced, limit)));
   }
-  const std::size_t room = maximumBytes_ - body_.size();
-  body_.append(bytes, std::min(count, room));
+  const std::size_t room = maximumBytes_ - bodyBytes_;
+  if (!store(bytes, std::min(count, room))) return 0;
+  bodyBytes_ += std::min(count, room);
   if (count <= room) return count;
   refusal_ = "body is larger than allowed";
   return 0;
+}
+
+bool CurlTransfer::store(const char* bytes, std::size_t count) {
+  if (files_ == nullptr) {
+    body_.append(bytes, count);
+    return true;
+  }
+  while (files_->sink && count > 0) {
+    const ssize_t written = ::write(files_->sink.number(), bytes, count);
+    if (written < 0 && errno == EINTR) continue;
+    if (written < 0) {
+      storeError_ = errno;
+      return false;
+    }
+    bytes += written;
+    count -= static_cast<std::size_t>(written);
+  }
+  return true;
 }
 
 std::size_t CurlTransfer::takeHeader(std::string_view line) {
@@ -165,6 +219,9 @@ Error CurlTransfer::error(CURLcode code) const {
   if (refusal_ != nullptr || hugeLine) {
     return httpError(HTTPErrorCode::responseTooLarge, hugeLine ? kHeadersTooLarge : refusal_);
   }
+  if (storeError_ != 0) {
+    return httpError(HTTPErrorCode::other, posixError(storeError_, "body cannot be kept").reason);
+  }
   if (code == CURLE_OK) return httpError(HTTPErrorCode::badResponse, "connection closed within the headers");
   std::string reason = errorText_[0] != '\0' ? errorText_ : curl_easy_strerror(code);
   const auto meaning = httpErrorCode(easy_.get(), code, reason, !proxyURL_.empty());
@@ -174,8 +231,8 @@ Error CurlTransfer::error(CURLcode code) const {
 HTTPResult CurlTransfer::arrived() {
   HTTPResult result;
   result.response = response(easy_.get());
-  if (bodyBegun_) result.data = makeData(std::move(body_));
-  result.timing = timing(easy_.get(), request_.body ? request_.body->size() : 0);
+  if (bodyBegun_ && files_ == nullptr) result.data = makeData(std::move(body_));
+  result.timing = timing(easy_.get(), bodyBytes());
   result.timing.start = startTime_;
   result.timing.proxied = !proxyURL_.empty();
   return result;

@@ -6,7 +6,9 @@
 #include <optional>
 #include <string>
 
+#include "platform/Function.h"
 #include "platform/HTTPSession.h"
+#include "platform/host/Descriptor.h"
 
 namespace sable::platform::host {
 
@@ -15,15 +17,26 @@ struct CurlEasyDeleter {
 };
 using CurlEasy = std::unique_ptr<CURL, CurlEasyDeleter>;
 
+/// Bodies of a transfer that are not held in memory.
+struct TransferFiles {
+  Descriptor body;  ///< what to send, from its start; none: nothing is sent
+  std::int64_t bodyBytes = 0;
+  Descriptor sink;             ///< where the response's body goes; none: it is dropped
+  std::optional<Error> error;  ///< why there is nothing to open: the transfer ends with it
+  Function<void(std::int64_t sent, std::int64_t expected)> progress;  ///< on the session's queue
+};
+
 /// One request on libcurl: sets up an easy handle, gathers what arrives within the session's limits
 /// and tells the outcome in our terms. Lives on the session's queue; stays where it is while libcurl
 /// works on it.
 class CurlTransfer {
  public:
   /// `request` outlives the transfer; `conditions` are sent with its headers. `proxyURL` empty: a
-  /// direct connection, for the environment's proxies are never asked.
+  /// direct connection, for the environment's proxies are never asked. `files` stand in for the bodies
+  /// of request and result, and outlive the transfer; null: there are none.
   CurlTransfer(const Runtime& runtime, const HTTPSessionConfiguration& configuration,
-               const HTTPRequest& request, HTTPHeaders conditions, std::string proxyURL);
+               const HTTPRequest& request, HTTPHeaders conditions, std::string proxyURL,
+               TransferFiles* files);
   CurlTransfer(const CurlTransfer&) = delete;
   CurlTransfer& operator=(const CurlTransfer&) = delete;
 
@@ -56,6 +69,11 @@ class CurlTransfer {
   Error error(CURLcode code) const;
   HTTPResult arrived();
 
+  bool sendsBody() const { return request_.body || (files_ != nullptr && files_->body); }
+  std::size_t bodyBytes() const;
+  void setBody();
+  void sent(curl_off_t bytes);
+  bool store(const char* bytes, std::size_t count);
   std::size_t takeBody(const char* bytes, std::size_t count);
   std::size_t takeHeader(std::string_view line);
 
@@ -64,6 +82,7 @@ class CurlTransfer {
   const HTTPRequest& request_;
   const HTTPHeaders conditions_;
   const std::string proxyURL_;
+  TransferFiles* const files_;
   const Duration timeout_;
   const std::size_t maximumBytes_;
 
@@ -74,6 +93,8 @@ class CurlTransfer {
   curl_off_t uploaded_ = 0;
   std::string body_;
   bool bodyBegun_ = false;
+  std::size_t bodyBytes_ = 0;    // that have come
+  int storeError_ = 0;           // why they could not be kept
   std::size_t headerBytes_ = 0;  // of the current header section and the interim ones before it
   bool interim_ = false;
   bool headersEnded_ = false;

@@ -5,6 +5,7 @@
 
 #include "platform/AccountStore.h"
 #include "platform/ApplicationRegistry.h"
+#include "platform/BackgroundTransfers.h"
 #include "platform/CountryConfiguration.h"
 #include "platform/LocaleInfo.h"
 #include "platform/Log.h"
@@ -28,8 +29,8 @@ struct Subject {
   Answer answer = nullptr;
 };
 
-const std::array<Subject, 9>& subjects() {
-  static const std::array<Subject, 9> all{
+const std::array<Subject, 10>& subjects() {
+  static const std::array<Subject, 10> all{
       Subject{kCurrentLocaleDidChangeNotification,
               {"calendar", "measurement_system", "temperature_unit", "preferred_languages", "system_language",
                "hour_cycle_24"},
@@ -45,6 +46,7 @@ const std::array<Subject, 9>& subjects() {
       Subject{kLocationFactsDidChangeNotification, {"location"}},
       Subject{kPowerSourceDidChangeNotification, {"on_battery"}},
       Subject{kApplicationsDidChangeNotification, {"applications"}},
+      Subject{kNetworkCostDidChangeNotification, {"metered"}},
   };
   return all;
 }

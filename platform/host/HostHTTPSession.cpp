@@ -6,9 +6,9 @@
 #include <unordered_map>
 #include <vector>
 
-#include "platform/HTTPBackgroundSession.h"
 #include "platform/host/CurlMulti.h"
 #include "platform/host/CurlTransfer.h"
+#include "platform/host/HostTransferHost.h"
 #include "platform/host/ResponseCache.h"
 
 namespace sable::platform::host {
@@ -29,8 +29,12 @@ void initializeLibcurl() {
 
 class HostHTTPSession::Task final : public HTTPDataTask, public std::enable_shared_from_this<Task> {
  public:
-  Task(std::shared_ptr<Core> session, HTTPRequest request, Completion completion)
-      : request_(std::move(request)), session_(std::move(session)), completion_(std::move(completion)) {}
+  Task(std::shared_ptr<Core> session, HTTPRequest request, std::optional<TransferFiles> files,
+       Completion completion)
+      : request_(std::move(request)),
+        session_(std::move(session)),
+        files_(std::move(files)),
+        completion_(std::move(completion)) {}
 
   void resume() override;
   void cancel() override;
@@ -47,6 +51,7 @@ class HostHTTPSession::Task final : public HTTPDataTask, public std::enable_shar
 
   // The session's queue.
   State state_ = State::created;
+  std::optional<TransferFiles> files_;
   Completion completion_;
   std::optional<CurlTransfer> transfer_;
   ResponseCache::Stored stored_;  // what the server is asked to validate
@@ -123,6 +128,7 @@ void HostHTTPSession::Task::cancel() {
 void HostHTTPSession::Core::start(const TaskPointer& task) {
   if (task->state_ != Task::State::created) return;
   if (closed_) return fail(*task, httpError(HTTPErrorCode::cancelled, "session is closed"));
+  if (task->files_ && task->files_->error) return fail(*task, *task->files_->error);
   if (auto error = invalidity(task->request_)) return fail(*task, std::move(*error));
   if (!task->proxyURL_.empty() && !isProxyURL(task->proxyURL_)) {
     return fail(*task, httpError(HTTPErrorCode::proxyFailed, "not a URL of a proxy"));
@@ -151,7 +157,8 @@ void HostHTTPSession::Core::transfer(const TaskPointer& task) {
   task->state_ = Task::State::running;
   HTTPHeaders conditions;
   if (task->stored_) addConditions(*task->stored_, conditions);
-  task->transfer_.emplace(runtime_, configuration_, task->request_, std::move(conditions), task->proxyURL_);
+  task->transfer_.emplace(runtime_, configuration_, task->request_, std::move(conditions), task->proxyURL_,
+                          task->files_ ? &*task->files_ : nullptr);
   task->transfer_->prepare(easyHandle());
   running_.emplace(task->transfer_->easy(), task);
   callBy(task->transfer_->deadline());
@@ -228,6 +235,7 @@ void HostHTTPSession::Core::end(Task& task, HTTPResult result) {
   task.state_ = Task::State::ended;
   task.stored_ = nullptr;
   task.transfer_.reset();
+  task.files_.reset();
   Completion completion = std::move(task.completion_);
   if (!completion) return;
   callbackQueue_->async([completion = std::move(completion), result = std::move(result)]() mutable {
@@ -327,7 +335,12 @@ HostHTTPSession::~HostHTTPSession() {
 }
 
 std::shared_ptr<HTTPDataTask> HostHTTPSession::dataTask(HTTPRequest request, Completion completion) {
-  return std::make_shared<Task>(core_, std::move(request), std::move(completion));
+  return std::make_shared<Task>(core_, std::move(request), std::nullopt, std::move(completion));
+}
+
+std::shared_ptr<HTTPDataTask> HostHTTPSession::fileTask(HTTPRequest request, TransferFiles files,
+                                                        Completion completion) {
+  return std::make_shared<Task>(core_, std::move(request), std::move(files), std::move(completion));
 }
 
 SerialQueue& HostHTTPSession::callbackQueue() {
@@ -347,9 +360,12 @@ std::unique_ptr<HTTPSession> HostHTTPSessions::session(HTTPSessionConfiguration 
                                            cacheFolder_ / "http" / "cache.db");
 }
 
-std::unique_ptr<HTTPBackgroundSession> HostHTTPSessions::backgroundSession(HTTPBackgroundSessionConfiguration,
-                                                                           HTTPBackgroundSessionDelegate&) {
-  return nullptr;
+std::unique_ptr<HTTPBackgroundSession> HostHTTPSessions::backgroundSession(
+    HTTPBackgroundSessionConfiguration configuration, HTTPBackgroundSessionDelegate& delegate) {
+  auto host =
+      std::make_unique<HostTransferHost>(runtime_, transfers_.store, transfers_.conditions, configuration);
+  return std::make_unique<BackgroundTransfers>(runtime_, transfers_.center, std::move(host),
+                                               std::move(configuration), delegate);
 }
 
 }  // namespace sable::platform::host

@@ -1,12 +1,18 @@
 #pragma once
 
 #include <filesystem>
+#include <functional>
 #include <memory>
 
+#include "platform/BackgroundTransfers.h"
 #include "platform/HTTPSession.h"
+#include "platform/NotificationCenter.h"
 #include "platform/host/HostRuntime.h"
 
 namespace sable::platform::host {
+
+struct TransferFiles;
+class TransferStore;
 
 /// HTTP on libcurl, without a thread of its own.
 ///
@@ -28,6 +34,8 @@ class HostHTTPSession final : public HTTPSession {
   ~HostHTTPSession() override;
 
   std::shared_ptr<HTTPDataTask> dataTask(HTTPRequest request, Completion completion) override;
+  /// The same with bodies in files, for a session without a cache; the result has no data.
+  std::shared_ptr<HTTPDataTask> fileTask(HTTPRequest request, TransferFiles files, Completion completion);
   SerialQueue& callbackQueue() override;
   bool hasCache() const override;
   void purgeMemoryCache() override;
@@ -42,17 +50,24 @@ class HostHTTPSession final : public HTTPSession {
 /// use the file at a time; another one keeps its responses in memory only.
 class HostHTTPSessions final : public HTTPSessions {
  public:
-  HostHTTPSessions(HostRuntime& runtime, std::filesystem::path cacheFolder)
-      : runtime_(runtime), cacheFolder_(std::move(cacheFolder)) {}
+  /// What background sessions need; references outlive them.
+  struct Transfers {
+    NotificationCenter& center;
+    std::shared_ptr<TransferStore> store;
+    std::function<TransferConditions()> conditions;
+  };
+
+  HostHTTPSessions(HostRuntime& runtime, std::filesystem::path cacheFolder, Transfers transfers)
+      : runtime_(runtime), cacheFolder_(std::move(cacheFolder)), transfers_(std::move(transfers)) {}
 
   std::unique_ptr<HTTPSession> session(HTTPSessionConfiguration configuration) override;
-  /// Null: transfers that outlive the process are the next step.
   std::unique_ptr<HTTPBackgroundSession> backgroundSession(HTTPBackgroundSessionConfiguration configuration,
                                                            HTTPBackgroundSessionDelegate& delegate) override;
 
  private:
   HostRuntime& runtime_;
   const std::filesystem::path cacheFolder_;
+  const Transfers transfers_;
 };
 
 }  // namespace sable::platform::host

@@ -24,7 +24,9 @@
 #include "platform/host/HostTransactions.h"
 #include "platform/host/HostUserActivity.h"
 #include "platform/host/MappedTally.h"
+#include "platform/host/PowerSupply.h"
 #include "platform/host/TOMLUserDefaults.h"
+#include "platform/host/TransferStore.h"
 
 namespace sable::platform::host {
 namespace {
@@ -59,6 +61,8 @@ struct HostPlatform::Facilities {
   HostLocationService& location() { return locationService.get(runtime, hostFacts(), notificationCenter); }
   HostFacts& hostFacts() { return facts.get(folders, HostSources{}, runtime.reactor(), notificationCenter); }
 
+  HostHTTPSessions::Transfers transfers();
+
   const std::filesystem::path socketPath;
   const Folders folders = Folders::fromEnvironment();
   HostRuntime runtime;
@@ -87,6 +91,17 @@ struct HostPlatform::Facilities {
   Lazy<HostUserActivity> userActivity;
   Lazy<HostActivityScheduler> activityScheduler;
 };
+
+HostHTTPSessions::Transfers HostPlatform::Facilities::transfers() {
+  auto keepsUploads = [this] { return settings().boolean("SBLKeepUploads").value_or(true); };
+  auto conditions = [this] {
+    const HostFacts& known = hostFacts();
+    return TransferConditions{known.boolean("on_battery").value_or(runsOnBattery(known.sources().root)),
+                              known.boolean("metered").value_or(false)};
+  };
+  return {notificationCenter, std::make_shared<TransferStore>(folders.state, std::move(keepsUploads)),
+          std::move(conditions)};
+}
 
 HostPlatform::HostPlatform(HostPlatformConfiguration configuration)
     : facilities_(std::make_unique<Facilities>(std::move(configuration))) {}
@@ -142,7 +157,8 @@ Relay& HostPlatform::relay() {
 }
 
 HTTPSessions& HostPlatform::httpSessions() {
-  return facilities_->httpSessions.get(facilities_->runtime, facilities_->folders.caches);
+  auto& facilities = *facilities_;
+  return facilities.httpSessions.get(facilities.runtime, facilities.folders.caches, facilities.transfers());
 }
 
 MemoryPressure& HostPlatform::memoryPressure() {

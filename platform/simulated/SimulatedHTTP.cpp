@@ -173,7 +173,7 @@ std::unique_ptr<HTTPBackgroundSession> SimulatedHTTPSessions::backgroundSession(
 
 void SimulatedHTTPSessions::setConditions(const TransferConditions& conditions) {
   disk_->conditions = conditions;
-  center_.post({kTransferConditionsDidChangeNotification, this, {}});
+  center_.post({kNetworkCostDidChangeNotification, this, {}});
 }
 
 void SimulatedHTTPSessions::failAccepting(int number) {
