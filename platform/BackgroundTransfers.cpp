@@ -139,6 +139,7 @@ BackgroundTransfers::Core::Entry& BackgroundTransfers::Core::add(BackgroundTrans
   entry.due = age < configuration_.resourceTimeout ? later(ticks, transfer.pause - waited) : ticks;
   entry.windowEnd = transfer.window > Duration{} ? later(ticks, transfer.window - age) : MonotonicTime::max();
   entry.transfer = std::move(transfer);
+  entry.transfer.running = false;
   return entry;
 }
 

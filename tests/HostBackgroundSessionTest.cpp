@@ -4,7 +4,9 @@
 #include <sys/resource.h>
 #include <sys/stat.h>
 
+#include <atomic>
 #include <csignal>
+#include <mutex>
 
 #include "platform/NotificationCenter.h"
 #include "platform/host/HostHTTPSession.h"
@@ -29,25 +31,39 @@ using Then = LoopbackServer::Reply::Then;
 /// Notes ends and what was downloaded; one test thread waits for them.
 class Listener final : public HTTPBackgroundSessionDelegate {
  public:
-  explicit Listener(Runtime& runtime) : ended_(runtime.semaphore(0)) {}
+  explicit Listener(Runtime& runtime) : settled_(runtime.semaphore(0)) {}
 
   void didFinishDownloadingToURL(const HTTPBackgroundTask& task, const std::filesystem::path& path) override {
-    words_.push_back(task.description + " file " + readFile(path).substr(0, 10));
+    note(task.description + " file " + readFile(path).substr(0, 10));
   }
   void didCompleteWithError(const HTTPBackgroundTask& task, const std::optional<Error>& error) override {
-    words_.push_back(task.description + (error ? " error " + std::to_string(error->code)
-                                               : " status " + std::to_string(task.response->status)));
+    ++ends_;
+    note(task.description + (error ? " error " + std::to_string(error->code)
+                                   : " status " + std::to_string(task.response->status)));
   }
-  void didFinishEventsForBackgroundURLSession() override { ended_->signal(); }
+  void didFinishEventsForBackgroundURLSession() override {
+    settledEnds_ = ends_.load();
+    settled_->signal();
+  }
 
-  /// What was heard until nothing was left to run.
-  std::vector<std::string> wait() {
-    EXPECT_TRUE(ended_->wait(MonotonicTime::max()));
+  /// What was heard until so many have ended since the last call, and nothing is left to run.
+  std::vector<std::string> wait(int ends = 1) {
+    expected_ += ends;
+    while (settledEnds_ < expected_) EXPECT_TRUE(settled_->wait(MonotonicTime::max()));
+    const std::lock_guard lock(mutex_);
     return std::exchange(words_, {});
   }
 
  private:
-  const std::unique_ptr<Semaphore> ended_;
+  void note(std::string word) {
+    const std::lock_guard lock(mutex_);
+    words_.push_back(std::move(word));
+  }
+
+  const std::unique_ptr<Semaphore> settled_;
+  std::atomic<int> ends_ = 0, settledEnds_ = 0;
+  int expected_ = 0;
+  std::mutex mutex_;
   std::vector<std::string> words_;
 };
 
@@ -128,8 +144,7 @@ TEST_F(HostTransfers, AnUploadLeavesAsItWasAndIsKeptForItsOwner) {
   EXPECT_EQ(readFile(TransferStore::bodyIn(state_, 1)), body);
 
   for (int i = 0; i < host::kRememberedUploads + 1; ++i) upload("/ok", "more");
-  while (!listener_.wait().empty() && files("transfers").size() > 0) {
-  }
+  listener_.wait(host::kRememberedUploads + 1);
   EXPECT_EQ(files("uploads").size(), static_cast<std::size_t>(host::kRememberedUploads));
   const auto rows = TransferDatabase::read(TransferStore::databaseIn(state_));
   ASSERT_TRUE(rows) << rows.error().description();
@@ -155,12 +170,9 @@ TEST_F(HostTransfers, WhatBrokeOffIsTriedAgainAndNeverHandedOut) {
   launch();
   upload("/reset", "body");
   for (const char* path : {"/cut", "/large", "/none"}) download(path);
-  std::vector<std::string> heard;
-  while (heard.size() < 6) {
-    for (auto& word : listener_.wait()) heard.push_back(word);
-  }
-  EXPECT_THAT(heard, UnorderedElementsAre("/reset status 200", "/cut file whole", "/cut status 200",
-                                          "/large error 8", "/none file ", "/none status 304"));
+  EXPECT_THAT(listener_.wait(4),
+              UnorderedElementsAre("/reset status 200", "/cut file whole", "/cut status 200",
+                                   "/large error 8", "/none file ", "/none status 304"));
   EXPECT_TRUE(files("transfers").empty());
 }
 

@@ -55,6 +55,7 @@ TransferRow rowFrom(SQLiteStatement& statement) {
   transfer.window = Duration(statement.number(8));
   row.size = statement.number(9);
   row.state = TransferState{static_cast<int>(statement.number(10))};
+  transfer.running = row.state == TransferState::running;
   transfer.ended = row.state >= TransferState::ended;
   transfer.attempts = static_cast<int>(statement.number(11));
   transfer.lastAttempt = WallTime(Duration(statement.number(12)));

@@ -63,6 +63,8 @@ Connection& Connection::current() {
 bool Connection::waitForRequest() {
   head_.clear();
   headComplete_ = false;
+  reading_ = {};
+  bodyRead_ = 0;
   return flush() && !closing_ && (consumed_ < incoming_.size() || fill(kIdleLimit));
 }
 
@@ -75,13 +77,29 @@ bool Connection::fill(milliseconds timeout) {
   return count > 0;
 }
 
+bool Connection::mayRead(size_t& size) {
+  if (reading_.resetAfter) {
+    if (bodyRead_ >= *reading_.resetAfter) {
+      reset();
+      return false;
+    }
+    size = std::min(size, *reading_.resetAfter - bodyRead_);
+  }
+  if (!reading_.bytesPerSecond) return true;
+  size = std::min(size, std::max<size_t>(1, *reading_.bytesPerSecond / 10));
+  return pause(milliseconds(size * 1000 / *reading_.bytesPerSecond));
+}
+
 ssize_t Connection::read(char* ptr, size_t size) {
+  if (headComplete_ && !mayRead(size)) return 0;
   // A client may be waiting for "100 Continue" before it sends the rest.
   if (consumed_ == incoming_.size() && (!flush() || !fill(kStallLimit))) return 0;
   const size_t count = std::min(size, incoming_.size() - consumed_);
   std::memcpy(ptr, incoming_.data() + consumed_, count);
   consumed_ += count;
-  if (!headComplete_) {
+  if (headComplete_) {
+    bodyRead_ += count;
+  } else {
     head_.append(ptr, count);
     headComplete_ = head_.ends_with("\r\n\r\n") || head_.size() > kHeadLimit;
   }

@@ -5,6 +5,8 @@
 #include <chrono>
 #include <string>
 
+#include "Faults.h"
+
 namespace service {
 
 /// One accepted connection, as the HTTP library reads and writes it. It belongs to the thread that serves it.
@@ -34,6 +36,8 @@ class Connection final : public httplib::Stream {
 
   bool flush();
   void closeAfterAnswer() { closing_ = true; }
+  /// How the rest of the current request is to be read.
+  void setReading(const ReadingPlan& plan) { reading_ = plan; }
   /// Drops what is gathered and sends an RST: the client sees the connection reset by its peer.
   void reset();
   /// Waits that long, or until the client hangs up (then false).
@@ -50,6 +54,8 @@ class Connection final : public httplib::Stream {
   socket_t socket() const override { return socket_; }
 
  private:
+  /// Bounds the next piece of a request's body; false where there is to be none.
+  bool mayRead(size_t& size);
   bool fill(std::chrono::milliseconds timeout);
 
   const int socket_;
@@ -60,6 +66,8 @@ class Connection final : public httplib::Stream {
   std::string outgoing_;
   std::string head_;
   bool headComplete_ = false;
+  ReadingPlan reading_;
+  size_t bodyRead_ = 0;
 };
 
 }  // namespace service

@@ -33,6 +33,8 @@ constexpr std::array kKinds = {
     Kind{"body", Value::text},
     Kind{"retry-after", Value::text},
     Kind{"version", Value::text},
+    Kind{"reset-body", Value::number},
+    Kind{"slow-body", Value::number, 1},
 };
 
 std::optional<size_t> number(std::string_view text) {
@@ -103,11 +105,26 @@ void Faults::clear() {
   rules_.clear();
 }
 
+ReadingPlan Faults::planReading(const std::string& path) {
+  ReadingPlan plan;
+  for (const Rule& rule : applying(path, true)) {
+    const size_t value = number(rule.value).value_or(0);
+    (rule.kind == "reset-body" ? plan.resetAfter : plan.bytesPerSecond) = value;
+  }
+  return plan;
+}
+
 FaultPlan Faults::plan(const std::string& path) {
   FaultPlan plan;
+  for (const Rule& rule : applying(path, false)) note(rule, plan);
+  return plan;
+}
+
+std::vector<Faults::Rule> Faults::applying(const std::string& path, bool reading) {
+  std::vector<Rule> result;
   const std::lock_guard lock(mutex_);
   for (auto& rule : rules_) {
-    if (!covers(rule.path, path)) continue;
+    if (rule.kind.ends_with("-body") != reading || !covers(rule.path, path)) continue;
     if (rule.skip > 0) {
       --rule.skip;
       continue;
@@ -116,9 +133,9 @@ FaultPlan Faults::plan(const std::string& path) {
       rule.count = 0;
       continue;
     }
-    note(rule, plan);
+    result.push_back(rule);
   }
-  return plan;
+  return result;
 }
 
 void Faults::note(const Rule& rule, FaultPlan& plan) {

@@ -32,6 +32,12 @@ struct FaultPlan {
   void apply(Answer& answer) const;
 };
 
+/// What is to go wrong while the body of a request is read.
+struct ReadingPlan {
+  std::optional<size_t> resetAfter;
+  std::optional<size_t> bytesPerSecond;
+};
+
 /// The rules, in the order given: PATH:KIND[=VALUE][*COUNT][@SKIP].
 ///
 /// PATH matches itself and what lies below it ("/images" matches "/images/a.png", "/" everything). A rule
@@ -39,11 +45,17 @@ struct FaultPlan {
 /// VALUE ends at the last
 /// "*COUNT" or "@SKIP". Kinds:
 ///
-///   latency=MS          waits before the answer         truncate=BYTES     closes after that much of the
-///   body status=CODE         this status, an error body      slow=BYTES         body at that many bytes a
-///   second redirect=URL        302 with this Location          body=TEXT          this body instead
-///   retry-after=SECONDS 503 with this Retry-After       reset              RST in place of an answer
-///   version=VERSION     the bag has this version
+///   latency=MS           waits before the answer
+///   status=CODE          this status, an error body
+///   redirect=URL         302 with this Location
+///   retry-after=SECONDS  503 with this Retry-After, which may also be a date
+///   body=TEXT            this body instead
+///   truncate=BYTES       closes after that much of the answer's body
+///   slow=BYTES           the answer's body at that many bytes a second
+///   reset                RST in place of an answer
+///   reset-body=BYTES     RST when that much of the request's body has been read
+///   slow-body=BYTES      reads the request's body at that many bytes a second
+///   version=VERSION      the bag has this version
 ///
 /// Safe from any thread.
 class Faults {
@@ -53,6 +65,8 @@ class Faults {
   void clear();
   /// What goes wrong with this request; counts it.
   FaultPlan plan(const std::string& path);
+  /// The same for a request whose body is still to be read.
+  ReadingPlan planReading(const std::string& path);
 
  private:
   struct Rule {
@@ -64,6 +78,7 @@ class Faults {
     std::optional<size_t> count;
   };
 
+  std::vector<Rule> applying(const std::string& path, bool reading);
   static void note(const Rule& rule, FaultPlan& plan);
 
   std::mutex mutex_;

@@ -48,7 +48,8 @@ bool hasBody(const httplib::Request& request) {
 
 }  // namespace
 
-Server::Server(Handler handler) : handler_(std::move(handler)) {
+Server::Server(Handler handler, Reading reading)
+    : handler_(std::move(handler)), reading_(std::move(reading)) {
   new_task_queue = [] { return new ConnectionThreads; };
   set_tcp_nodelay(true);
   set_payload_max_length(kBodyLimit);
@@ -89,6 +90,7 @@ Server::HandlerResponse Server::prepare(httplib::Request& request, httplib::Resp
     handle(request, response);
     return HandlerResponse::Handled;
   }
+  Connection::current().setReading(reading_(request.path));
   request.headers.erase("Content-Encoding");
   request.headers.erase("Content-Type");
   // The library reads a POST without a length until the connection closes; RFC 9112 (6.3) says it has no

@@ -8,6 +8,7 @@
 #include <string>
 #include <thread>
 
+#include "Faults.h"
 #include "Message.h"
 
 namespace service {
@@ -23,7 +24,10 @@ class Server : private httplib::Server {
   /// as no proper HTTP, or too large, comes with that status set, and its connection is closed afterwards.
   using Handler = std::function<void(const Request&, httplib::Response&)>;
 
-  explicit Server(Handler handler);
+  /// Called before the body of a request to that path is read.
+  using Reading = std::function<ReadingPlan(const std::string& path)>;
+
+  Server(Handler handler, Reading reading);
   ~Server() override;
 
   /// Port 0 picks a free one. The port, or 0 when it cannot be had. Clients that come now wait for start().
@@ -39,6 +43,7 @@ class Server : private httplib::Server {
   bool admit(Connection* connection);
 
   const Handler handler_;
+  const Reading reading_;
   std::thread listener_;
   std::mutex mutex_;
   std::set<Connection*> connections_;

@@ -35,7 +35,8 @@ int serve(const Options& options, const Json& bagKeys, Faults& faults, const sig
   const Index index(options.data);
   std::unique_ptr<Service> service;
   Server server(
-      [&](const Request& request, httplib::Response& response) { service->handle(request, response); });
+      [&](const Request& request, httplib::Response& response) { service->handle(request, response); },
+      [&](const std::string& path) { return faults.planReading(path); });
   const int port = server.bind(options.port);
   if (port == 0) return complain(1, fmt::format("cannot listen on 127.0.0.1:{}", options.port));
   const std::string base = fmt::format("http://127.0.0.1:{}", port);

@@ -187,6 +187,15 @@ void addQuestions(CLI::App& app, Invocation& invocation) {
     return runCounters(context, *openMetrics);
   }).add_flag("--openmetrics", *openMetrics, "As OpenMetrics text");
   add(app, invocation, "status", "Show what the daemon is, has and holds", runStatus);
+
+  const auto shown = std::make_shared<std::int64_t>(0);
+  add(app, invocation, "uploads", "List uploads under way and the last ones",
+      [shown](const Context& context) {
+        return *shown == 0 ? runUploads(context) : runShowUpload(context, *shown);
+      })
+      .add_option("--show", *shown, "Print the JSON that this upload carries")
+      ->type_name("ID")
+      ->check(CLI::PositiveNumber);
 }
 
 void addReport(CLI::App& app, Invocation& invocation) {

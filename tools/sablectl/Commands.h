@@ -52,5 +52,9 @@ ExitCode runDump(const Context& context);
 ExitCode runSessionFile(const Context& context, const std::filesystem::path& path);
 ExitCode runCounters(const Context& context, bool openMetrics);
 ExitCode runStatus(const Context& context);
+/// The uploads under way and the last ones.
+ExitCode runUploads(const Context& context);
+/// The JSON that an upload carries.
+ExitCode runShowUpload(const Context& context, std::int64_t identifier);
 
 }  // namespace sable::sablectl

@@ -1,7 +1,6 @@
 #include <fmt/format.h>
 
 #include <chrono>
-#include <cstdlib>
 #include <nlohmann/json.hpp>
 
 #include "SableKit/SBLError.h"
@@ -129,15 +128,6 @@ Dictionary facilitiesStatus(const Host& host) {
     facilities.push_back(std::move(one));
   }
   return facilities;
-}
-
-/// "3 h 59 min", "12 s": the two largest units.
-std::string duration(std::int64_t seconds) {
-  const std::int64_t whole = std::abs(seconds);
-  if (whole >= 86400) return fmt::format("{} d {} h", whole / 86400, whole % 86400 / 3600);
-  if (whole >= 3600) return fmt::format("{} h {} min", whole / 3600, whole % 3600 / 60);
-  if (whole >= 60) return fmt::format("{} min {} s", whole / 60, whole % 60);
-  return fmt::format("{} s", whole);
 }
 
 std::string bagText(const Dictionary& bag) {

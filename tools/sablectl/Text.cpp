@@ -5,6 +5,7 @@
 #include <unicode/utext.h>
 
 #include <cstdint>
+#include <cstdlib>
 #include <functional>
 
 namespace sable::sablectl {
@@ -84,6 +85,14 @@ std::string cut(std::string_view text, std::size_t width) {
 std::string padded(std::string_view text, std::size_t width) {
   const std::size_t taken = displayWidth(text);
   return std::string(text) + std::string(taken < width ? width - taken : 0, ' ');
+}
+
+std::string duration(std::int64_t seconds) {
+  const std::int64_t whole = std::abs(seconds);
+  if (whole >= 86400) return fmt::format("{} d {} h", whole / 86400, whole % 86400 / 3600);
+  if (whole >= 3600) return fmt::format("{} h {} min", whole / 3600, whole % 3600 / 60);
+  if (whole >= 60) return fmt::format("{} min {} s", whole / 60, whole % 60);
+  return fmt::format("{} s", whole);
 }
 
 std::vector<std::string> characters(std::string_view text) {

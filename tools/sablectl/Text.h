@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -25,6 +26,9 @@ std::string cut(std::string_view text, std::size_t width);
 
 /// The text with blanks behind it up to `width` columns.
 std::string padded(std::string_view text, std::size_t width);
+
+/// "3 h 59 min", "12 s": the two largest units of that many seconds, without a sign.
+std::string duration(std::int64_t seconds);
 
 /// The text's code points, each as UTF-8; marks that combine stay with what they stand on.
 std::vector<std::string> characters(std::string_view text);

@@ -13,6 +13,7 @@
 #include "platform/host/HostRelay.h"
 #include "platform/host/HostRuntime.h"
 #include "platform/host/MappedTally.h"
+#include "platform/host/TransferStore.h"
 #include "platform/host/UnixSocket.h"
 #include "tools/sablectl/CommandLine.h"
 
@@ -48,6 +49,20 @@ sable::platform::ActivityRecord activitiesIn(host::HostFileManager& fileManager,
 /// Lines are written whole and at once: nothing is lost.
 void exitOnInterrupt() {
   for (const int number : {SIGINT, SIGTERM}) std::signal(number, [](int) { _exit(kExitSuccess); });
+sable::Expected<std::vector<KeptUpload>> readUploads(const host::Folders& folders) {
+  const auto rows = host::TransferDatabase::read(host::TransferStore::databaseIn(folders.state));
+  if (!rows) return tl::unexpected(rows.error());
+  std::vector<KeptUpload> uploads;
+  for (const auto& row : *rows) {
+    if (row.transfer.task.kind != sable::platform::HTTPBackgroundTaskKind::upload) continue;
+    uploads.push_back({row.transfer, row.size});
+  }
+  return uploads;
+}
+
+std::optional<std::filesystem::path> uploadBody(const host::Folders& folders, std::int64_t identifier) {
+  auto path = host::TransferStore::bodyIn(folders.state, identifier);
+  return path.empty() ? std::nullopt : std::optional(std::move(path));
 }
 
 ExitCode run(const Invocation& invocation) {
@@ -71,6 +86,8 @@ ExitCode run(const Invocation& invocation) {
       .places = placesOf(folders),
       .endpointOf = [](const std::filesystem::path& path) { return host::endpointOf(path.native()); },
       .readCounters = host::MappedTally::snapshotOf,
+      .readUploads = [&folders] { return readUploads(folders); },
+      .uploadBody = [&folders](std::int64_t identifier) { return uploadBody(folders, identifier); },
       .availability = [&folders, &runtime] { return probe(folders, runtime); },
       .readActivities = [&] { return activitiesIn(fileManager, folders.activityRuns()); },
       .exitOnInterrupt = exitOnInterrupt,
