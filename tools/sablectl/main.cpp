@@ -49,6 +49,8 @@ sable::platform::ActivityRecord activitiesIn(host::HostFileManager& fileManager,
 /// Lines are written whole and at once: nothing is lost.
 void exitOnInterrupt() {
   for (const int number : {SIGINT, SIGTERM}) std::signal(number, [](int) { _exit(kExitSuccess); });
+}
+
 sable::Expected<std::vector<KeptUpload>> readUploads(const host::Folders& folders) {
   const auto rows = host::TransferDatabase::read(host::TransferStore::databaseIn(folders.state));
   if (!rows) return tl::unexpected(rows.error());
