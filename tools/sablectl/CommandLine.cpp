@@ -186,6 +186,7 @@ void addQuestions(CLI::App& app, Invocation& invocation) {
   add(app, invocation, "counters", "Show the daemon's counters", [openMetrics](const Context& context) {
     return runCounters(context, *openMetrics);
   }).add_flag("--openmetrics", *openMetrics, "As OpenMetrics text");
+  add(app, invocation, "ledger", "Show what became of every feedback record", runLedger);
   add(app, invocation, "status", "Show what the daemon is, has and holds", runStatus);
 
   const auto shown = std::make_shared<std::int64_t>(0);

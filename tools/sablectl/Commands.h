@@ -51,6 +51,8 @@ ExitCode runDump(const Context& context);
 /// A session file, as far as it can be read; kExitError where that is not to its end.
 ExitCode runSessionFile(const Context& context, const std::filesystem::path& path);
 ExitCode runCounters(const Context& context, bool openMetrics);
+/// What became of every feedback record; kExitError where the sums differ.
+ExitCode runLedger(const Context& context);
 ExitCode runStatus(const Context& context);
 /// The uploads under way and the last ones.
 ExitCode runUploads(const Context& context);

@@ -2,6 +2,7 @@
 
 #include <fmt/format.h>
 
+#include <cerrno>
 #include <nlohmann/json.hpp>
 #include <system_error>
 
@@ -40,6 +41,14 @@ ExitCode complainOf(const Context& context, const Error& error) {
 ExitCode fail(const Context& context, const Error& error) {
   if (context.output.json) context.output.document({{"error", encodeErrorForJSON(error)}});
   return complainOf(context, error);
+}
+
+tl::expected<Counters, ExitCode> readCounters(const Context& context) {
+  auto counters = context.host.readCounters(context.host.counters);
+  if (counters) return *std::move(counters);
+  if (context.output.json) context.output.document({{"error", encodeErrorForJSON(counters.error())}});
+  complain(fmt::format("no counters at {}: {}", context.host.counters.string(), counters.error().reason));
+  return tl::unexpected(counters.error().code == ENOENT ? kExitNoDaemon : kExitError);
 }
 
 }  // namespace sable::sablectl

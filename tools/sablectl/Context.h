@@ -1,6 +1,10 @@
 #pragma once
 
+#include <cstdint>
 #include <functional>
+#include <map>
+#include <string>
+#include <tl/expected.hpp>
 
 #include "tools/sablectl/Host.h"
 #include "tools/sablectl/Output.h"
@@ -36,5 +40,10 @@ ExitCode withSession(const Context& context, const std::function<ExitCode(Sessio
 ExitCode complainOf(const Context& context, const Error& error);
 /// The same, and as JSON on standard output where that is asked for: all that a command has to say.
 ExitCode fail(const Context& context, const Error& error);
+
+using Counters = std::map<std::string, std::int64_t>;
+/// The daemon's counters, also while none runs; where there are none tells why, as fail() does, and
+/// what to exit with.
+tl::expected<Counters, ExitCode> readCounters(const Context& context);
 
 }  // namespace sable::sablectl

@@ -1,16 +1,12 @@
 #include <fmt/format.h>
 
-#include <cerrno>
 #include <nlohmann/json.hpp>
 
-#include "SableKit/SBLError.h"
 #include "tools/sablectl/Commands.h"
 #include "tools/sablectl/Text.h"
 
 namespace sable::sablectl {
 namespace {
-
-using Counters = std::map<std::string, std::int64_t>;
 
 /// A label's value (OpenMetrics 1.0, "Text format": backslash, quote and line feed are escaped).
 std::string labelValue(std::string_view text) {
@@ -38,12 +34,8 @@ void printOpenMetrics(const Output& output, const Counters& counters) {
 }  // namespace
 
 ExitCode runCounters(const Context& context, bool openMetrics) {
-  const auto counters = context.host.readCounters(context.host.counters);
-  if (!counters) {
-    if (context.output.json) context.output.document({{"error", encodeErrorForJSON(counters.error())}});
-    complain(fmt::format("no counters at {}: {}", context.host.counters.string(), counters.error().reason));
-    return counters.error().code == ENOENT ? kExitNoDaemon : kExitError;
-  }
+  const auto counters = readCounters(context);
+  if (!counters) return counters.error();
   if (openMetrics) {
     printOpenMetrics(context.output, *counters);
   } else if (context.output.json) {

@@ -1,5 +1,6 @@
 #include "tools/sablectl/SessionFile.h"
 
+#include <algorithm>
 #include <cstring>
 #include <nlohmann/json.hpp>
 
@@ -81,6 +82,14 @@ Dictionary sessionFileDocument(std::string_view bytes) {
     document["damage"] = {{"offset", begin}, {"reason", read.error().reason}};
   }
   return document;
+}
+
+std::size_t recordsInSessionFile(std::string_view bytes) {
+  constexpr std::size_t kVersionAndRoot = 2;
+  Records records(bytes);
+  std::size_t count = 0;
+  for (auto record = records.next(); record && !record->empty(); record = records.next()) ++count;
+  return count - std::min(count, kVersionAndRoot);
 }
 
 }  // namespace sable::sablectl

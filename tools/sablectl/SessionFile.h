@@ -1,5 +1,6 @@
 #pragma once
 
+#include <cstddef>
 #include <string_view>
 
 #include "platform/Dictionary.h"
@@ -11,5 +12,8 @@ namespace sable::sablectl {
 /// [{"class", "query_id", "client_query_id", "message"}], "damage": {"offset", "reason"} of the record
 /// at which reading had to stop, in bytes, or null}. A version or root that is not there is null.
 Dictionary sessionFileDocument(std::string_view bytes);
+
+/// The feedback records in a session file; a torn one does not count.
+std::size_t recordsInSessionFile(std::string_view bytes);
 
 }  // namespace sable::sablectl
