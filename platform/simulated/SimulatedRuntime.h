@@ -26,6 +26,9 @@ class SimulatedRuntime final : public Runtime {
   /// Runs until `predicate` holds, for `limit` at most; says whether it holds.
   bool runUntil(const std::function<bool()>& predicate, Duration limit);
 
+  /// As when the process is killed: what is queued, or timed, never runs. From outside all work.
+  void dropWork() { scheduler_.dropWork(); }
+
   /// Sets the time of day; monotonic time and timers do not notice.
   void setWallClock(WallTime time) { wallAtZero_ = time - scheduler_.now().time_since_epoch(); }
   void jumpWallClock(Duration distance) { wallAtZero_ += distance; }

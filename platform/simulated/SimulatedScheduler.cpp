@@ -4,7 +4,7 @@
 
 namespace sable::platform::simulated {
 
-SimulatedScheduler::~SimulatedScheduler() {
+void SimulatedScheduler::dropWork() {
   timers_.clear();
   // What is dropped may post in turn as it goes.
   while (!ready_.empty()) {

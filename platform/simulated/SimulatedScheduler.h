@@ -14,7 +14,7 @@ namespace sable::platform::simulated {
 class SimulatedScheduler {
  public:
   explicit SimulatedScheduler(std::uint64_t seed) : chance_(seed) {}
-  ~SimulatedScheduler();
+  ~SimulatedScheduler() { dropWork(); }
   SimulatedScheduler(const SimulatedScheduler&) = delete;
   SimulatedScheduler& operator=(const SimulatedScheduler&) = delete;
 
@@ -30,6 +30,9 @@ class SimulatedScheduler {
   bool runUntil(const std::function<bool()>& done, MonotonicTime deadline);
   /// Runs what is ready, and what that makes ready, without moving the clock.
   void runReady();
+
+  /// Destroys all that is ready or timed without running it.
+  void dropWork();
 
   /// Marks, as long as it lives, that work of a queue runs.
   class Running {

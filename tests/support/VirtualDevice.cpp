@@ -120,6 +120,14 @@ void VirtualDevice::start() {
   advance(200ms);
 }
 
+void VirtualDevice::killDaemon() {
+  platform.runtime().dropWork();
+  clients_.clear();
+  platform.runtime().dropWork();
+  daemon_.reset();
+  platform.runtime().dropWork();
+}
+
 void VirtualDevice::await(const PendingAnswer& answer) {
   if (!platform.runtime().runUntil([&] { return answer->has_value(); }, kPatience)) {
     throw std::runtime_error("no answer in 30 s of virtual time");

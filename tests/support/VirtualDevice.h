@@ -78,6 +78,9 @@ class VirtualDevice {
 
   /// Starts the daemon and lets it settle.
   void start();
+  /// Ends the daemon as kill -9 does, in the middle of what it is doing; files, settings and counters
+  /// stay. All clients are gone, and their references with them.
+  void killDaemon();
 
   platform::simulated::SimulatedPlatform platform;
   platform::simulated::SimulatedLog log;
