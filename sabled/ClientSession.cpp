@@ -122,6 +122,7 @@ std::shared_ptr<ClientSession> ClientSession::initWithData(Assembly& assembly, s
   std::shared_ptr<ClientSession> session(new ClientSession(assembly));
   session->agent_ = message.agent();
   session->userGuidString_ = message.user_guid_string();
+  session->userGuid_ = UUID::parse(session->userGuidString_);
   session->removeTimestamps_ = message.remove_timestamps();
   if (message.has_session_start_since_1970())
     session->sessionStartSince1970_ = message.session_start_since_1970();
@@ -218,12 +219,9 @@ void ClientSession::enumerateSessions(const std::function<void(ClientSession&, b
   callback(*this, true);
 }
 
-std::optional<UUID> ClientSession::userGuid() {
-  return UUID::parse(userGuidString_);
-}
-
 void ClientSession::setUserGuid(std::optional<UUID> userGuid) {
   userGuidString_ = userGuid ? userGuid->string() : "";
+  userGuid_ = userGuid;
 }
 
 std::optional<platform::WallTime> ClientSession::sessionStart() const {

@@ -58,7 +58,7 @@ class ClientSession final : public FeedbackSession {
   const std::string& agent() const { return agent_; }  ///< empty: none
   void setAgent(std::string agent) { agent_ = std::move(agent); }
   const std::string& userGuidString() const { return userGuidString_; }  ///< empty: none
-  std::optional<UUID> userGuid() override;
+  std::optional<UUID> userGuid() override { return userGuid_; }
   void setUserGuid(std::optional<UUID> userGuid) override;
   std::optional<platform::WallTime> sessionStart() const;
   void setSessionStart(std::optional<platform::WallTime> date);
@@ -88,6 +88,7 @@ class ClientSession final : public FeedbackSession {
 
   std::string agent_;
   std::string userGuidString_;
+  std::optional<UUID> userGuid_;  ///< what the string says
   bool removeTimestamps_ = false;
   std::optional<double> sessionStartSince1970_;  ///< seconds
   std::map<std::string, std::string> cpResourceVersions_;

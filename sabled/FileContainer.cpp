@@ -23,6 +23,8 @@ namespace sable {
 namespace {
 
 constexpr std::size_t kMaximumMappedBytes = std::numeric_limits<std::uint32_t>::max();
+/// More is written at once.
+constexpr std::size_t kMaximumBufferBytes = 64u << 10;
 /// As much of a stranger's version string as is logged; ours is far shorter.
 constexpr std::size_t kLoggedVersionBytes = 256;
 
@@ -39,6 +41,13 @@ Expected<std::string_view> mmapFileHandle(platform::ReadableFile& fileHandle) {
     log().error("mmap: {}", data.error().description());
   }
   return data;
+}
+
+std::uint64_t wholeRecords(std::string_view bytes) {
+  ArchivedDataIterator records(bytes);
+  std::uint64_t count = 0;
+  while (records.skipNextObject()) ++count;
+  return count;
 }
 
 /// Reads the records after the first two, up to one that cannot be used; says how many.
@@ -82,9 +91,9 @@ FileContainer::FileContainer(Assembly& assembly, std::filesystem::path fileUrl, 
 void FileContainer::writeSessionHeader(const ClientSession& session) {
   queue_->async([self = shared_from_this(), data = session.data()] {
     if (!self->fileHandle_) return;
-    if (!self->_archiveData(self->version_)) {
+    if (!self->_archiveData(self->version_) || !self->write()) {
       log().error("Could not write version string");
-    } else if (!self->_archiveData(data)) {
+    } else if (!self->_archiveData(data) || !self->write()) {
       log().error("Could not write root object");
     }
   });
@@ -92,51 +101,73 @@ void FileContainer::writeSessionHeader(const ClientSession& session) {
 
 void FileContainer::writeFeedback(const SableFeedback& feedback, platform::Function<void()> done) {
   queue_->async([self = shared_from_this(), data = feedback.data(), done = std::move(done)]() mutable {
-    auto& tally = self->assembly_.tally;
-    if (!self->fileHandle_) return ledger::count(tally, self->endOfLaterRecords_);
-    if (self->_archiveData(data)) {
-      ++self->records_;
-      ledger::count(tally, SBLLedgerEntry::written);
-    } else {
-      ledger::count(tally, self->endOfLaterRecords_);
-    }
-    if (done) done();
+    self->addFeedback(data, std::move(done));
   });
 }
 
-/// Closes the file when it fails: what came after half a record could not be read.
+/// Writes behind what the queue has to do already, so that what is behind in that is written together.
+void FileContainer::addFeedback(std::string_view data, platform::Function<void()> done) {
+  if (!fileHandle_) return ledger::count(assembly_.tally, endOfLaterRecords_);
+  const bool isFirst = buffer_.empty();
+  if (_archiveData(data)) {
+    ++bufferedFeedbacks_;
+    if (done) written_.push_back(std::move(done));
+    if (buffer_.size() >= kMaximumBufferBytes) write();
+    if (isFirst) queue_->async([self = shared_from_this()] { self->write(); });
+  } else {
+    ledger::count(assembly_.tally, endOfLaterRecords_);
+    if (done) done();
+  }
+}
+
+/// Puts a record behind those that are to be written. One that the file has no room for closes it.
 bool FileContainer::_archiveData(std::string_view bytes) {
   queue_->assertIsCurrent();
-  const auto transaction = assembly_.platform.transactions().open("archiveObject");
   const std::uint64_t length = bytes.size();
   std::array<char, kArchivedLengthBytes> prefix{};
   std::memcpy(prefix.data(), &length, sizeof length);
-
   if (!hasRoomFor(prefix.size() + length)) {
     _closeFile();
     return false;
   }
-  const auto appended = fileHandle_->append({prefix.data(), prefix.size()}, bytes);
-  if (!appended) {
-    log().error("{}", appended.error().description());
-    _closeFile();
-  }
-  return appended.has_value();
+  if (!transaction_) transaction_ = assembly_.platform.transactions().open("archiveObject");
+  buffer_.append(prefix.data(), prefix.size()).append(bytes);
+  return true;
 }
 
 bool FileContainer::hasRoomFor(std::uint64_t bytes) {
-  const auto offset = fileHandle_->size();
-  if (!offset) {
-    log().error("{}", offset.error().description());
-    return false;
-  }
   // A file that would just be full counts as too long.
-  if (*offset + bytes < maxFileSize_) return true;
+  const std::uint64_t offset = fileSize_ + buffer_.size();
+  if (offset + bytes < maxFileSize_) return true;
   endOfLaterRecords_ = SBLLedgerEntry::sizeLimit;
   assembly_.tally.add("com.kestrel.sabled.filesizeexceeded", 1);
-  log().error("bytes written ({}) + feedback ({}) exceeds max session size ({})", *offset, bytes,
+  log().error("bytes written ({}) + feedback ({}) exceeds max session size ({})", offset, bytes,
               maxFileSize_);
   return false;
+}
+
+/// Writes what there is. Closes the file when that fails: what came after half a record could not be
+/// read.
+bool FileContainer::write() {
+  if (buffer_.empty()) return true;
+  const auto appended = fileHandle_->append(buffer_, {});
+  std::uint64_t feedbacks = bufferedFeedbacks_;
+  if (!appended) {
+    log().error("{}", appended.error().description());
+    const std::uint64_t arrived = fileHandle_->size().value_or(fileSize_) - fileSize_;
+    feedbacks = std::min(feedbacks, wholeRecords(std::string_view(buffer_).substr(0, arrived)));
+    fileHandle_.reset();
+  }
+  ledger::count(assembly_.tally, SBLLedgerEntry::written, static_cast<std::int64_t>(feedbacks));
+  ledger::count(assembly_.tally, endOfLaterRecords_,
+                static_cast<std::int64_t>(bufferedFeedbacks_ - feedbacks));
+  records_ += feedbacks;
+  fileSize_ += buffer_.size();
+  bufferedFeedbacks_ = 0;
+  buffer_.clear();
+  transaction_ = nullptr;
+  for (auto& told : std::exchange(written_, {})) told();
+  return appended.has_value();
 }
 
 void FileContainer::_close() {
@@ -145,6 +176,7 @@ void FileContainer::_close() {
 
 void FileContainer::_closeFile() {
   queue_->assertIsCurrent();
+  write();
   log().debug("close file url {}", fileUrl_.native());
   fileHandle_.reset();
 }
@@ -237,11 +269,9 @@ std::uint64_t recordsInSessionFile(platform::FileManager& fileManager, const std
   const auto file = fileManager.openForReading(fileUrl);
   const auto data = file ? (*file)->map(kMaximumMappedBytes) : tl::unexpected(file.error());
   if (!data) return 0;
-  ArchivedDataIterator records(*data);
   constexpr std::uint64_t kVersionAndRoot = 2;
-  std::uint64_t count = 0;
-  while (records.skipNextObject()) ++count;
-  return count - std::min(count, kVersionAndRoot);
+  const std::uint64_t records = wholeRecords(*data);
+  return records - std::min(records, kVersionAndRoot);
 }
 
 }  // namespace sable

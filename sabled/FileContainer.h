@@ -5,11 +5,13 @@
 #include <memory>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "SableKit/SBLFeedbackLedger.h"
 #include "platform/FileManager.h"
 #include "platform/Function.h"
 #include "platform/Runtime.h"
+#include "platform/Transaction.h"
 
 namespace sable {
 
@@ -29,8 +31,9 @@ class SableFeedback;
 ///     3 ...   a feedback each, as they came: a `_SKSableFeedback`
 ///
 /// Another build of the daemon or of the system has another user agent and does not read the file.
-/// A record is written at once and reaches the disk in the system's own time: a kill tears at most
-/// the last one, and what stands before it is read.
+/// A record is written as soon as the queue comes to it, in one go with those that have come meanwhile,
+/// and reaches the disk in the system's own time: a kill tears at most the last one, and what stands
+/// before it is read.
 ///
 ///     open --close, a write that failed, a record past the limit--> closed
 ///
@@ -71,6 +74,8 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
  private:
   bool _archiveData(std::string_view bytes);
   bool hasRoomFor(std::uint64_t bytes);
+  void addFeedback(std::string_view data, platform::Function<void()> done);
+  bool write();
   std::shared_ptr<ClientSession> readFile();
   std::shared_ptr<ClientSession> _unarchiveObject(platform::ReadableFile& fileHandle);
   std::shared_ptr<ClientSession> decode(std::string_view data);
@@ -83,7 +88,13 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
 
   // On queue_.
   std::unique_ptr<platform::AppendableFile> fileHandle_;  ///< null when closed
-  std::uint64_t records_ = 0, readRecords_ = 0;           ///< feedback in the file; as far as it was read
+  std::uint64_t fileSize_ = 0;                            ///< of a file that is written here
+  /// Records to be written, of which so many are feedback, and who is told then.
+  std::string buffer_;
+  std::uint64_t bufferedFeedbacks_ = 0;
+  std::vector<platform::Function<void()>> written_;
+  std::shared_ptr<platform::Transaction> transaction_;  ///< as long as there are any
+  std::uint64_t records_ = 0, readRecords_ = 0;         ///< feedback in the file; as far as it was read
   SBLLedgerEntry endOfLaterRecords_ = SBLLedgerEntry::unwritten;  ///< of those that find the file closed
   SBLLedgerEntry end_ = SBLLedgerEntry::damaged;  ///< of those in the file, by the last read()
 };
