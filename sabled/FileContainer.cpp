@@ -32,6 +32,13 @@ const platform::LogHandle& log() {
   return SableLogForCategory(SableLoggingCategoryFeedbackStorage);
 }
 
+/// What follows the first dot of a name, when it is a UUID: the mark of a held file.
+std::string tokenIn(const std::filesystem::path& fileUrl) {
+  const std::string name = fileUrl.filename();
+  const std::string suffix = name.substr(std::min(name.find('.'), name.size() - 1) + 1);
+  return UUID::parse(suffix) ? suffix : "";
+}
+
 Expected<std::string_view> mmapFileHandle(platform::ReadableFile& fileHandle) {
   auto data = fileHandle.map(kMaximumMappedBytes);
   if (data) return data;
@@ -81,6 +88,8 @@ FileContainer::FileContainer(Assembly& assembly, std::unique_ptr<platform::Appen
       version_(std::move(version)),
       queue_(std::move(queue)),
       maxFileSize_(maxFileSize),
+      location_(fileUrl_),
+      token_(tokenIn(fileUrl_)),
       fileHandle_(std::move(fileHandle)) {}
 
 FileContainer::FileContainer(Assembly& assembly, std::filesystem::path fileUrl, std::string version,
@@ -181,6 +190,33 @@ void FileContainer::_closeFile() {
   fileHandle_.reset();
 }
 
+Expected<void> FileContainer::_hold(std::string_view prefix) {
+  queue_->assertIsCurrent();
+  if (!token_.empty()) return {};
+  const std::string token = assembly_.runtime.uuid().string();
+  const std::string name = std::string(prefix) + token;
+  if (auto renamed = assembly_.fileManager.rename(location_, name); !renamed) return renamed;
+  location_.replace_filename(name);
+  token_ = token;
+  return {};
+}
+
+bool FileContainer::isNamed(std::string_view prefix) const {
+  queue_->assertIsCurrent();
+  return location_.filename().native().starts_with(prefix);
+}
+
+Expected<void> FileContainer::_delete() {
+  queue_->assertIsCurrent();
+  return assembly_.fileManager.remove(location_);
+}
+
+void FileContainer::_setHandedOver() {
+  queue_->assertIsCurrent();
+  readRecords_ = records_;
+  end_ = SBLLedgerEntry::handedOver;
+}
+
 std::shared_ptr<ClientSession> FileContainer::read() {
   return queue_->sync([this] { return readFile(); });
 }
@@ -192,7 +228,7 @@ std::shared_ptr<ClientSession> FileContainer::readFile() {
     log().fault("file is already open closing it {}", fileUrl_.native());
     _closeFile();
   }
-  const auto attributes = assembly_.fileManager.attributes(fileUrl_);
+  const auto attributes = assembly_.fileManager.attributes(location_);
   if (!attributes) {
     log().error("Attribute fetch error {}", attributes.error().description());
     return nullptr;
@@ -203,7 +239,7 @@ std::shared_ptr<ClientSession> FileContainer::readFile() {
     log().error("Session too big to process");
     return nullptr;
   }
-  const auto file = assembly_.fileManager.openForReading(fileUrl_);
+  const auto file = assembly_.fileManager.openForReading(location_);
   if (!file) {
     log().error("Could not open file for reading {}", fileUrl_.native());
     return nullptr;

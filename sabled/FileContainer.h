@@ -36,6 +36,7 @@ class SableFeedback;
 /// before it is read.
 ///
 ///     open --close, a write that failed, a record past the limit--> closed
+///     closed --_hold--> under a name of its own, which no other file ever has, until it is deleted
 ///
 /// Writes to a closed file are left out without a word. All work on the file is done on the
 /// storage's queue; callers that write never wait for it.
@@ -45,11 +46,13 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
   FileContainer(Assembly& assembly, std::unique_ptr<platform::AppendableFile> fileHandle,
                 std::filesystem::path fileUrl, std::string version,
                 std::shared_ptr<platform::SerialQueue> queue, std::uint64_t maxFileSize);
-  /// A file found on the disk.
+  /// A file found on the disk; it is held when its name says so.
   FileContainer(Assembly& assembly, std::filesystem::path fileUrl, std::string version,
                 std::shared_ptr<platform::SerialQueue> queue, std::uint64_t maxFileSize);
 
   const std::filesystem::path& fileUrl() const { return fileUrl_; }
+  /// The UUID in the name of a held file, which stands for what the file holds; else empty.
+  const std::string& token() const { return token_; }
 
   /// Writes the first two records, later, from the session as it is now.
   void writeSessionHeader(const ClientSession& session);
@@ -62,6 +65,13 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
   std::shared_ptr<ClientSession> read();
 
   // For the storage, on its queue.
+  /// Renames the file to `prefix` and a UUID, so that the next process, too, knows it for the one that was
+  /// being sent; a file that is held stays as it is.
+  Expected<void> _hold(std::string_view prefix);
+  bool isNamed(std::string_view prefix) const;
+  Expected<void> _delete();
+  /// An earlier process has handed the records over.
+  void _setHandedOver();
   /// Counts the records of a file that was found, whether or not this daemon can read them; a torn
   /// one does not count. Logs nothing.
   std::uint64_t countRecords();
@@ -81,12 +91,14 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
   std::shared_ptr<ClientSession> decode(std::string_view data);
 
   Assembly& assembly_;
-  const std::filesystem::path fileUrl_;
+  const std::filesystem::path fileUrl_;  ///< by which it is known, here and in the log
   const std::string version_;
   const std::shared_ptr<platform::SerialQueue> queue_;
   const std::uint64_t maxFileSize_;
 
   // On queue_.
+  std::filesystem::path location_;                        ///< where the bytes are
+  std::string token_;                                     ///< not changed any more once it is set
   std::unique_ptr<platform::AppendableFile> fileHandle_;  ///< null when closed
   std::uint64_t fileSize_ = 0;                            ///< of a file that is written here
   /// Records to be written, of which so many are feedback, and who is told then.

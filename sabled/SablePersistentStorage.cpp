@@ -22,6 +22,8 @@ namespace sable {
 namespace {
 
 constexpr std::string_view kFilePrefix = "session.";
+constexpr std::string_view kHeldPrefix = "flushing.";
+constexpr std::string_view kCrowdsourcingPrefix = "crowdsourcing.";
 constexpr std::int64_t kDefaultMaxFileSize = 2097152;  // bytes
 constexpr double kDefaultMaxFileAge = 172800;          // seconds
 
@@ -87,27 +89,78 @@ void SablePersistentStorage::closeSessionWithFileContainer(std::shared_ptr<FileC
   });
 }
 
-std::vector<std::shared_ptr<FileContainer>> SablePersistentStorage::getAvailableSessionHandles() {
-  return queue_->sync([this] {
-    for (const auto& container : fileContainers_)
-      log().debug("available file url {}", container->fileUrl().native());
-    return fileContainers_;
+void SablePersistentStorage::closeCrowdsourcingSessionWithFileContainer(
+    std::shared_ptr<FileContainer> container) {
+  queue_->async([this, container = std::move(container)] {
+    container->_closeFile();
+    // Without its own name it would be sent where all others go.
+    if (const auto held = container->_hold(kCrowdsourcingPrefix); !held)
+      log().error("{}", held.error().description());
+    listOf(*container).push_back(container);
   });
+}
+
+std::vector<std::shared_ptr<FileContainer>> SablePersistentStorage::getAvailableSessionHandles() {
+  return queue_->sync([this] { return available(fileContainers_); });
+}
+
+std::vector<std::shared_ptr<FileContainer>> SablePersistentStorage::getAvailableCrowdsourcingHandles() {
+  return queue_->sync([this] { return available(crowdsourcingContainers_); });
+}
+
+SablePersistentStorage::FileContainers SablePersistentStorage::available(const FileContainers& list) {
+  for (const auto& container : list) log().debug("available file url {}", container->fileUrl().native());
+  return list;
+}
+
+/// The list in which the file waits.
+SablePersistentStorage::FileContainers& SablePersistentStorage::listOf(const FileContainer& container) {
+  return container.isNamed(kCrowdsourcingPrefix) ? crowdsourcingContainers_ : fileContainers_;
+}
+
+bool SablePersistentStorage::holdSessionWithFileContainer(const std::shared_ptr<FileContainer>& container) {
+  return queue_->sync([&] {
+    const auto held = container->_hold(kHeldPrefix);
+    if (!held) log().error("{}", held.error().description());
+    // A file that somebody has taken away never comes back.
+    if (held || held.error().code == ENOENT) std::erase(listOf(*container), container);
+    return held.has_value();
+  });
+}
+
+void SablePersistentStorage::releaseSessionWithFileContainer(
+    const std::shared_ptr<FileContainer>& container) {
+  queue_->sync([&] { listOf(*container).push_back(container); });
 }
 
 void SablePersistentStorage::deleteSessionWithFileContainer(const std::shared_ptr<FileContainer>& container) {
   queue_->sync([&] {
-    std::erase(fileContainers_, container);
+    std::erase(listOf(*container), container);
     _deleteSessionFile(*container);
     container->closeAccount();
   });
 }
 
-void SablePersistentStorage::_deleteSessionFile(const FileContainer& container) {
+void SablePersistentStorage::_deleteSessionFile(FileContainer& container) {
   log().debug("delete file url {}", container.fileUrl().native());
-  if (const auto removed = assembly_.fileManager.remove(container.fileUrl()); !removed) {
-    log().error("File {} delete failed", container.fileUrl().native());
-  }
+  if (!container._delete()) log().error("File {} delete failed", container.fileUrl().native());
+}
+
+void SablePersistentStorage::adoptHeldSessions(const std::function<bool(const std::string&)>& hasAccepted) {
+  queue_->sync([&] {
+    for (const auto& container : std::exchange(heldByEarlierRuns_, {})) {
+      if (hasAccepted(container->token())) {
+        _deleteSessionFile(*container);
+        container->_setHandedOver();
+        container->closeAccount();
+      } else if (const auto attributes = assembly_.fileManager.attributes(container->fileUrl());
+                 !attributes) {
+        log().error("Attribute fetch error {}", attributes.error().description());
+      } else if (!deleteIfTooOld(container->fileUrl(), attributes->creationDate)) {
+        listOf(*container).push_back(container);
+      }
+    }
+  });
 }
 
 void SablePersistentStorage::_scanCacheDirectory() {
@@ -124,6 +177,7 @@ void SablePersistentStorage::_scanCacheDirectory() {
   }
   for (const std::string& name : *names) {
     if (name.starts_with(kFilePrefix)) scanFile(name);
+    if (name.starts_with(kHeldPrefix) || name.starts_with(kCrowdsourcingPrefix)) scanHeldFile(name);
   }
 }
 
@@ -140,8 +194,17 @@ void SablePersistentStorage::scanFile(const std::string& name) {
   const char* end = name.data() + name.size();
   if (std::from_chars(name.data() + kFilePrefix.size(), end, number).ptr == end)
     handleId_ = std::max(handleId_.load(), number + 1);
-  fileContainers_.push_back(
-      std::make_shared<FileContainer>(assembly_, fileUrl, version_, queue_, maxFileSize_));
+  fileContainers_.push_back(foundFile(fileUrl));
+}
+
+/// Its age is looked at when it is adopted: it may have been sent long ago.
+void SablePersistentStorage::scanHeldFile(const std::string& name) {
+  auto container = foundFile(*cachesUrl_ / name);
+  if (!container->token().empty()) heldByEarlierRuns_.push_back(std::move(container));
+}
+
+std::shared_ptr<FileContainer> SablePersistentStorage::foundFile(const std::filesystem::path& fileUrl) {
+  return std::make_shared<FileContainer>(assembly_, fileUrl, version_, queue_, maxFileSize_);
 }
 
 bool SablePersistentStorage::deleteIfTooOld(const std::filesystem::path& fileUrl,
@@ -158,7 +221,9 @@ bool SablePersistentStorage::deleteIfTooOld(const std::filesystem::path& fileUrl
 /// What is on the disk says what became of the records that the last run had not yet counted. Later,
 /// but before a first write: nobody who starts up waits for the files to be read.
 void SablePersistentStorage::settleLedger() {
-  queue_->async([&tally = assembly_.tally, found = fileContainers_,
+  FileContainers found = fileContainers_;
+  found.insert(found.end(), heldByEarlierRuns_.begin(), heldByEarlierRuns_.end());
+  queue_->async([&tally = assembly_.tally, found = std::move(found),
                  before = SBLFeedbackLedger(assembly_.tally.snapshot())] {
     std::uint64_t stored = 0;
     for (const auto& container : found) stored += container->countRecords();

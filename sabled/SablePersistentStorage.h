@@ -3,6 +3,7 @@
 #include <atomic>
 #include <cstdint>
 #include <filesystem>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -16,10 +17,18 @@ class Assembly;
 class FileContainer;
 
 /// The session files: "com.kestrel.sabled/session.N" in the user's caches directory, 0600, N counting
-/// up. A file is written by one session, then waits until the flusher has read and deleted it; so do
-/// files that an earlier run left, unless they are too old. Limits are the settings
-/// "SBLSessionSizeLimit" (bytes) and "SBLSessionMaxAge" (seconds) as they are at the start. Any
-/// thread.
+/// up. A file is written by one session, then waits for the flusher; so do files that an earlier run
+/// left, unless they are too old. Limits are the settings "SBLSessionSizeLimit" (bytes) and
+/// "SBLSessionMaxAge" (seconds) as they are at the start. Any thread.
+///
+///     session.N --complete--> available --hold--> flushing.UUID --sent, unreadable, nowhere to send-->
+///     deleted
+///                                 ^                    |
+///                                 '--- could not begin, or killed before the upload was accepted
+///
+/// The UUID goes with the upload, so that the next run can ask whether that was accepted: a kill at any
+/// moment neither loses a session nor sends it twice. Crowdsourcing sessions, which go elsewhere, wait
+/// in files "crowdsourcing.UUID".
 class SablePersistentStorage {
  public:
   /// Looks for the files of earlier runs; waits for the disk.
@@ -32,19 +41,38 @@ class SablePersistentStorage {
   /// Closes the file, after what was written before, and makes it available. Does not wait.
   void closeSessionWithFileContainer(std::shared_ptr<FileContainer> container);
 
+  /// The same for a crowdsourcing session.
+  void closeCrowdsourcingSessionWithFileContainer(std::shared_ptr<FileContainer> container);
+
   /// The files whose sessions are complete.
   std::vector<std::shared_ptr<FileContainer>> getAvailableSessionHandles();
+  std::vector<std::shared_ptr<FileContainer>> getAvailableCrowdsourcingHandles();
 
-  /// Deletes the file. It is gone when this returns, so that what is sent now is never sent again.
+  /// Takes the file out of the available ones until it is deleted or released; its token() is set. False
+  /// when that cannot be: it stays available, or is gone.
+  bool holdSessionWithFileContainer(const std::shared_ptr<FileContainer>& container);
+  /// Makes a file that was held available again.
+  void releaseSessionWithFileContainer(const std::shared_ptr<FileContainer>& container);
+
+  /// Deletes the file. It is gone when this returns.
   void deleteSessionWithFileContainer(const std::shared_ptr<FileContainer>& container);
 
+  /// What earlier runs held is deleted where `hasAccepted` says so of its token, else available again.
+  void adoptHeldSessions(const std::function<bool(const std::string&)>& hasAccepted);
+
  private:
+  using FileContainers = std::vector<std::shared_ptr<FileContainer>>;
+
   std::optional<std::filesystem::path> _newFileUrl();
+  FileContainers& listOf(const FileContainer& container);
+  FileContainers available(const FileContainers& list);
   void _scanCacheDirectory();
   void scanFile(const std::string& name);
+  void scanHeldFile(const std::string& name);
+  std::shared_ptr<FileContainer> foundFile(const std::filesystem::path& fileUrl);
   bool deleteIfTooOld(const std::filesystem::path& fileUrl, platform::WallTime creationDate);
   void settleLedger();
-  void _deleteSessionFile(const FileContainer& container);
+  void _deleteSessionFile(FileContainer& container);
 
   Assembly& assembly_;
   const std::shared_ptr<platform::SerialQueue> queue_;
@@ -56,7 +84,9 @@ class SablePersistentStorage {
   /// Of the next name. After the last number it begins again; names that are taken are passed over.
   std::atomic<std::uint32_t> handleId_{0};
 
-  std::vector<std::shared_ptr<FileContainer>> fileContainers_;  ///< on queue_
+  // On queue_.
+  FileContainers fileContainers_, crowdsourcingContainers_;
+  FileContainers heldByEarlierRuns_;  ///< until they are adopted
 };
 
 }  // namespace sable
