@@ -14,6 +14,7 @@
 #include "sabled/Lookup.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SableBagController.h"
+#include "sabled/SableFeedbackFlusher.h"
 #include "sabled/SableFlusherRelay.h"
 #include "sabled/SablePersistentStorage.h"
 #include "sabled/SableUserGUIDController.h"

@@ -20,6 +20,7 @@ class ImageFetcher;
 class Lookup;
 class SBLNetworkRequestFactory;
 class SableBagController;
+class SableFeedbackFlusher;
 class SableFlusherRelay;
 class SablePersistentStorage;
 class SableUserGUIDController;
@@ -47,6 +48,7 @@ class Assembly {
   // Destroyed in reverse order: what is built on others goes first.
   std::unique_ptr<SBLNetworkRequestFactory> requestFactory;
   std::unique_ptr<SablePersistentStorage> persistentStorage;
+  std::unique_ptr<SableFeedbackFlusher> crowdsourcingFeedbackFlusher;
   std::unique_ptr<BackgroundFlusher> backgroundFlusher;
   std::unique_ptr<SableUserGUIDController> guidController;
   /// Of the daemon itself, and of all clients where they share a session.

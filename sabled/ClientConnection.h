@@ -17,6 +17,7 @@
 namespace sable {
 
 class Assembly;
+class ClientSession;
 class ClientState;
 class FeedbackMessage;
 class SBLBag;
@@ -74,6 +75,8 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void reportEvent(platform::RelayCall& call);
   void reportPayload(std::unique_ptr<FeedbackMessage> message, std::int64_t queryId);
   void reportLost(std::string reason, const char* logLine);
+  void inSessionOfItsOwn(std::unique_ptr<FeedbackMessage> message, std::int64_t queryId,
+                         void (*complete)(Assembly&, ClientSession&));
   void handleCustomFeedback(std::unique_ptr<FeedbackMessage> message, std::int64_t queryId);
   void noteEngagement(const ResultEngagement& engagement);
   void feedback(platform::RelayReply reply);

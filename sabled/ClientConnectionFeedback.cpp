@@ -15,6 +15,7 @@
 #include "sabled/ClientState.h"
 #include "sabled/SableFeedback.h"
 #include "sabled/SableLogging.h"
+#include "sabled/SablePersistentStorage.h"
 
 // What a client reports, and its way into a session.
 namespace sable {
@@ -103,20 +104,31 @@ void ClientConnection::handleCustomFeedback(std::unique_ptr<FeedbackMessage> mes
   switch (*message->customFeedbackType()) {
     case kRoverAutofill:
     case kBeaconResultFeatures:
-      assembly_.runtime.globalQueue(QualityOfService::background)
-          .async([&assembly = assembly_,
-                  feedback = std::make_shared<SableFeedback>(std::move(message), queryId, std::nullopt,
-                                                             state_->userAgent().value_or(""))] {
-            ClientSession(assembly, feedback).sessionComplete();
-          });
+      inSessionOfItsOwn(std::move(message), queryId,
+                        [](Assembly&, ClientSession& session) { session.sessionComplete(); });
       break;
     case kCrowdsourcing:
-      // Nothing here sends it: it is counted and goes no further.
       assembly_.tally.add("com.kestrel.sabled.dp.submit", 1);
+      inSessionOfItsOwn(std::move(message), queryId, [](Assembly& assembly, ClientSession& session) {
+        if (!session.storageHandle()) return;
+        assembly.persistentStorage->closeCrowdsourcingSessionWithFileContainer(session.storageHandle());
+      });
       break;
     default:
       break;
   }
+}
+
+/// Later: a session makes a file.
+void ClientConnection::inSessionOfItsOwn(std::unique_ptr<FeedbackMessage> message, std::int64_t queryId,
+                                         void (*complete)(Assembly&, ClientSession&)) {
+  auto feedback = std::make_shared<SableFeedback>(std::move(message), queryId, std::nullopt,
+                                                  state_->userAgent().value_or(""));
+  assembly_.runtime.globalQueue(QualityOfService::background)
+      .async([&assembly = assembly_, feedback = std::move(feedback), complete] {
+        ClientSession session(assembly, feedback);
+        complete(assembly, session);
+      });
 }
 
 void ClientConnection::feedback(platform::RelayReply reply) {

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <memory>
 #include <optional>
@@ -52,6 +53,9 @@ class ClientSession final : public FeedbackSession {
   Dictionary privacyFilteredFeedbacksWithRelativeTimestamp(const SableFeedbacks& feedbacks) override;
   /// The upload's envelope of a session that was read back. Once: its feedback is processed.
   Dictionary getFeedbacksToSend();
+  /// The same as JSON, and likewise once: compactJSON() of it, handed out in pieces so that it is never
+  /// in memory as a whole. Ends early where `write` answers false, and then returns false.
+  bool writeFeedbacksToSend(const std::function<bool(std::string_view)>& write);
 
   void enumerateSessions(const std::function<void(ClientSession&, bool)>& callback) override;
 
@@ -75,7 +79,11 @@ class ClientSession final : public FeedbackSession {
  private:
   explicit ClientSession(Assembly& assembly);
 
+  using RecordVisitor = std::function<bool(const Dictionary& record)>;
+
   void begin(const SableFeedback* feedback);
+  bool visitRecordsToSend(const SableFeedbacks& feedbacks, const RecordVisitor& visit);
+  Dictionary envelopeBehindFeedback();
   bool _firstUseOfTheDay(const std::string& agent);
   bool _updateFirstUseDate(platform::WallTime date, const std::string& agent);
   void _addFeedback(const std::shared_ptr<SableFeedback>& feedback);

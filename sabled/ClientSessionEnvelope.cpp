@@ -1,6 +1,8 @@
 // How a session's feedback leaves the device.
+#include <algorithm>
 #include <cmath>
 #include <nlohmann/json.hpp>
+#include <utility>
 
 #include "sabled/Assembly.h"
 #include "sabled/ClientSession.h"
@@ -41,28 +43,52 @@ Dictionary ClientSession::feedbacksWithRelativeTimestamp() {
 }
 
 Dictionary ClientSession::privacyFilteredFeedbacksWithRelativeTimestamp(const SableFeedbacks& feedbacks) {
-  SessionProcessingHelper helper;
   Dictionary result = Dictionary::array();
+  visitRecordsToSend(feedbacks, [&](const Dictionary& record) {
+    result.push_back(record);
+    return true;
+  });
+  return result;
+}
+
+/// Each record in the order in which it is uploaded. What is missing goes first: the suggestions, then
+/// the results. Only when all feedback is processed is it known. False when `visit` says so.
+bool ClientSession::visitRecordsToSend(const SableFeedbacks& feedbacks, const RecordVisitor& visit) {
+  SessionProcessingHelper helper;
   for (const auto& feedback : feedbacks) {
     setRelativeTimestamp(*feedback, *feedbacks.front());
     feedback->process(helper);
-    result.push_back(feedback->dictionary());
   }
-  // Each goes to the front, so that the suggestions precede the results, and both all else.
-  const auto insert = [&](feedback::Message message) {
-    result.insert(result.begin(), SableFeedback(std::move(message), 0, userGuid(), agent_).dictionary());
+  const auto visitMissing = [&](const std::vector<std::string>& missing, auto message) {
+    if (missing.empty()) return true;
+    return visit(
+        SableFeedback(message(assembly_.runtime.ticks(), missing), 0, userGuid(), agent_).dictionary());
   };
-  const auto now = assembly_.runtime.ticks();
-  if (const auto results = helper.missingResults(); !results.empty())
-    insert(feedback::sessionMissingResults(now, results));
-  if (const auto suggestions = helper.missingSuggestions(); !suggestions.empty())
-    insert(feedback::sessionMissingSuggestions(now, suggestions));
-  return result;
+  return visitMissing(helper.missingSuggestions(), feedback::sessionMissingSuggestions) &&
+         visitMissing(helper.missingResults(), feedback::sessionMissingResults) &&
+         std::ranges::all_of(feedbacks, [&](const auto& feedback) { return visit(feedback->dictionary()); });
 }
 
 Dictionary ClientSession::getFeedbacksToSend() {
   Dictionary envelope;
   envelope["fb"] = privacyFilteredFeedbacksWithRelativeTimestamp(getSessionFeedbacks());
+  envelope.update(envelopeBehindFeedback());
+  return envelope;
+}
+
+bool ClientSession::writeFeedbacksToSend(const std::function<bool(std::string_view)>& write) {
+  std::string_view separator = R"({"fb":[)";
+  const bool written = visitRecordsToSend(getSessionFeedbacks(), [&](const Dictionary& record) {
+    return write(std::exchange(separator, ",")) && write(compactJSON(record));
+  });
+  if (!written || (separator != "," && !write(separator))) return false;
+  const std::string rest = compactJSON(envelopeBehindFeedback());
+  return write("],") && write(std::string_view(rest).substr(1));
+}
+
+/// The keys that follow "fb".
+Dictionary ClientSession::envelopeBehindFeedback() {
+  Dictionary envelope;
   envelope["agent"] = agent_;
   const auto guid = userGuid();
   envelope["user_guid"] = guid ? guid->string() : "";

@@ -124,4 +124,20 @@ std::string CompressedOutputStream::dataDigestForStream() const {
   return fmt::format("{:02x}", fmt::join(digest_, ""));
 }
 
+std::optional<std::string> decompressed(std::string_view compressed, std::uint64_t size) {
+  constexpr std::uint64_t kMost = std::numeric_limits<uInt>::max();
+  z_stream stream{};
+  if (size > kMost || compressed.size() > kMost || inflateInit2(&stream, -MAX_WBITS) != Z_OK)
+    return std::nullopt;
+  const std::unique_ptr<z_stream, int (*)(z_stream*)> end(&stream, inflateEnd);
+  std::string text(size, '\0');
+  stream.next_in =
+      reinterpret_cast<Bytef*>(const_cast<char*>(compressed.data()));  // NOLINT(*-const-cast): read only
+  stream.avail_in = static_cast<uInt>(compressed.size());
+  stream.next_out = reinterpret_cast<Bytef*>(text.data());
+  stream.avail_out = static_cast<uInt>(size);
+  if (inflate(&stream, Z_FINISH) != Z_STREAM_END || stream.avail_out != 0) return std::nullopt;
+  return text;
+}
+
 }  // namespace sable

@@ -53,4 +53,7 @@ class CompressedOutputStream final : public OutputStream {
   std::array<std::uint8_t, 64> digest_{};
 };
 
+/// What a CompressedOutputStream has compressed from `size` bytes; nothing when it is not that.
+std::optional<std::string> decompressed(std::string_view compressed, std::uint64_t size);
+
 }  // namespace sable

@@ -8,11 +8,13 @@
 #include "platform/NotificationCenter.h"
 #include "platform/Tally.h"
 #include "platform/UserDefaults.h"
+#include "sabled/BackgroundActivitiesManager.h"
 #include "sabled/ClientStateManager.h"
 #include "sabled/ImageFetcher.h"
 #include "sabled/Lookup.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SableBagController.h"
+#include "sabled/SableFeedbackFlusher.h"
 #include "sabled/SableFlusherRelay.h"
 #include "sabled/SableLogging.h"
 #include "sabled/SablePersistentStorage.h"
@@ -58,6 +60,8 @@ void SableDaemon::createServices() {
   // The order is part of the design: a service may use in its constructor what stands before it.
   assembly_.requestFactory = std::make_unique<SBLNetworkRequestFactory>(assembly_);
   assembly_.persistentStorage = std::make_unique<SablePersistentStorage>(assembly_);
+  assembly_.crowdsourcingFeedbackFlusher = std::make_unique<SableFeedbackFlusher>(assembly_, 0);
+  assembly_.backgroundFlusher = std::make_unique<BackgroundActivitiesManager>(assembly_);
   assembly_.tally.add("com.kestrel.sabled.launch", 1);
   assembly_.imageFetcher = std::make_unique<ImageFetcher>(assembly_);
   assembly_.lookup = std::make_unique<Lookup>(assembly_);
