@@ -194,9 +194,10 @@ Expected<void> FileContainer::_hold(std::string_view prefix) {
   queue_->assertIsCurrent();
   if (!token_.empty()) return {};
   const std::string token = assembly_.runtime.uuid().string();
-  const std::string name = std::string(prefix) + token;
-  if (auto renamed = assembly_.fileManager.rename(location_, name); !renamed) return renamed;
-  location_.replace_filename(name);
+  auto held = location_;
+  held.replace_filename(std::string(prefix) + token);
+  if (auto renamed = assembly_.fileManager.replaceItem(held, location_); !renamed) return renamed;
+  location_ = std::move(held);
   token_ = token;
   return {};
 }

@@ -37,6 +37,12 @@ std::optional<std::filesystem::path> sessionDirectory(platform::FileManager& fil
   return *caches / kSBLSubsystem;
 }
 
+/// Whether it may have passed when the same is tried later.
+bool isTroubleOfDisk(const Error& error) {
+  constexpr std::int64_t kPassing[] = {ENOSPC, EDQUOT, EIO, EROFS, EMFILE, ENFILE, ENOMEM};
+  return std::ranges::find(kPassing, error.code) != std::end(kPassing);
+}
+
 }  // namespace
 
 SablePersistentStorage::SablePersistentStorage(Assembly& assembly)
@@ -122,9 +128,9 @@ bool SablePersistentStorage::holdSessionWithFileContainer(const std::shared_ptr<
   return queue_->sync([&] {
     const auto held = container->_hold(kHeldPrefix);
     if (!held) log().error("{}", held.error().description());
-    // A file that somebody has taken away never comes back.
-    if (held || held.error().code == ENOENT) std::erase(listOf(*container), container);
-    return held.has_value();
+    if (!held && isTroubleOfDisk(held.error())) return false;
+    std::erase(listOf(*container), container);
+    return true;
   });
 }
 

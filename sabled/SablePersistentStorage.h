@@ -48,8 +48,8 @@ class SablePersistentStorage {
   std::vector<std::shared_ptr<FileContainer>> getAvailableSessionHandles();
   std::vector<std::shared_ptr<FileContainer>> getAvailableCrowdsourcingHandles();
 
-  /// Takes the file out of the available ones until it is deleted or released; its token() is set. False
-  /// when that cannot be: it stays available, or is gone.
+  /// Takes the file out of the available ones until it is deleted or released, and gives it a token(). False
+  /// when the disk does not let it: it stays available. What is no file of ours any more gets no token.
   bool holdSessionWithFileContainer(const std::shared_ptr<FileContainer>& container);
   /// Makes a file that was held available again.
   void releaseSessionWithFileContainer(const std::shared_ptr<FileContainer>& container);
