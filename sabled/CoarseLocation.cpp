@@ -2,6 +2,7 @@
 
 #include <fmt/core.h>
 
+#include <algorithm>
 #include <cmath>
 #include <numbers>
 
@@ -24,6 +25,17 @@ int columnsAt(double latitude) {
 
 std::string CoarseLocation::text() const {
   return fmt::format("{:f},{:f}", latitude, longitude);
+}
+
+double distance(const CoarseLocation& from, const CoarseLocation& to) {
+  constexpr double kEarthRadius = 6'371'000;
+  constexpr double kRadian = std::numbers::pi / 180;
+  // The haversine formula, which is exact enough for short ways, too.
+  const double north = std::sin((to.latitude - from.latitude) * kRadian / 2);
+  const double east = std::sin((to.longitude - from.longitude) * kRadian / 2);
+  const double chord =
+      north * north + std::cos(from.latitude * kRadian) * std::cos(to.latitude * kRadian) * east * east;
+  return 2 * kEarthRadius * std::asin(std::sqrt(std::min(1.0, chord)));
 }
 
 std::optional<CoarseLocation> coarseLocation(double latitude, double longitude) {

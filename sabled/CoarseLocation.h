@@ -25,4 +25,7 @@ struct CoarseLocation {
 /// nullopt for what is no place on Earth: a latitude beyond 90, a longitude beyond 180, not a number.
 std::optional<CoarseLocation> coarseLocation(double latitude, double longitude);
 
+/// Metres between the middles of two cells, along a great circle of a round Earth.
+double distance(const CoarseLocation& from, const CoarseLocation& to);
+
 }  // namespace sable

@@ -33,6 +33,11 @@ class SableURLRequestBuilder;
 /// depends.
 inline constexpr std::string_view kSBLBagRefreshRequired = "SBLBagRefreshRequired";
 
+/// Posted (object: the factory) when a search was sent from a place some 50 km and more from the one that
+/// the last download for lookups told.
+inline constexpr std::string_view kSBLSignificantLocationChangeNotification =
+    "SBLSignificantLocationChangeNotification";
+
 /// The scale of the client's screen, with one decimal.
 inline constexpr std::string_view kUIScaleHeader = "X-Kestrel-UI-Scale";
 
@@ -116,10 +121,12 @@ class SBLNetworkRequestFactory {
     std::string localTimeZoneName;
     std::set<std::string> supportedGeoLocationSources;  ///< that the bag allows
     std::shared_ptr<platform::LocationManager> locationManager;
-    std::optional<Location> geoLocation;  ///< the last fix that was accepted
-    std::string geoLocationLatLng;        ///< "latitude,longitude" of it
-    std::string lookupGeoLocationLatLng;  ///< likewise, when the last search was sent
-    std::string geoLocationSource;        ///< its source, or why there is none
+    std::optional<Location> geoLocation;          ///< the last fix that was accepted
+    std::string geoLocationLatLng;                ///< "latitude,longitude" of it
+    std::optional<CoarseLocation> lookupPlace;    ///< where the last search was sent
+    std::string lookupGeoLocationLatLng;          ///< likewise, as text
+    std::optional<CoarseLocation> downloadPlace;  ///< that the last download for lookups told
+    std::string geoLocationSource;                ///< its source, or why there is none
     std::optional<std::string> geoClientMetadata;
     std::string storeFrontIdentifier;
     std::optional<std::string> subscriptionInfo;
@@ -171,7 +178,7 @@ class SBLNetworkRequestFactory {
   void _addHttpRequestSubscriptionInfo(Builder& builder) const;
   void _addHttpAppWhitelistSignature(Builder& builder) const;
   void _addHttpRequestTopTopics(Builder& builder, const SBLSearchRequest& input) const;
-  void _addHttpFuzzedLocation(Builder& builder) const;
+  void _addHttpFuzzedLocation(Builder& builder);
   void _addHttpIfNoneMatch(Builder& builder, std::string_view version) const;
   void _addHttpGeoClientMetadata(Builder& builder) const;
 
@@ -204,6 +211,7 @@ class SBLNetworkRequestFactory {
   bool _setLocationIfAllowedByBag(const platform::LocationFix& fix);
   bool _setLocation(const platform::LocationFix& fix, const std::string& source);
   void _setNoLocationWithReason(std::string_view reason);
+  void noteLookupPlace(const CoarseLocation& place);
   const std::string& _getLookupLatLng() const;
 
   Assembly& assembly_;

@@ -20,6 +20,9 @@ constexpr platform::Duration kFreshFor = std::chrono::seconds(300);
 /// In metres: two cells of the grid. What is finer costs the device more and is thrown away.
 constexpr double kDesiredAccuracy = 10'000;
 
+/// In metres: another town, for which there are other hints.
+constexpr double kSignificantDistance = 50'000;
+
 // Why there is no location, in the place of its source. Read by the service.
 constexpr std::string_view kUserNo = "userno";
 constexpr std::string_view kBagNo = "bagno";
@@ -142,6 +145,7 @@ void SBLNetworkRequestFactory::_setNoLocationWithReason(std::string_view reason)
   contextAccessQueue_->assertIsCurrent();
   context_.geoLocation.reset();
   context_.geoLocationLatLng.clear();
+  context_.lookupPlace.reset();
   context_.lookupGeoLocationLatLng.clear();
   context_.geoLocationSource = reason;
   log().info("location: {}", reason);
@@ -149,7 +153,19 @@ void SBLNetworkRequestFactory::_setNoLocationWithReason(std::string_view reason)
 
 void SBLNetworkRequestFactory::setPerformedSearch() {
   contextAccessQueue_->async([this] {
-    if (context_.geoLocation) context_.lookupGeoLocationLatLng = context_.geoLocation->place.text();
+    if (context_.geoLocation) noteLookupPlace(context_.geoLocation->place);
+  });
+}
+
+void SBLNetworkRequestFactory::noteLookupPlace(const CoarseLocation& place) {
+  contextAccessQueue_->assertIsCurrent();
+  context_.lookupPlace = place;
+  context_.lookupGeoLocationLatLng = place.text();
+  if (!context_.downloadPlace || distance(*context_.downloadPlace, place) < kSignificantDistance) return;
+  context_.downloadPlace.reset();  // one move is told once
+  log().info("the device has moved far");
+  assembly_.runtime.globalQueue(platform::QualityOfService::standard).async([this] {
+    assembly_.notificationCenter.post({kSBLSignificantLocationChangeNotification, this, {}});
   });
 }
 

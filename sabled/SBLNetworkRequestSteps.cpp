@@ -226,8 +226,9 @@ void SBLNetworkRequestFactory::_addHttpRequestTopTopics(Builder& builder,
   if (topics) builder.defaultHttpHeaderWithName("X-Kestrel-TopTopics", compactJSON(*topics));
 }
 
-void SBLNetworkRequestFactory::_addHttpFuzzedLocation(Builder& builder) const {
+void SBLNetworkRequestFactory::_addHttpFuzzedLocation(Builder& builder) {
   beginStep(builder, __func__);
+  context_.downloadPlace = context_.lookupPlace;
   addHeaderIfPresent(builder, "X-Kestrel-FuzzedLatLong", _getLookupLatLng());
 }
 
