@@ -21,6 +21,7 @@ constexpr std::array kDaemonMethods{
 
 constexpr std::array kDiagnosticsMethods{
     RelayMethod{"Explain", "sa{sv}", "s"},
+    RelayMethod{"Resources", "", "s"},
 };
 
 constexpr std::array kClientMethods{

@@ -29,7 +29,8 @@ struct SBLDaemonRelay {
 extern const platform::RelayInterface kSBLDiagnosticsRelay;
 struct SBLDiagnosticsRelay {
   enum Method : std::size_t {
-    explain,  ///< s class, a{sv} record -> s JSON: what the request would do, and why
+    explain,    ///< s class, a{sv} record -> s JSON: what the request would do, and why
+    resources,  ///< -> s JSON: the resource files, what is held of them and what is planned
   };
 };
 

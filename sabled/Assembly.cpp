@@ -10,6 +10,7 @@
 #include "sabled/BackgroundFlusher.h"
 #include "sabled/ClientSessionManager.h"
 #include "sabled/ClientStateManager.h"
+#include "sabled/DownloadManager.h"
 #include "sabled/ImageFetcher.h"
 #include "sabled/Lookup.h"
 #include "sabled/SBLNetworkRequestFactory.h"

@@ -16,6 +16,7 @@ namespace sable {
 class BackgroundFlusher;
 class ClientSessionManager;
 class ClientStateManager;
+class DownloadManager;
 class ImageFetcher;
 class Lookup;
 class SBLNetworkRequestFactory;
@@ -47,6 +48,7 @@ class Assembly {
 
   // Destroyed in reverse order: what is built on others goes first.
   std::unique_ptr<SBLNetworkRequestFactory> requestFactory;
+  std::unique_ptr<DownloadManager> downloadManager;
   std::unique_ptr<SablePersistentStorage> persistentStorage;
   std::unique_ptr<SableFeedbackFlusher> crowdsourcingFeedbackFlusher;
   std::unique_ptr<BackgroundFlusher> backgroundFlusher;

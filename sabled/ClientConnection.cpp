@@ -16,6 +16,7 @@
 #include "sabled/ClientSessionManager.h"
 #include "sabled/ClientState.h"
 #include "sabled/ClientStateManager.h"
+#include "sabled/DownloadManager.h"
 #include "sabled/KeyboardLocale.h"
 #include "sabled/RequestReply.h"
 #include "sabled/SableBagController.h"
@@ -59,7 +60,7 @@ void ClientConnection::start() {
     if (const auto self = weak.lock()) self->handleInvocation(std::move(call));
   });
   connection_->exportObject(kSBLDiagnosticsRelay, [weak = weak_from_this()](platform::RelayCall call) {
-    if (const auto self = weak.lock()) self->explain(call);
+    if (const auto self = weak.lock()) self->diagnose(call);
   });
   armIdleTimer(kClientIdleTimeout);
   connection_->resume();
@@ -250,8 +251,17 @@ void ClientConnection::request(platform::RelayCall& call) {
   std::visit(Router{*this, reply}, *decoded);
 }
 
-void ClientConnection::explain(platform::RelayCall& call) {
+void ClientConnection::diagnose(platform::RelayCall& call) {
   lastCall_ = assembly_.runtime.ticks();
+  if (call.method == SBLDiagnosticsRelay::explain) return explain(call);
+  if (assembly_.downloadManager == nullptr) return call.reply(compactJSON(Dictionary::array()));
+  assembly_.downloadManager->describeResources(
+      [reply = std::move(call.reply)](const Dictionary& resources) mutable {
+        reply(compactJSON(resources));
+      });
+}
+
+void ClientConnection::explain(platform::RelayCall& call) {
   auto decoded =
       decodeRequest(std::get<std::string>(call.arguments[0]), std::get<RelayRecord>(call.arguments[1]));
   auto* request = decoded ? std::get_if<SBLSearchRequest>(&*decoded) : nullptr;
@@ -305,9 +315,26 @@ void ClientConnection::listSessions(platform::RelayReply reply) {
 void ClientConnection::fileHandleAndAttributesForResource(const std::string& identifier,
                                                           platform::RelayReply reply) {
   _ensureState();
-  reply(platform::RelayFile{}, RelayRecord{},
-        encodeError(makeSBLError(SBLErrorCode::daemonSide,
-                                 "identifier: " + identifier + " exception: no download manager")));
+  platform::FileAttributes attributes;
+  const auto file = openResource(identifier, attributes);
+  if (!file) return reply(platform::RelayFile{}, RelayRecord{}, encodeError(file.error()));
+  RelayRecord record;
+  record.add("size", attributes.size);
+  record.add("creationDate", platform::secondsSince1970(attributes.creationDate));
+  reply(platform::RelayFile{*file}, std::move(record), encodeError(std::nullopt));
+}
+
+Expected<std::shared_ptr<const int>> ClientConnection::openResource(const std::string& identifier,
+                                                                    platform::FileAttributes& attributes) {
+  const auto refused = [&](std::string_view why) {
+    return tl::unexpected(
+        makeSBLError(SBLErrorCode::daemonSide, fmt::format("identifier: {} exception: {}", identifier, why)));
+  };
+  if (assembly_.downloadManager == nullptr) return refused("no download manager");
+  const auto file = assembly_.downloadManager->fileHandleForResource(identifier, attributes);
+  if (file) return (*file)->descriptor();
+  if (file.error().domain == kSBLErrorDomain) return refused(file.error().reason);
+  return tl::unexpected(file.error());
 }
 
 void ClientConnection::flushSession(platform::Function<void(const std::optional<std::string>&)> callback) {

@@ -9,6 +9,7 @@
 #include "SableKit/SBLReply.h"
 #include "SableKit/SBLRequest.h"
 #include "SableKit/SBLSessionConfiguration.h"
+#include "platform/FileManager.h"
 #include "platform/NotificationCenter.h"
 #include "platform/Relay.h"
 #include "platform/Runtime.h"
@@ -68,6 +69,7 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void pushAnswered(const Expected<platform::RelayArguments>& result);
 
   void request(platform::RelayCall& call);
+  void diagnose(platform::RelayCall& call);
   void explain(platform::RelayCall& call);
   void fillDefaults(SBLRequest& request) const;
   void search(const SBLSearchRequest& request, SBLReplyHandler reply);
@@ -82,6 +84,8 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void feedback(platform::RelayReply reply);
   void listSessions(platform::RelayReply reply);
   void fileHandleAndAttributesForResource(const std::string& identifier, platform::RelayReply reply);
+  Expected<std::shared_ptr<const int>> openResource(const std::string& identifier,
+                                                    platform::FileAttributes& attributes);
 
   Assembly& assembly_;
   const std::shared_ptr<platform::RelayConnection> connection_;

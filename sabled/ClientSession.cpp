@@ -12,6 +12,7 @@
 #include "sabled/Assembly.h"
 #include "sabled/ClientNames.h"
 #include "sabled/DaemonFeedback.h"
+#include "sabled/DownloadManager.h"
 #include "sabled/FeedbackLedger.h"
 #include "sabled/FileContainer.h"
 #include "sabled/ParsedMessage.h"
@@ -82,6 +83,8 @@ void ClientSession::begin(const SableFeedback* feedback) {
     firstUseDate_ = assembly_.userDefaults.date(key);
   if (!agent_.empty()) assembly_.tally.add(createTallyKey(agent_, "sessions"), 1);
   firstUseOfTheDay_ = _firstUseOfTheDay(agent_);
+  if (assembly_.downloadManager != nullptr)
+    setResourceVersions(assembly_.downloadManager->resourceVersions());
 }
 
 bool ClientSession::_firstUseOfTheDay(const std::string& agent) {

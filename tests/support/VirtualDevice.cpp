@@ -126,6 +126,11 @@ void VirtualDevice::killDaemon() {
   platform.runtime().dropWork();
   daemon_.reset();
   platform.runtime().dropWork();
+void VirtualDevice::restart() {
+  clients_.clear();
+  run();
+  daemon_.reset();
+  start();
 }
 
 void VirtualDevice::await(const PendingAnswer& answer) {

@@ -82,6 +82,9 @@ class VirtualDevice {
   /// stay. All clients are gone, and their references with them.
   void killDaemon();
 
+  /// Kills the daemon where it stands and starts another on the same device.
+  void restart();
+
   platform::simulated::SimulatedPlatform platform;
   platform::simulated::SimulatedLog log;
   platform::simulated::ScriptedService& service = platform.httpSessions().service();
