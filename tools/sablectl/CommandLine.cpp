@@ -181,6 +181,7 @@ void addQuestions(CLI::App& app, Invocation& invocation) {
       });
   addText(command, "ID", resource->identifier, "The resource's identifier");
   command.add_option("--save", resource->save, "Write the file's content there")->type_name("F");
+  add(app, invocation, "resources", "List the resource files, and when they are fetched", runResources);
 
   const auto openMetrics = std::make_shared<bool>(false);
   add(app, invocation, "counters", "Show the daemon's counters", [openMetrics](const Context& context) {

@@ -32,6 +32,8 @@ ExitCode runSessions(const Context& context);
 ExitCode runFeedback(const Context& context);
 ExitCode runResource(const Context& context, const std::string& identifier,
                      const std::optional<std::filesystem::path>& save);
+/// The resources that the bag asks for: what is there of each, and what is planned.
+ExitCode runResources(const Context& context);
 
 struct FeedbackReport {
   std::string className;

@@ -1,8 +1,6 @@
 #include <fmt/format.h>
-#include <unistd.h>
 
 #include <algorithm>
-#include <fstream>
 #include <nlohmann/json.hpp>
 
 #include "SableKit/SBLBag.h"
@@ -40,21 +38,6 @@ void printBag(const Output& output, const Dictionary& raw, const std::string& us
   for (const std::string& problem : bag.problems()) complain("bag: " + problem);
 }
 
-Expected<std::uint64_t> copyFile(int descriptor, const std::optional<std::filesystem::path>& save) {
-  std::ofstream file;
-  if (save) file.open(*save, std::ios::binary | std::ios::trunc);
-  if (save && !file) return tl::unexpected(posixError(errno, save->string()));
-  std::uint64_t size = 0;
-  char bytes[65536];
-  for (ssize_t count; (count = pread(descriptor, bytes, sizeof bytes, static_cast<off_t>(size))) != 0;) {
-    if (count < 0) return tl::unexpected(posixError(errno, "read"));
-    size += static_cast<std::uint64_t>(count);
-    if (save) file.write(bytes, count);
-  }
-  if (save && !file.flush()) return tl::unexpected(posixError(EIO, save->string()));
-  return size;
-}
-
 }  // namespace
 
 ExitCode runBag(const Context& context) {
@@ -81,35 +64,6 @@ ExitCode runSessions(const Context& context) {
       context.output.document(sessions);
     } else {
       for (const std::string& line : tableLines(sessions)) context.output.line(line);
-    }
-    return kExitSuccess;
-  });
-}
-
-ExitCode runResource(const Context& context, const std::string& identifier,
-                     const std::optional<std::filesystem::path>& save) {
-  return withSession(context, [&](Session& session) {
-    const auto result =
-        session.call(kSBLDaemonRelay, SBLDaemonRelay::fileHandleAndAttributesForResource, {identifier});
-    if (!result) return fail(context, result.error());
-    if (const auto error = decodeError(std::get<RelayRecord>((*result)[2]))) return fail(context, *error);
-    const auto& file = std::get<platform::RelayFile>((*result)[0]);
-    if (file.descriptor == nullptr)
-      return fail(context, makeSBLError(SBLErrorCode::daemonSide, "no file for " + identifier));
-    const auto size = copyFile(*file.descriptor, save);
-    if (!size) return fail(context, size.error());
-
-    Dictionary document;
-    document["identifier"] = identifier;
-    document["bytes"] = *size;
-    if (save) document["saved"] = save->string();
-    document["attributes"] = recordDocument(std::get<RelayRecord>((*result)[1]));
-    if (context.output.json) {
-      context.output.document(document);
-    } else {
-      std::vector<std::vector<std::string>> rows;
-      flatten("", document, rows);
-      for (const std::string& line : aligned(rows)) context.output.line(line);
     }
     return kExitSuccess;
   });
