@@ -126,6 +126,8 @@ void VirtualDevice::killDaemon() {
   platform.runtime().dropWork();
   daemon_.reset();
   platform.runtime().dropWork();
+}
+
 void VirtualDevice::restart() {
   clients_.clear();
   run();

@@ -28,7 +28,6 @@ std::string cut(std::string_view text, std::size_t width);
 std::string padded(std::string_view text, std::size_t width);
 
 /// "3 h 59 min", "12 s": the two largest units of that many seconds, without a sign.
-/// "3 h 59 min", "12 s": the two largest units; of whatever sign.
 std::string duration(std::int64_t seconds);
 
 /// The text's code points, each as UTF-8; marks that combine stay with what they stand on.
