@@ -7,6 +7,7 @@
 #include "platform/ProgrammingError.h"
 #include "platform/Tally.h"
 #include "platform/UserDefaults.h"
+#include "sabled/AppWhitelistController.h"
 #include "sabled/BackgroundFlusher.h"
 #include "sabled/ClientSessionManager.h"
 #include "sabled/ClientStateManager.h"

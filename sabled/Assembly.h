@@ -13,6 +13,7 @@ class HTTPSession;
 
 namespace sable {
 
+class AppWhitelistController;
 class BackgroundFlusher;
 class ClientSessionManager;
 class ClientStateManager;
@@ -60,6 +61,7 @@ class Assembly {
   std::unique_ptr<Lookup> lookup;
   std::unique_ptr<SableBagController> bagController;
   std::unique_ptr<ClientStateManager> clientStateManager;
+  std::unique_ptr<AppWhitelistController> appWhitelistController;
 
   /// Whether the bag is mirrored to disk. Deliberately no setting.
   bool diskBagCacheEnabled() const { return true; }

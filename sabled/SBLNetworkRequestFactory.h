@@ -130,7 +130,6 @@ class SBLNetworkRequestFactory {
     std::optional<std::string> geoClientMetadata;
     std::string storeFrontIdentifier;
     std::optional<std::string> subscriptionInfo;
-    std::optional<std::string> appWhitelistSignature;
     bool isManagedAccount = false;
     bool deviceRestricted = false;
     bool hadBag = false;

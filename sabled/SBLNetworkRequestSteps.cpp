@@ -6,6 +6,7 @@
 #include "platform/LanguageTagger.h"
 #include "platform/LocaleInfo.h"
 #include "platform/ManagedConfiguration.h"
+#include "sabled/AppWhitelistController.h"
 #include "sabled/Assembly.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SableLogging.h"
@@ -211,9 +212,9 @@ void SBLNetworkRequestFactory::_addHttpRequestSubscriptionInfo(Builder& builder)
 
 void SBLNetworkRequestFactory::_addHttpAppWhitelistSignature(Builder& builder) const {
   beginStep(builder, __func__);
-  if (context_.appWhitelistSignature) {
-    builder.defaultHttpHeaderWithName("X-Kestrel-Whitelisted-App-Signature", *context_.appWhitelistSignature);
-  }
+  if (assembly_.appWhitelistController == nullptr) return;
+  const auto signature = assembly_.appWhitelistController->whitelistSignature();
+  if (signature) addHeaderIfPresent(builder, "X-Kestrel-Whitelisted-App-Signature", *signature);
 }
 
 void SBLNetworkRequestFactory::_addHttpRequestTopTopics(Builder& builder,

@@ -9,6 +9,7 @@
 #include "platform/Tally.h"
 #include "platform/UserDefaults.h"
 #include "sabled/BackgroundActivitiesManager.h"
+#include "sabled/AppWhitelistController.h"
 #include "sabled/ClientStateManager.h"
 #include "sabled/DownloadManager.h"
 #include "sabled/ImageFetcher.h"
@@ -69,6 +70,7 @@ void SableDaemon::createServices() {
   assembly_.lookup = std::make_unique<Lookup>(assembly_);
   assembly_.bagController = std::make_unique<SableBagController>(assembly_);
   assembly_.clientStateManager = std::make_unique<ClientStateManager>(assembly_);
+  assembly_.appWhitelistController = std::make_unique<AppWhitelistController>(assembly_);
   service_ = std::make_unique<SableService>(assembly_);
 }
 

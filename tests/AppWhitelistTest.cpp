@@ -5,13 +5,16 @@
 
 #include "platform/simulated/SimulatedPlatform.h"
 #include "sabled/AppWhitelist.h"
+#include "sabled/DownloadManager.h"
 #include "sabled/RunLengthCode.h"
+#include "sabled/SableBagController.h"
 #include "tests/support/VirtualDevice.h"
 
 namespace sable::test {
 namespace {
 
 using platform::InstalledApplication;
+using platform::simulated::SimulatedApplicationRegistry;
 using Bytes = std::vector<std::uint8_t>;
 
 constexpr std::string_view kNone = "none";
@@ -132,6 +135,117 @@ TEST(AppWhitelist, AMalformedListMakesNone) {
        }) {
     EXPECT_EQ(signatureOf(list, {"1"}), kNone) << list.substr(0, 100);
   }
+}
+
+constexpr std::string_view kHeader = "X-Kestrel-Whitelisted-App-Signature";
+constexpr const char* kOneAndThree = "5eL6fgobAAGaD9qqUA==";
+constexpr const char* kThree = "iPMT1wobAAGpG9apEA==";
+
+struct AppWhitelistControllerTest : testing::Test {
+  VirtualDevice device;
+
+  SimulatedApplicationRegistry& applications() { return device.platform.applicationRegistry(); }
+  std::size_t generations() { return device.platform.transactions().openedCount("appWhitelist"); }
+  std::optional<std::string> saved() {
+    return device.platform.userDefaults().string("SBLAppWhitelistSignature");
+  }
+  /// The service offers this list, and the device downloads it.
+  void publish(const std::string& list) {
+    device.service.on("/resources", answering(list));
+    device.bag["version"] = std::to_string(++version_);
+    device.bag["download_resources_list"] = {"installed_app_whitelist"};
+    device.bag["installed_app_whitelist"] =
+        fmt::format("https://service.test/resources/apps?version={}", version_);
+    device.assembly().bagController->forceFetchBag({{"bag", version_}});
+    device.advance(70s);
+  }
+  /// The signature that a request of `Request` carries now.
+  template <class Request = SBLSearchRequest>
+  std::string sent(const char* path = "/search", std::string agent = "Beacon/1") {
+    Request request;
+    request.queryId = ++queryId_;
+    if constexpr (requires { request.queryString; }) request.queryString = "q" + std::to_string(queryId_);
+    if constexpr (requires { request.cardURL; }) request.cardURL = "https://service.test/card";
+    device.service.forgetRequests();
+    device.client("com.kestrel." + agent.substr(0, 4), agent).ask(request);
+    const auto requests = device.service.requests(path);
+    if (requests.size() != 1) return "no single request";
+    const std::string* signature = requests.front().request.headers.find(kHeader);
+    return signature == nullptr ? "" : *signature;
+  }
+
+ private:
+  std::uint64_t queryId_ = 0;
+  int version_ = 1;
+};
+
+TEST_F(AppWhitelistControllerTest, AListThatArrivesMakesASignatureForRequests) {
+  applications().change({{"1", "1.0"}, {"3", "2.0"}});
+  device.start();
+  EXPECT_EQ(generations(), 1u) << "none was saved";
+  EXPECT_EQ(applications().enumerations(), 0) << "without a list nobody asks what is installed";
+  EXPECT_EQ(sent(), "");
+  EXPECT_EQ(saved(), std::nullopt);
+
+  publish(whitelist({"1", "3", "700"}));
+  EXPECT_EQ(generations(), 2u);
+  EXPECT_EQ(device.platform.transactions().openCount("appWhitelist"), 0u);
+  EXPECT_EQ(saved(), kOneAndThree);
+  EXPECT_EQ(sent(), kOneAndThree);
+  EXPECT_EQ(sent<SBLLookupRequest>(), kOneAndThree);
+  EXPECT_EQ(sent<SBLCardRequest>("/card"), kOneAndThree);
+  EXPECT_EQ(sent<SBLZeroKeywordRequest>(), "");
+  EXPECT_EQ(sent("/search", "messages/1"), "") << "it tells nothing of where and what the device is";
+  for (const char* line : {"generating app whitelist", "error reading app whitelist POSIXErrorDomain 2",
+                           "installed app signature: 5eL6fgobAAGaD9qqUA=="}) {
+    EXPECT_TRUE(device.log.contains(line)) << line;
+  }
+
+  device.assembly().notificationCenter.post(
+      {kSBLFileDownloadCompletedNotification, nullptr, {{"identifier", std::string("lookup_hints_weekly")}}});
+  device.run();
+  EXPECT_EQ(generations(), 2u) << "another file";
+
+  publish("[\"org.example.Mail\"]");
+  EXPECT_EQ(saved(), std::nullopt);
+  EXPECT_EQ(sent(), "");
+  EXPECT_EQ(device.log.count(platform::LogLevel::error, "Sable"), 1u) << "that there is no list yet is none";
+}
+
+TEST_F(AppWhitelistControllerTest, ABurstOfChangesIsTakenIn60SecondsAfterTheLast) {
+  device.start();
+  publish(whitelist({"1", "3"}));
+  applications().change({{"3", "1.0"}});
+  device.advance(61s);
+  ASSERT_EQ(sent(), kThree);
+  const std::size_t before = generations();
+  for (int i = 0; i < 5; ++i) {
+    applications().change({{"1", "1.0"}, {"3", "1.0"}});
+    device.advance(40s);
+    EXPECT_EQ(sent(), kThree);
+  }
+  device.advance(19s);
+  EXPECT_EQ(sent(), kThree);
+  EXPECT_EQ(generations(), before);
+  device.advance(2s);
+  EXPECT_EQ(sent(), kOneAndThree);
+  device.advance(24h);
+  EXPECT_EQ(generations(), before + 1);
+
+  applications().change({});
+  device.advance(61s);
+  EXPECT_EQ(sent(), "");
+  EXPECT_EQ(saved(), std::nullopt);
+}
+
+TEST_F(AppWhitelistControllerTest, ASavedSignatureSurvivesARestart) {
+  applications().change({{"1", "1.0"}, {"3", "1.0"}});
+  device.platform.userDefaults().set("SBLAppWhitelistSignature", kThree);
+  device.start();
+  EXPECT_EQ(generations(), 0u);
+  EXPECT_EQ(sent(), kThree) << "until something changes";
+  publish(whitelist({"1", "3"}));
+  EXPECT_EQ(sent(), kOneAndThree);
 }
 
 TEST(RunLengthCode, ShorterRunsReplaceTheBitmap) {

@@ -13,6 +13,7 @@ namespace {
 using enum ValueType;
 
 constexpr std::array kSettings{
+    KnownKey{"SBLAppWhitelistSignature", string},
     KnownKey{"SBLBagURL", string},
     KnownKey{"SBLDebugParameters", string},
     KnownKey{"SBLDefaultBagURL", string},
