@@ -107,12 +107,4 @@ std::vector<std::string> characters(std::string_view text) {
   return result;
 }
 
-std::string duration(std::int64_t seconds) {
-  const std::int64_t whole = std::abs(seconds);
-  if (whole >= 86400) return fmt::format("{} d {} h", whole / 86400, whole % 86400 / 3600);
-  if (whole >= 3600) return fmt::format("{} h {} min", whole / 3600, whole % 3600 / 60);
-  if (whole >= 60) return fmt::format("{} min {} s", whole / 60, whole % 60);
-  return fmt::format("{} s", whole);
-}
-
 }  // namespace sable::sablectl
