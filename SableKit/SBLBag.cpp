@@ -41,7 +41,7 @@ std::optional<double> nonNegative(const Dictionary& value) {
   return std::isfinite(number) && number >= 0 ? std::optional(number) : std::nullopt;
 }
 
-std::optional<std::vector<std::string>> strings(const Dictionary& value) {
+SBLBag::Strings strings(const Dictionary& value) {
   if (!value.is_array()) return std::nullopt;
   std::vector<std::string> result;
   for (const Dictionary& item : value) {
@@ -68,7 +68,9 @@ SBLBag::SBLBag(std::shared_ptr<const Dictionary> dictionary, std::string userAge
       searchRenderTimeout_(read("search_render_timeout", 2.0)),
       sendGeoEnvironmentHeader_(read("send_geo_environment_header", false)),
       supportedGeoLocationSources_(readSet("geo_location_sources")),
-      subscriptionTTL_(read("subscription_ttl", 0.0)) {
+      subscriptionTTL_(read("subscription_ttl", 0.0)),
+      domainWhitelist_(readStrings("subscription_provider_domains")),
+      bundleIdentifierWhitelist_(readStrings("subscription_provider_bundle_identifiers")) {
   if (const Dictionary* bramble = value("bramble"); bramble != nullptr && !bramble->is_object()) {
     reportWrongType("bramble", "an object");
   }
@@ -118,30 +120,22 @@ std::optional<std::string> SBLBag::readURL(std::string_view key) {
   return std::nullopt;
 }
 
-std::set<std::string> SBLBag::readSet(std::string_view key) {
+SBLBag::Strings SBLBag::readStrings(std::string_view key) {
   const Dictionary* found = value(key);
-  if (found == nullptr) return {};
-  const auto items = strings(*found);
-  if (!items) {
-    reportWrongType(key, "an array");
-    return {};
-  }
-  return {items->begin(), items->end()};
+  if (found == nullptr) return std::nullopt;
+  auto items = strings(*found);
+  if (!items) reportWrongType(key, "an array");
+  return items;
+}
+
+std::set<std::string> SBLBag::readSet(std::string_view key) {
+  const auto items = readStrings(key).value_or(std::vector<std::string>());
+  return {items.begin(), items.end()};
 }
 
 Dictionary SBLBag::brambleConfiguration() const {
   const Dictionary* found = value("bramble");
   return found != nullptr && found->is_object() ? *found : Dictionary(nullptr);
-}
-
-std::optional<std::vector<std::string>> SBLBag::subscriptionProviderDomains() const {
-  const Dictionary* found = value("subscription_provider_domains");
-  return found == nullptr ? std::nullopt : strings(*found);
-}
-
-std::optional<std::vector<std::string>> SBLBag::subscriptionProviderBundleIdentifiers() const {
-  const Dictionary* found = value("subscription_provider_bundle_identifiers");
-  return found == nullptr ? std::nullopt : strings(*found);
 }
 
 std::optional<std::string> SBLBag::urlForIdentifier(std::string_view identifier) const {

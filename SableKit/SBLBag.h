@@ -24,6 +24,8 @@ class SBLBag {
  public:
   SBLBag(std::shared_ptr<const Dictionary> dictionary, std::string userAgent);
 
+  using Strings = std::optional<std::vector<std::string>>;
+
   const std::shared_ptr<const Dictionary>& rawBag() const { return rawBag_; }
   const std::string& userAgent() const { return userAgent_; }
 
@@ -42,8 +44,9 @@ class SBLBag {
   double subscriptionTTL() const { return subscriptionTTL_; }  ///< seconds
   /// {"proxy": URL, "enabled": bool}, or null when the bag has none.
   Dictionary brambleConfiguration() const;
-  std::optional<std::vector<std::string>> subscriptionProviderDomains() const;
-  std::optional<std::vector<std::string>> subscriptionProviderBundleIdentifiers() const;
+  // Whose subscriptions may be told to the service, by web domain and by application.
+  const Strings& subscriptionProviderDomainWhitelist() const { return domainWhitelist_; }
+  const Strings& subscriptionProviderBundleIdentifierWhitelist() const { return bundleIdentifierWhitelist_; }
   /// The image that the service calls `identifier`.
   std::optional<std::string> urlForIdentifier(std::string_view identifier) const;
 
@@ -56,6 +59,7 @@ class SBLBag {
   T read(std::string_view key, T absent);
   std::string readVersion();
   std::optional<std::string> readURL(std::string_view key);
+  Strings readStrings(std::string_view key);
   std::set<std::string> readSet(std::string_view key);
   void reportWrongType(std::string_view key, std::string_view wanted);
 
@@ -74,6 +78,7 @@ class SBLBag {
   bool sendGeoEnvironmentHeader_;
   std::set<std::string> supportedGeoLocationSources_;
   double subscriptionTTL_;
+  Strings domainWhitelist_, bundleIdentifierWhitelist_;
 };
 
 }  // namespace sable

@@ -25,6 +25,7 @@ class NotificationCenter;
 class Notify;
 class Relay;
 class Runtime;
+class SubscriptionRegistry;
 class Tally;
 class Transactions;
 class UserActivity;
@@ -61,6 +62,7 @@ class Platform {
   virtual LanguageTagger& languageTagger() = 0;
   virtual NetworkServiceProxy& networkServiceProxy() = 0;
   virtual UserActivity& userActivity() = 0;
+  virtual SubscriptionRegistry& subscriptionRegistry() = 0;
 
   /// What the host offers and lacks.
   virtual std::vector<Availability> availability() = 0;

@@ -19,6 +19,7 @@
 #include "sabled/SableFeedbackFlusher.h"
 #include "sabled/SableFlusherRelay.h"
 #include "sabled/SablePersistentStorage.h"
+#include "sabled/SableSubscriptionManager.h"
 #include "sabled/SableUserGUIDController.h"
 
 namespace sable {

@@ -25,6 +25,7 @@ class SableBagController;
 class SableFeedbackFlusher;
 class SableFlusherRelay;
 class SablePersistentStorage;
+class SableSubscriptionManager;
 class SableUserGUIDController;
 
 /// Holds every long-lived service and setting of the daemon. Services are made in the order of
@@ -50,6 +51,7 @@ class Assembly {
   // Destroyed in reverse order: what is built on others goes first.
   std::unique_ptr<SBLNetworkRequestFactory> requestFactory;
   std::unique_ptr<DownloadManager> downloadManager;
+  std::unique_ptr<SableSubscriptionManager> subscriptionManager;
   std::unique_ptr<SablePersistentStorage> persistentStorage;
   std::unique_ptr<SableFeedbackFlusher> crowdsourcingFeedbackFlusher;
   std::unique_ptr<BackgroundFlusher> backgroundFlusher;

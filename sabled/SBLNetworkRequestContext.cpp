@@ -65,7 +65,6 @@ SBLNetworkRequestFactory::SBLNetworkRequestFactory(Assembly& assembly)
   _updateTimeZoneName();
   _updateDeviceRestrictions();
   _updateIsManagedAccount();
-  _updateStoreFrontIdentifier();
   _updateMapsClientMetadata();
   _setupDebuggingQueryItems();
   observeContextChanges();
@@ -82,10 +81,7 @@ void SBLNetworkRequestFactory::observeContextChanges() {
   on(platform::kCountryCodeDidChangeNotification, [this] { _updateDeviceCountryCode(true); });
   on(platform::kSystemTimeZoneDidChangeNotification, [this] { _updateTimeZoneName(); });
   on(platform::kEffectiveSettingsDidChangeNotification, [this] { _updateDeviceRestrictions(); });
-  on(platform::kAccountStoreDidChangeNotification, [this] {
-    _updateIsManagedAccount();
-    _updateStoreFrontIdentifier();
-  });
+  on(platform::kAccountStoreDidChangeNotification, [this] { _updateIsManagedAccount(); });
   on(platform::kMapsServiceDidChangeNotification, [this] { _updateMapsClientMetadata(); });
   observations_.push_back(assembly_.notificationCenter.observe(
       std::string(kSBLBagChangeNotification), [this](const platform::Notification& notification) {
@@ -153,29 +149,25 @@ void SBLNetworkRequestFactory::_updateIsManagedAccount() {
   });
 }
 
-void SBLNetworkRequestFactory::_updateStoreFrontIdentifier() {
-  contextAccessQueue_->async([this] {
-    context_.storeFrontIdentifier = assembly_.platform.accountStore().storeFrontIdentifier().value_or("");
-  });
-}
-
 void SBLNetworkRequestFactory::_updateMapsClientMetadata() {
   contextAccessQueue_->async(
       [this] { context_.geoClientMetadata = assembly_.platform.mapsService().clientMetadata(); });
 }
 
-void SBLNetworkRequestFactory::setSubscriptionInfo(std::optional<std::string> json) {
-  contextAccessQueue_->async([this, json = std::move(json)] {
-    context_.subscriptionInfo.reset();
-    if (!json) return;
-    // Written anew, so that a header holds one line of it.
-    const auto list = parseJSON(*json, kMaximumSubscriptionBytes);
-    if (list && list->is_array()) {
-      context_.subscriptionInfo = compactJSON(*list);
-    } else {
-      log().error("subscriptions are not told: {}", list ? "no array" : list.error().reason);
-    }
-  });
+void SBLNetworkRequestFactory::didUpdateSubscriptionDictionaries(const SableSubscriptionManager&,
+                                                                 const Dictionary& subscriptions) {
+  std::optional<std::string> json;
+  if (!subscriptions.empty()) json = compactJSON(subscriptions);
+  if (json && json->size() > kMaximumSubscriptionBytes) {
+    log().error("{} bytes of subscriptions are not told", json->size());
+    json.reset();
+  }
+  contextAccessQueue_->async([this, json = std::move(json)] { context_.subscriptionInfo = json; });
+}
+
+void SBLNetworkRequestFactory::didUpdateStorefrontIdentifier(const SableSubscriptionManager&,
+                                                             const std::string& identifier) {
+  contextAccessQueue_->async([this, identifier] { context_.storeFrontIdentifier = identifier; });
 }
 
 void SBLNetworkRequestFactory::_setupDebuggingQueryItems() {

@@ -16,6 +16,7 @@
 #include "platform/URL.h"
 #include "platform/UUID.h"
 #include "sabled/CoarseLocation.h"
+#include "sabled/SableSubscriptionManager.h"
 
 namespace sable {
 
@@ -48,10 +49,10 @@ inline constexpr unsigned kSBLFieldMaskNoLocation = 1;
 /// of the device (locale, location, country, time zone, restrictions), which it keeps current. Any
 /// thread: each entry point builds synchronously on the context queue, so that one request sees one
 /// context. docs/service.md lists every item and header.
-class SBLNetworkRequestFactory {
+class SBLNetworkRequestFactory final : public SableSubscriptionManagerDelegate {
  public:
   explicit SBLNetworkRequestFactory(Assembly& assembly);
-  ~SBLNetworkRequestFactory();
+  ~SBLNetworkRequestFactory() override;
 
   platform::HTTPRequest warmRequest(std::string_view url);
   platform::HTTPRequest bagFetchRequest(const SableBagController& bagController, std::string_view userAgent,
@@ -89,9 +90,11 @@ class SBLNetworkRequestFactory {
   /// A search was sent: downloads for lookups may from now on tell where the device is now.
   void setPerformedSearch();
 
-  /// What requests say about the user's video subscriptions: a JSON array, or nothing. Text that is
-  /// no JSON array counts as nothing.
-  void setSubscriptionInfo(std::optional<std::string> json);
+  /// An empty list is not told to the service, nor is one of more than 64 KiB.
+  void didUpdateSubscriptionDictionaries(const SableSubscriptionManager& manager,
+                                         const Dictionary& subscriptions) override;
+  void didUpdateStorefrontIdentifier(const SableSubscriptionManager& manager,
+                                     const std::string& identifier) override;
 
  private:
   using Builder = SableURLRequestBuilder;
@@ -191,7 +194,6 @@ class SBLNetworkRequestFactory {
   void _updateTimeZoneName();
   void _updateDeviceRestrictions();
   void _updateIsManagedAccount();
-  void _updateStoreFrontIdentifier();
   void _updateMapsClientMetadata();
   void _setupDebuggingQueryItems();
   void _notifyBagRefreshRequired();

@@ -3,6 +3,7 @@
 #include <map>
 #include <memory>
 
+#include "platform/SubscriptionRegistry.h"
 #include "platform/host/FactFacilities.h"
 #include "platform/host/HostDeviceInfo.h"
 #include "platform/host/HostLocaleInfo.h"
@@ -36,7 +37,8 @@ struct FactsTest : testing::Test {
   void SetUp() override {
     for (const auto name : {kCurrentLocaleDidChangeNotification, kSystemTimeZoneDidChangeNotification,
                             kCountryCodeDidChangeNotification, kEffectiveSettingsDidChangeNotification,
-                            kAccountStoreDidChangeNotification}) {
+                            kAccountStoreDidChangeNotification, kMusicSubscriptionStatusDidChangeNotification,
+                            kStoreFrontDidChangeNotification, kSubscriptionRegistryDidUpdateNotification}) {
       tokens.push_back(center.observe(std::string(name), [this](const Notification& notification) {
         posted.emplace_back(notification.name);
       }));
@@ -75,6 +77,13 @@ TEST_F(FactsTest, AChangeIsPostedForTheFacilitiesItChangesOnly) {
   EXPECT_EQ(change("managed_account = true # still"), Names{});
   EXPECT_EQ(change("managed_account = true\ndiagnostics_allowed = true"),
             Names{"EffectiveSettingsDidChange"});
+  EXPECT_EQ(change("managed_account = true\ndiagnostics_allowed = true\nmusic_subscription_status = 3"),
+            Names{"MusicSubscriptionStatusDidChange"});
+  EXPECT_EQ(
+      change("managed_account = true\ndiagnostics_allowed = true\nstorefront = \"1\"\n[[subscriptions]]\n"
+             "provider = \"a\"\nmodified = 2026-01-01"),
+      (Names{"MusicSubscriptionStatusDidChange", "StoreFrontDidChange", "SubscriptionRegistryDidUpdate"}));
+  change("managed_account = true\ndiagnostics_allowed = true");
   EXPECT_EQ(change("country_code = \"DE\""), (Names{"EffectiveSettingsDidChange", "AccountStoreDidChange"}));
   EXPECT_EQ(change("locale = \"de_AT\""), (Names{"CurrentLocaleDidChange", "CountryCodeDidChange"}));
   EXPECT_EQ(change("locale = \"de_AT\"\nhour_cycle_24 = false"), Names{"CurrentLocaleDidChange"});

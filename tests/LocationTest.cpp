@@ -294,7 +294,7 @@ TEST_F(Context, TheBagTellsWhichClientsItServesInSettings) {
   EXPECT_EQ(visible("SBLHashtagImagesVisible"), false);
 }
 
-TEST_F(Context, SubscriptionsAndTheMapsSessionAreInHeaders) {
+TEST_F(Context, TheMapsSessionIsInHeaders) {
   device.platform.mapsService().sessions = {{"id-1", "entity-1"}, {"id-2", "entity-2"}};
   device.start();
   SBLNetworkRequestFactory& factory = *device.assembly().requestFactory;
@@ -304,13 +304,6 @@ TEST_F(Context, SubscriptionsAndTheMapsSessionAreInHeaders) {
     const std::string* found = sent.back().request.headers.find(name);
     return found == nullptr ? "-" : *found;
   };
-  factory.setSubscriptionInfo("[ {\"a\": 1},\r\n \"b\" ]");
-  EXPECT_EQ(header("X-Kestrel-Subscriptions"), R"([{"a":1},"b"])");
-  for (const auto& nothing : {std::optional<std::string>(), {"{}"}, {"[1"}}) {
-    factory.setSubscriptionInfo("[]");
-    factory.setSubscriptionInfo(nothing);
-    EXPECT_EQ(header("X-Kestrel-Subscriptions"), "-");
-  }
   EXPECT_EQ(header("X-Kestrel-GeoSession"), "id-1");
   EXPECT_EQ(factory.getMapsUserSessionEntityAndReset(true)->entityString, "entity-2");
   EXPECT_EQ(header("X-Kestrel-GeoSession"), "id-2");

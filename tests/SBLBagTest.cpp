@@ -24,7 +24,7 @@ TEST(SBLBag, AnEmptyBagHasTheAbsentValues) {
   EXPECT_TRUE(empty.supportedGeoLocationSources().empty());
   EXPECT_TRUE(empty.brambleConfiguration().is_null());
   EXPECT_FALSE(empty.urlForIdentifier("logo"));
-  EXPECT_FALSE(empty.subscriptionProviderDomains());
+  EXPECT_FALSE(empty.subscriptionProviderDomainWhitelist());
   EXPECT_TRUE(empty.problems().empty());
 }
 
@@ -47,13 +47,13 @@ TEST(SBLBag, AnAgentsOwnValueHoldsInsteadOfTheTopLevelOne) {
 TEST(SBLBag, AValueOfTheWrongTypeCountsAsAbsentAndIsReportedOnce) {
   const SBLBag wrong =
       bag(R"({"enabled": "yes", "search_url": "no url", "warm_url": 7, "minimum_query_length": -1,
-      "request_timeout": "15", "geo_location_sources": "gps", "bramble": [], "unknown_key": 1})");
+      "request_timeout": "15", "geo_location_sources": "gps", "bramble": [], "subscription_provider_domains": "a", "unknown_key": 1})");
   EXPECT_FALSE(wrong.isEnabled());
   EXPECT_FALSE(wrong.searchURL());
   EXPECT_EQ(wrong.minimumQueryLength(), 1u);
   EXPECT_EQ(wrong.timeoutIntervalForRequest(), 15);
   EXPECT_TRUE(wrong.brambleConfiguration().is_null());
-  EXPECT_EQ(wrong.problems().size(), 7u);
+  EXPECT_EQ(wrong.problems().size(), 8u);
 }
 
 TEST(SBLBag, ListsAndImagesAreRead) {
@@ -62,7 +62,7 @@ TEST(SBLBag, ListsAndImagesAreRead) {
       "subscription_provider_domains": ["video.example"]})");
   EXPECT_EQ(full.supportedGeoLocationSources(), (std::set<std::string>{"gps", "wifi"}));
   EXPECT_EQ(full.urlForIdentifier("logo"), "http://i.example/l");
-  EXPECT_EQ(full.subscriptionProviderDomains(), std::vector<std::string>{"video.example"});
+  EXPECT_EQ(full.subscriptionProviderDomainWhitelist(), std::vector<std::string>{"video.example"});
 }
 
 }  // namespace

@@ -35,6 +35,9 @@ constexpr std::array kSettings{
 /// Of the domain that the clients of lookups share.
 constexpr std::array kLookupSettings{KnownKey{"LookupSuggestionsDisabled", boolean}};
 
+/// Of a file that a provider drops.
+constexpr std::array kDroppedFacts{KnownKey{"subscriptions", subscriptions}};
+
 constexpr std::array kFacts{
     KnownKey{"product_type", string},
     KnownKey{"product_name", string},
@@ -64,7 +67,7 @@ constexpr std::array kFacts{
     KnownKey{"metered", boolean},
     KnownKey{"memory_pressure_file", string},
     KnownKey{"location", location},
-    KnownKey{"subscriptions", tables},
+    KnownKey{"subscriptions", subscriptions},
     KnownKey{"applications", tables},
 };
 
@@ -100,6 +103,17 @@ bool isLocation(const Dictionary& value) {
   });
 }
 
+bool isSubscription(const Dictionary& value) {
+  if (!value.is_object()) return false;
+  const auto items = value.items();
+  const bool areRight = std::all_of(items.begin(), items.end(), [](const auto& member) {
+    const std::string& name = member.key();
+    if (name == "modified") return member.value().is_number();
+    return (name == "provider" || name == "domain" || name == "info") && member.value().is_string();
+  });
+  return areRight && value.contains("provider") && value.contains("modified");
+}
+
 bool allOf(const Dictionary& value, bool (Dictionary::*is)() const noexcept) {
   return value.is_array() &&
          std::all_of(value.begin(), value.end(), [is](const Dictionary& element) { return (element.*is)(); });
@@ -129,6 +143,8 @@ std::string_view typeName(ValueType type) {
       return "a table of authorization, latitude, longitude, type and timestamp, rightly typed";
     case tables:
       return "an array of tables";
+    case subscriptions:
+      return "an array of tables of provider and modified, domain and info, rightly typed";
   }
   return "";
 }
@@ -156,6 +172,8 @@ bool hasType(const TOMLValue& entry, ValueType type) {
       return isLocation(value);
     case tables:
       return allOf(value, &Dictionary::is_object);
+    case subscriptions:
+      return value.is_array() && std::all_of(value.begin(), value.end(), isSubscription);
   }
   return false;
 }
@@ -179,6 +197,9 @@ std::vector<std::string> checkConfiguration(const Folders& folders) {
   checkFile(folders.sharedSettings("com.kestrel.lookup.shared"), kLookupSettings, problems);
   checkFile(folders.systemFacts, knownFacts(), problems);
   checkFile(folders.userFacts(), knownFacts(), problems);
+  for (const auto& folder : {folders.systemSubscriptions(), folders.userSubscriptions()}) {
+    for (const auto& path : tomlFilesIn(folder)) checkFile(path, kDroppedFacts, problems);
+  }
   return problems;
 }
 

@@ -10,7 +10,19 @@
 
 namespace sable::platform::host {
 
-enum class ValueType { boolean, integer, number, string, date, array, strings, table, tables, location };
+enum class ValueType {
+  boolean,
+  integer,
+  number,
+  string,
+  date,
+  array,
+  strings,
+  table,
+  tables,
+  location,
+  subscriptions
+};
 
 /// "a boolean", "an array of strings".
 std::string_view typeName(ValueType type);

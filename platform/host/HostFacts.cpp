@@ -1,18 +1,17 @@
 #include "platform/host/HostFacts.h"
 
-#include <array>
 #include <nlohmann/json.hpp>
+#include <vector>
 
 #include "platform/AccountStore.h"
 #include "platform/ApplicationRegistry.h"
 #include "platform/BackgroundTransfers.h"
 #include "platform/CountryConfiguration.h"
 #include "platform/LocaleInfo.h"
-#include "platform/Log.h"
 #include "platform/ManagedConfiguration.h"
 #include "platform/MapsService.h"
+#include "platform/SubscriptionRegistry.h"
 #include "platform/TimedActivityScheduler.h"
-#include "platform/host/ConfigurationSchema.h"
 #include "platform/host/LocaleNames.h"
 
 namespace sable::platform::host {
@@ -31,6 +30,8 @@ struct Subject {
 
 const std::array<Subject, 10>& subjects() {
   static const std::array<Subject, 10> all{
+const std::vector<Subject>& subjects() {
+  static const std::vector<Subject> all{
       Subject{kCurrentLocaleDidChangeNotification,
               {"calendar", "measurement_system", "temperature_unit", "preferred_languages", "system_language",
                "hour_cycle_24"},
@@ -40,8 +41,10 @@ const std::array<Subject, 10>& subjects() {
       Subject{
           kEffectiveSettingsDidChangeNotification,
           {"diagnostics_allowed", "bookstore_allowed", "media_store_allowed", "app_installation_allowed"}},
-      Subject{kAccountStoreDidChangeNotification,
-              {"managed_account", "music_subscription_status", "storefront"}},
+      Subject{kAccountStoreDidChangeNotification, {"managed_account"}},
+      Subject{kMusicSubscriptionStatusDidChangeNotification, {"music_subscription_status"}},
+      Subject{kStoreFrontDidChangeNotification, {"storefront"}},
+      Subject{kSubscriptionRegistryDidUpdateNotification, {"subscriptions"}},
       Subject{kMapsServiceDidChangeNotification, {"geo_session_id", "geo_environment", "geo_metadata"}},
       Subject{kLocationFactsDidChangeNotification, {"location"}},
       Subject{kPowerSourceDidChangeNotification, {"on_battery"}},
@@ -53,30 +56,12 @@ const std::array<Subject, 10>& subjects() {
 
 }  // namespace
 
-void HostFacts::Layer::reload() {
-  if (!file.reload()) return;
-  TOMLContent good = file.content();
-  for (const auto& [name, value] : file.content()) {
-    const KnownKey* key = findKey(knownFacts(), name);
-    if (key == nullptr || hasType(value, key->type)) continue;
-    platformLog().error("{}:{}:{}: {} is not {}; its last good value stays", file.path().native(), value.line,
-                        value.column, name, typeName(key->type));
-    const auto before = facts.find(name);
-    if (before == facts.end()) {
-      good.erase(name);
-    } else {
-      good.insert_or_assign(name, before->second);
-    }
-  }
-  facts = std::move(good);
-}
-
 HostFacts::HostFacts(const Folders& folders, HostSources sources, Reactor& reactor,
                      NotificationCenter& notificationCenter)
     : sources_(std::move(sources)),
       notificationCenter_(notificationCenter),
-      system_{TOMLFile(folders.systemFacts), {}},
-      user_{TOMLFile(folders.userFacts()), {}} {
+      system_(folders.systemFacts),
+      user_(folders.userFacts()) {
   watcher_ = std::make_unique<FileWatcher>(
       reactor,
       std::vector<std::filesystem::path>{folders.systemFacts, folders.userFacts(),
@@ -92,8 +77,8 @@ void HostFacts::reload() {
   system_.reload();
   user_.reload();
   Dictionary merged = Dictionary::object();
-  for (const Layer* layer : {&system_, &user_}) {
-    for (const auto& [name, value] : layer->facts) merged[name] = *value.value;
+  for (const FactsFile* layer : {&system_, &user_}) {
+    for (const auto& [name, value] : layer->facts()) merged[name] = *value.value;
   }
   {
     const std::lock_guard lock(mutex_);
@@ -107,7 +92,7 @@ void HostFacts::reload() {
 
 bool HostFacts::areReadable() {
   const std::lock_guard turn(reloading_);
-  return !system_.file.isDamaged() && !user_.file.isDamaged();
+  return !system_.isDamaged() && !user_.isDamaged();
 }
 
 std::vector<std::string> HostFacts::answers() const {

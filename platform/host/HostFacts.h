@@ -8,9 +8,9 @@
 #include <vector>
 
 #include "platform/NotificationCenter.h"
+#include "platform/host/FactsFile.h"
 #include "platform/host/FileWatcher.h"
 #include "platform/host/Folders.h"
-#include "platform/host/TOMLFile.h"
 
 namespace sable::platform::host {
 
@@ -54,13 +54,6 @@ class HostFacts {
   const HostSources& sources() const { return sources_; }
 
  private:
-  /// A facts file, cleansed of facts of the wrong type.
-  struct Layer {
-    TOMLFile file;
-    TOMLContent facts;
-    void reload();
-  };
-
   void reload();
   std::shared_ptr<const Dictionary> facts() const;
   std::shared_ptr<const Dictionary> find(std::string_view key, bool (Dictionary::*is)() const noexcept) const;
@@ -70,7 +63,7 @@ class HostFacts {
   NotificationCenter& notificationCenter_;
 
   std::mutex reloading_;
-  Layer system_, user_;
+  FactsFile system_, user_;
   std::vector<std::string> answers_;
 
   mutable std::mutex mutex_;

@@ -21,6 +21,7 @@
 #include "platform/host/HostProcess.h"
 #include "platform/host/HostRelay.h"
 #include "platform/host/HostRuntime.h"
+#include "platform/host/HostSubscriptionRegistry.h"
 #include "platform/host/HostTransactions.h"
 #include "platform/host/HostUserActivity.h"
 #include "platform/host/MappedTally.h"
@@ -90,6 +91,7 @@ struct HostPlatform::Facilities {
   Lazy<HostApplicationRegistry> applicationRegistry;
   Lazy<HostUserActivity> userActivity;
   Lazy<HostActivityScheduler> activityScheduler;
+  Lazy<HostSubscriptionRegistry> subscriptionRegistry;
 };
 
 HostHTTPSessions::Transfers HostPlatform::Facilities::transfers() {
@@ -213,6 +215,12 @@ UserActivity& HostPlatform::userActivity() {
   auto& facilities = *facilities_;
   return facilities.userActivity.get(facilities.runtime, facilities.settings(), facilities.fileManager,
                                      facilities.folders.interactions());
+}
+
+SubscriptionRegistry& HostPlatform::subscriptionRegistry() {
+  auto& facilities = *facilities_;
+  return facilities.subscriptionRegistry.get(facilities.folders, facilities.hostFacts(), facilities.runtime,
+                                             facilities.runtime.reactor(), facilities.notificationCenter);
 }
 
 std::vector<Availability> HostPlatform::availability() {

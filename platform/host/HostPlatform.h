@@ -47,6 +47,7 @@ class HostPlatform final : public Platform {
   LanguageTagger& languageTagger() override;
   NetworkServiceProxy& networkServiceProxy() override;
   UserActivity& userActivity() override;
+  SubscriptionRegistry& subscriptionRegistry() override;
 
   std::vector<Availability> availability() override;
 

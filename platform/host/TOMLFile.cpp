@@ -3,6 +3,7 @@
 #include <fmt/core.h>
 #include <toml++/toml.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <nlohmann/json.hpp>
 #include <sstream>
@@ -15,6 +16,7 @@ namespace sable::platform::host {
 namespace {
 
 constexpr std::size_t kMaximumBytes = 1u << 20;
+constexpr std::size_t kMaximumFiles = 256;
 
 WallTime wallTime(const toml::date& date, const toml::time& time, int offsetMinutes) {
   using namespace std::chrono;
@@ -148,6 +150,24 @@ Expected<std::string> readTOMLText(const std::filesystem::path& path, bool* exis
   if (exists != nullptr) *exists = true;
   if (!file) return tl::unexpected(file.error());
   return readWhole(*file, path, kMaximumBytes);
+}
+
+std::vector<std::filesystem::path> tomlFilesIn(const std::filesystem::path& folder) {
+  std::vector<std::filesystem::path> found;
+  std::error_code error;
+  for (std::filesystem::directory_iterator entry(folder, error), end; !error && entry != end;
+       entry.increment(error)) {
+    if (entry->path().extension() == ".toml") found.push_back(entry->path());
+  }
+  if (error && error != std::errc::no_such_file_or_directory) {
+    platformLog().error("{}: {}", folder.native(), error.message());
+  }
+  std::ranges::sort(found);
+  if (found.size() > kMaximumFiles) {
+    platformLog().error("{}: more than {} files, the last are left out", folder.native(), kMaximumFiles);
+    found.resize(kMaximumFiles);
+  }
+  return found;
 }
 
 void TOMLFile::report(std::string_view problem) const {

@@ -7,6 +7,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/Dictionary.h"
 #include "platform/Runtime.h"
@@ -35,6 +36,10 @@ std::string formatTOML(const TOMLContent& content);
 /// The text of a file that people write; "" when there is none, and whether it exists in `exists`.
 /// Links of this user or root are followed (dotfiles often are links).
 Expected<std::string> readTOMLText(const std::filesystem::path& path, bool* exists = nullptr);
+
+/// The files *.toml in a folder, in the order of their names: at most 256, more are reported and left
+/// out. None where there is no folder.
+std::vector<std::filesystem::path> tomlFilesIn(const std::filesystem::path& folder);
 
 /// A TOML file and its last good content. Not synchronised.
 class TOMLFile {

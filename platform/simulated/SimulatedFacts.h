@@ -144,8 +144,12 @@ class SimulatedAccountStore final : public AccountStore {
   explicit SimulatedAccountStore(NotificationCenter& center) : center_(center) {}
 
   void change(Values changed) {
-    values = std::move(changed);
-    center_.post({kAccountStoreDidChangeNotification, this, {}});
+    const Values before = std::exchange(values, std::move(changed));
+    if (values.managed != before.managed) center_.post({kAccountStoreDidChangeNotification, this, {}});
+    if (values.musicSubscriptionStatus != before.musicSubscriptionStatus)
+      center_.post({kMusicSubscriptionStatusDidChangeNotification, this, {}});
+    if (values.storeFrontIdentifier != before.storeFrontIdentifier)
+      center_.post({kStoreFrontDidChangeNotification, this, {}});
   }
   bool primaryAccountIsManaged() const override { return values.managed; }
   std::optional<int> musicSubscriptionStatus() const override { return values.musicSubscriptionStatus; }

@@ -14,6 +14,7 @@
 #include "platform/simulated/SimulatedProcess.h"
 #include "platform/simulated/SimulatedRelay.h"
 #include "platform/simulated/SimulatedRuntime.h"
+#include "platform/simulated/SimulatedSubscriptionRegistry.h"
 #include "platform/simulated/SimulatedTally.h"
 #include "platform/simulated/SimulatedTransactions.h"
 #include "platform/simulated/SimulatedUserActivity.h"
@@ -52,6 +53,7 @@ class SimulatedPlatform final : public Platform {
   ScriptLanguageTagger& languageTagger() override { return languageTagger_; }
   ConfiguredServiceProxy& networkServiceProxy() override { return networkServiceProxy_; }
   SimulatedUserActivity& userActivity() override { return userActivity_; }
+  SimulatedSubscriptionRegistry& subscriptionRegistry() override { return subscriptionRegistry_; }
 
   std::vector<Availability> availability() override { return {}; }
 
@@ -82,6 +84,7 @@ class SimulatedPlatform final : public Platform {
   SimulatedRelay relay_{runtime_};
   SimulatedHTTPSessions httpSessions_{runtime_, notificationCenter_, fileManager_};
   SimulatedActivityScheduler activityScheduler_{runtime_, notificationCenter_};
+  SimulatedSubscriptionRegistry subscriptionRegistry_{runtime_, notificationCenter_};
 };
 
 }  // namespace sable::platform::simulated
