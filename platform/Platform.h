@@ -10,6 +10,7 @@ class AccountStore;
 class ActivityScheduler;
 class ApplicationRegistry;
 class CountryConfiguration;
+class DataDetectors;
 class DeviceInfo;
 class FileManager;
 class HTTPSessions;
@@ -30,6 +31,7 @@ class Tally;
 class Transactions;
 class UserActivity;
 class UserDefaults;
+class WordTokenizer;
 
 /// The device under the daemon: one object per facility, made when first asked for (a facility
 /// that is never used costs nothing) and kept for the life of the platform. Any thread.
@@ -63,6 +65,8 @@ class Platform {
   virtual NetworkServiceProxy& networkServiceProxy() = 0;
   virtual UserActivity& userActivity() = 0;
   virtual SubscriptionRegistry& subscriptionRegistry() = 0;
+  virtual WordTokenizer& wordTokenizer() = 0;
+  virtual DataDetectors& dataDetectors() = 0;
 
   /// What the host offers and lacks.
   virtual std::vector<Availability> availability() = 0;

@@ -35,12 +35,13 @@ struct Folders {
   std::filesystem::path sharedSettings(std::string_view domain) const { return (config / domain) += ".toml"; }
   std::filesystem::path ownSettings() const { return state / "defaults.toml"; }
   std::filesystem::path userFacts() const { return config / "facts.toml"; }
-  // Folders of files that providers drop, one each.
-  std::filesystem::path systemSubscriptions() const { return systemFacts.parent_path() / "subscriptions.d"; }
-  std::filesystem::path userSubscriptions() const { return config / "subscriptions.d"; }
   std::filesystem::path counters() const { return state / "counters.tally"; }
   std::filesystem::path interactions() const { return state / "activity" / "interactions.jsonl"; }
   std::filesystem::path activityRuns() const { return state / "activity" / "runs.json"; }
+
+  std::filesystem::path hints() const { return state / "hints"; }  ///< a folder, as are these
+  std::filesystem::path systemSubscriptions() const { return systemFacts.parent_path() / "subscriptions.d"; }
+  std::filesystem::path userSubscriptions() const { return config / "subscriptions.d"; }
 
   /// Each folder is the first that is set of: its own variable (SABLED_RUNTIME_DIR, SABLED_CACHES_DIR,
   /// SABLED_STATE_DIR, SABLED_CONFIG_DIR; SABLED_PROFILE for the profile's file), the XDG variable

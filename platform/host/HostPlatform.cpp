@@ -4,8 +4,10 @@
 #include <optional>
 
 #include "platform/ConfiguredServiceProxy.h"
+#include "platform/ICUWordTokenizer.h"
 #include "platform/NotificationCenter.h"
 #include "platform/ScriptLanguageTagger.h"
+#include "platform/SpooledDataDetectors.h"
 #include "platform/host/FactFacilities.h"
 #include "platform/host/Folders.h"
 #include "platform/host/HostActivityScheduler.h"
@@ -72,6 +74,8 @@ struct HostPlatform::Facilities {
   NotificationCenter notificationCenter;
   ConfiguredServiceProxy networkServiceProxy;
   ScriptLanguageTagger languageTagger;
+  ICUWordTokenizer wordTokenizer;
+  SpooledDataDetectors dataDetectors{fileManager, folders.hints()};
   Lazy<MappedTally> tally;
   Lazy<TOMLUserDefaults> userDefaults;
   Lazy<HostNotify> notify;
@@ -221,6 +225,13 @@ SubscriptionRegistry& HostPlatform::subscriptionRegistry() {
   auto& facilities = *facilities_;
   return facilities.subscriptionRegistry.get(facilities.folders, facilities.hostFacts(), facilities.runtime,
                                              facilities.runtime.reactor(), facilities.notificationCenter);
+}
+
+WordTokenizer& HostPlatform::wordTokenizer() {
+  return facilities_->wordTokenizer;
+}
+DataDetectors& HostPlatform::dataDetectors() {
+  return facilities_->dataDetectors;
 }
 
 std::vector<Availability> HostPlatform::availability() {

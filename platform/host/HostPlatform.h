@@ -48,6 +48,8 @@ class HostPlatform final : public Platform {
   NetworkServiceProxy& networkServiceProxy() override;
   UserActivity& userActivity() override;
   SubscriptionRegistry& subscriptionRegistry() override;
+  WordTokenizer& wordTokenizer() override;
+  DataDetectors& dataDetectors() override;
 
   std::vector<Availability> availability() override;
 

@@ -1,9 +1,11 @@
 #pragma once
 
 #include "platform/ConfiguredServiceProxy.h"
+#include "platform/ICUWordTokenizer.h"
 #include "platform/NotificationCenter.h"
 #include "platform/Platform.h"
 #include "platform/ScriptLanguageTagger.h"
+#include "platform/SpooledDataDetectors.h"
 #include "platform/simulated/SimulatedActivityScheduler.h"
 #include "platform/simulated/SimulatedFacts.h"
 #include "platform/simulated/SimulatedFileManager.h"
@@ -53,6 +55,9 @@ class SimulatedPlatform final : public Platform {
   ScriptLanguageTagger& languageTagger() override { return languageTagger_; }
   ConfiguredServiceProxy& networkServiceProxy() override { return networkServiceProxy_; }
   SimulatedUserActivity& userActivity() override { return userActivity_; }
+  ICUWordTokenizer& wordTokenizer() override { return wordTokenizer_; }
+  /// Its folder is "/state/hints" of the file manager.
+  SpooledDataDetectors& dataDetectors() override { return dataDetectors_; }
   SimulatedSubscriptionRegistry& subscriptionRegistry() override { return subscriptionRegistry_; }
 
   std::vector<Availability> availability() override { return {}; }
@@ -75,6 +80,8 @@ class SimulatedPlatform final : public Platform {
   SimulatedMapsService mapsService_{notificationCenter_};
   SimulatedApplicationRegistry applicationRegistry_{notificationCenter_};
   ScriptLanguageTagger languageTagger_;
+  ICUWordTokenizer wordTokenizer_;
+  SpooledDataDetectors dataDetectors_{fileManager_, "/state/hints"};
   ConfiguredServiceProxy networkServiceProxy_;
   SimulatedUserActivity userActivity_;
 
