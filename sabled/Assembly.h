@@ -50,8 +50,8 @@ class Assembly {
 
   // Destroyed in reverse order: what is built on others goes first.
   std::unique_ptr<SBLNetworkRequestFactory> requestFactory;
-  std::unique_ptr<DownloadManager> downloadManager;
   std::unique_ptr<SableSubscriptionManager> subscriptionManager;
+  std::unique_ptr<DownloadManager> downloadManager;
   std::unique_ptr<SablePersistentStorage> persistentStorage;
   std::unique_ptr<SableFeedbackFlusher> crowdsourcingFeedbackFlusher;
   std::unique_ptr<BackgroundFlusher> backgroundFlusher;

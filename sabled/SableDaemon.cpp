@@ -62,9 +62,9 @@ void SableDaemon::registerDefaults() {
 void SableDaemon::createServices() {
   // The order is part of the design: a service may use in its constructor what stands before it.
   assembly_.requestFactory = std::make_unique<SBLNetworkRequestFactory>(assembly_);
-  assembly_.downloadManager = std::make_unique<DownloadManager>(assembly_);
   assembly_.subscriptionManager =
       std::make_unique<SableSubscriptionManager>(assembly_, *assembly_.requestFactory);
+  assembly_.downloadManager = std::make_unique<DownloadManager>(assembly_);
   assembly_.persistentStorage = std::make_unique<SablePersistentStorage>(assembly_);
   assembly_.crowdsourcingFeedbackFlusher = std::make_unique<SableFeedbackFlusher>(assembly_, 0);
   assembly_.backgroundFlusher = std::make_unique<BackgroundActivitiesManager>(assembly_);

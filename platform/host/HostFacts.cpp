@@ -28,8 +28,6 @@ struct Subject {
   Answer answer = nullptr;
 };
 
-const std::array<Subject, 10>& subjects() {
-  static const std::array<Subject, 10> all{
 const std::vector<Subject>& subjects() {
   static const std::vector<Subject> all{
       Subject{kCurrentLocaleDidChangeNotification,
