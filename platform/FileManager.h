@@ -29,6 +29,7 @@ struct FileAttributes {
   /// When the file came to be; for a copy that kept its time of change, that time, and so too
   /// where the file system does not know better.
   WallTime creationDate;
+  bool isOwn = true;  ///< it belongs to the user that the daemon runs as
 };
 
 /// A regular file open for reading; closed with the object. One thread at a time.

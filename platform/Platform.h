@@ -11,7 +11,9 @@ class ActivityScheduler;
 class ApplicationRegistry;
 class CountryConfiguration;
 class DataDetectors;
+class DeepLinkSpool;
 class DeviceInfo;
+class DifferentialPrivacy;
 class FileManager;
 class HTTPSessions;
 class InputModes;
@@ -67,6 +69,8 @@ class Platform {
   virtual SubscriptionRegistry& subscriptionRegistry() = 0;
   virtual WordTokenizer& wordTokenizer() = 0;
   virtual DataDetectors& dataDetectors() = 0;
+  virtual DeepLinkSpool& deepLinkSpool() = 0;
+  virtual DifferentialPrivacy& differentialPrivacy() = 0;
 
   /// What the host offers and lacks.
   virtual std::vector<Availability> availability() = 0;

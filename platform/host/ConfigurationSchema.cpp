@@ -21,6 +21,7 @@ constexpr std::array kSettings{
     KnownKey{"SBLDonateInteractions", boolean},
     KnownKey{"SBLHashtagImagesVisible", boolean},
     KnownKey{"SBLKeepUploads", boolean},
+    KnownKey{"SBLKeepPrivateReports", boolean},
     KnownKey{"SBLNewsVisible", boolean},
     KnownKey{"SBLNoParallax", boolean},
     KnownKey{"SBLNoQueryCache", boolean},

@@ -38,6 +38,10 @@ struct Folders {
   std::filesystem::path counters() const { return state / "counters.tally"; }
   std::filesystem::path interactions() const { return state / "activity" / "interactions.jsonl"; }
   std::filesystem::path activityRuns() const { return state / "activity" / "runs.json"; }
+  std::filesystem::path privateReports() const { return state / "privacy" / "reports.jsonl"; }
+  std::filesystem::path deepLinks() const {
+    return state / "deeplinks";
+  }  ///< a folder that applications fill
 
   std::filesystem::path hints() const { return state / "hints"; }  ///< a folder, as are these
   std::filesystem::path systemSubscriptions() const { return systemFacts.parent_path() / "subscriptions.d"; }

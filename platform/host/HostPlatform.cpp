@@ -5,6 +5,7 @@
 
 #include "platform/ConfiguredServiceProxy.h"
 #include "platform/ICUWordTokenizer.h"
+#include "platform/DeepLinkSpool.h"
 #include "platform/NotificationCenter.h"
 #include "platform/ScriptLanguageTagger.h"
 #include "platform/SpooledDataDetectors.h"
@@ -13,6 +14,7 @@
 #include "platform/host/HostActivityScheduler.h"
 #include "platform/host/HostApplicationRegistry.h"
 #include "platform/host/HostDeviceInfo.h"
+#include "platform/host/HostDifferentialPrivacy.h"
 #include "platform/host/HostFacts.h"
 #include "platform/host/HostFileManager.h"
 #include "platform/host/HostHTTPSession.h"
@@ -96,6 +98,8 @@ struct HostPlatform::Facilities {
   Lazy<HostUserActivity> userActivity;
   Lazy<HostActivityScheduler> activityScheduler;
   Lazy<HostSubscriptionRegistry> subscriptionRegistry;
+  Lazy<DeepLinkSpool> deepLinkSpool;
+  Lazy<HostDifferentialPrivacy> differentialPrivacy;
 };
 
 HostHTTPSessions::Transfers HostPlatform::Facilities::transfers() {
@@ -232,6 +236,16 @@ WordTokenizer& HostPlatform::wordTokenizer() {
 }
 DataDetectors& HostPlatform::dataDetectors() {
   return facilities_->dataDetectors;
+DeepLinkSpool& HostPlatform::deepLinkSpool() {
+  auto& facilities = *facilities_;
+  return facilities.deepLinkSpool.get(facilities.fileManager, facilities.runtime,
+                                      facilities.folders.deepLinks());
+}
+
+DifferentialPrivacy& HostPlatform::differentialPrivacy() {
+  auto& facilities = *facilities_;
+  return facilities.differentialPrivacy.get(facilities.runtime, facilities.settings(), facilities.fileManager,
+                                            facilities.folders.privateReports());
 }
 
 std::vector<Availability> HostPlatform::availability() {

@@ -50,6 +50,8 @@ class HostPlatform final : public Platform {
   SubscriptionRegistry& subscriptionRegistry() override;
   WordTokenizer& wordTokenizer() override;
   DataDetectors& dataDetectors() override;
+  DeepLinkSpool& deepLinkSpool() override;
+  DifferentialPrivacy& differentialPrivacy() override;
 
   std::vector<Availability> availability() override;
 

@@ -2,11 +2,13 @@
 
 #include "platform/ConfiguredServiceProxy.h"
 #include "platform/ICUWordTokenizer.h"
+#include "platform/DeepLinkSpool.h"
 #include "platform/NotificationCenter.h"
 #include "platform/Platform.h"
 #include "platform/ScriptLanguageTagger.h"
 #include "platform/SpooledDataDetectors.h"
 #include "platform/simulated/SimulatedActivityScheduler.h"
+#include "platform/simulated/SimulatedDifferentialPrivacy.h"
 #include "platform/simulated/SimulatedFacts.h"
 #include "platform/simulated/SimulatedFileManager.h"
 #include "platform/simulated/SimulatedHTTP.h"
@@ -59,6 +61,11 @@ class SimulatedPlatform final : public Platform {
   /// Its folder is "/state/hints" of the file manager.
   SpooledDataDetectors& dataDetectors() override { return dataDetectors_; }
   SimulatedSubscriptionRegistry& subscriptionRegistry() override { return subscriptionRegistry_; }
+  DeepLinkSpool& deepLinkSpool() override { return deepLinkSpool_; }
+  SimulatedDifferentialPrivacy& differentialPrivacy() override { return differentialPrivacy_; }
+
+  /// Where applications drop deep links.
+  static std::filesystem::path deepLinks() { return "/home/user/.local/state/deeplinks"; }
 
   std::vector<Availability> availability() override { return {}; }
 
@@ -84,6 +91,8 @@ class SimulatedPlatform final : public Platform {
   SpooledDataDetectors dataDetectors_{fileManager_, "/state/hints"};
   ConfiguredServiceProxy networkServiceProxy_;
   SimulatedUserActivity userActivity_;
+  DeepLinkSpool deepLinkSpool_{fileManager_, runtime_, deepLinks()};
+  SimulatedDifferentialPrivacy differentialPrivacy_;
 
   // Last: what is still queued goes first.
   SimulatedRuntime runtime_;
