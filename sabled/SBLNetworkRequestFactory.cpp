@@ -46,9 +46,10 @@ HTTPRequest SBLNetworkRequestFactory::warmRequest(std::string_view url) {
 }
 
 HTTPRequest SBLNetworkRequestFactory::bagFetchRequest(const SableBagController& bagController,
-                                                      std::string_view userAgent, std::string_view version) {
+                                                      std::string_view userAgent, std::string_view version,
+                                                      RequestTrace* trace) {
   const std::string country = contextAccessQueue_->sync([this] { return context_.geoDeviceCountryCode; });
-  HTTPRequest request = build(bagController.bagFetchURLWithCountry(country), [&](Builder& builder) {
+  const auto steps = [&](Builder& builder) {
     _addVersionQueryItem(builder, version);
     _addSecretKeyQueryItem(builder);
     _addDebugQueryItems(builder);
@@ -58,7 +59,8 @@ HTTPRequest SBLNetworkRequestFactory::bagFetchRequest(const SableBagController& 
     _addDeviceCountryCodeQueryItem(builder);
     _addHttpRequestUserAgent(builder, userAgent);
     _addBrambleQueryItem(builder);
-  });
+  };
+  HTTPRequest request = build(bagController.bagFetchURLWithCountry(country), steps, trace);
   request.cachePolicy = HTTPCachePolicy::ignoreLocal;
   return request;
 }
@@ -83,8 +85,7 @@ std::optional<HTTPRequest> SBLNetworkRequestFactory::searchRequest(const SBLSear
   if (!bag.searchURL()) return std::nullopt;
   const bool withLocation = (fieldMask & kSBLFieldMaskNoLocation) == 0;
   const auto steps = [&](Builder& builder) {
-    // Whoever only wants to know how the request comes about need not be located for it.
-    if (trace == nullptr) _startUpdatingLocation();
+    startUpdatingLocationFor(builder);
     builder.beginStep("query");
     builder.forceQueryItemWithName("q", input.queryString);
     constexpr std::int64_t kSuggestionTapped = 8, kSuggestionTyped = 10;
@@ -130,11 +131,14 @@ std::optional<HTTPRequest> SBLNetworkRequestFactory::searchRequest(const SBLSear
 std::optional<HTTPRequest> SBLNetworkRequestFactory::zeroKeywordRequest(const SBLZeroKeywordRequest& input,
                                                                         const SBLBag& bag,
                                                                         const UUID& userGuid,
-                                                                        unsigned fieldMask) {
+                                                                        unsigned fieldMask,
+                                                                        RequestTrace* trace) {
   if (!bag.searchURL()) return std::nullopt;
-  HTTPRequest request = build(*bag.searchURL(), [&](Builder& builder) {
-    _startUpdatingLocation();
+  const auto steps = [&](Builder& builder) {
+    startUpdatingLocationFor(builder);
+    builder.beginStep("query");
     builder.forceQueryItemWithName("qtype", "zkw");
+    builder.beginStep("client's items");
     builder.forceQueryItemsFromArray(input.queryItems);
     _addDebugQueryItems(builder);
     _addSecretKeyQueryItem(builder);
@@ -161,17 +165,19 @@ std::optional<HTTPRequest> SBLNetworkRequestFactory::zeroKeywordRequest(const SB
     _addHttpRequestUIScale(builder, input.scale);
     _addHttpMapsEnvironmentName(builder, bag);
     _addHttpRequestMapsSessionId(builder);
-  });
+  };
+  HTTPRequest request = build(*bag.searchURL(), steps, trace);
   request.timeout = bag.timeoutIntervalForRequest();
   return request;
 }
 
 HTTPRequest SBLNetworkRequestFactory::moreResultsRequest(const SBLMoreResultsRequest& input,
                                                          const SBLBag& bag, const UUID& userGuid,
-                                                         unsigned fieldMask) {
+                                                         unsigned fieldMask, RequestTrace* trace) {
   const bool withLocation = (fieldMask & kSBLFieldMaskNoLocation) == 0;
-  HTTPRequest request = build(input.moreResultsURL, [&](Builder& builder) {
-    if (!builder.containsQueryItemWithName("latlng")) _startUpdatingLocation();
+  const auto steps = [&](Builder& builder) {
+    if (!builder.containsQueryItemWithName("latlng")) startUpdatingLocationFor(builder);
+    builder.beginStep("client's items");
     builder.forceQueryItemsFromArray(input.queryItems);
     _addDebugQueryItems(builder);
     _addSecretKeyQueryItem(builder);
@@ -189,17 +195,21 @@ HTTPRequest SBLNetworkRequestFactory::moreResultsRequest(const SBLMoreResultsReq
     _addHttpRequestUserGuid(builder, userGuid);
     _addHttpRequestUserAgent(builder, bag.userAgent());
     _addHttpRequestUIScale(builder, input.scale);
-  });
+  };
+  HTTPRequest request = build(input.moreResultsURL, steps, trace);
   request.timeout = bag.timeoutIntervalForRequest();
   return withLocation ? proxiedIfEnabled(std::move(request)) : request;
 }
 
 std::optional<HTTPRequest> SBLNetworkRequestFactory::lookupRequest(const SBLLookupRequest& input,
-                                                                   const SBLBag& bag, const UUID& userGuid) {
+                                                                   const SBLBag& bag, const UUID& userGuid,
+                                                                   RequestTrace* trace) {
   if (!bag.searchURL()) return std::nullopt;
-  HTTPRequest request = build(*bag.searchURL(), [&](Builder& builder) {
-    _startUpdatingLocation();
+  const auto steps = [&](Builder& builder) {
+    startUpdatingLocationFor(builder);
+    builder.beginStep("query");
     builder.forceQueryItemWithName("q", input.queryString);
+    builder.beginStep("client's items");
     builder.forceQueryItemsFromArray(input.queryItems);
     _addDebugQueryItems(builder);
     _addSecretKeyQueryItem(builder);
@@ -224,14 +234,16 @@ std::optional<HTTPRequest> SBLNetworkRequestFactory::lookupRequest(const SBLLook
     _addHttpRequestUIScale(builder, input.scale);
     _addHttpAppWhitelistSignature(builder);
     _addHttpRequestMapsSessionId(builder);
-  });
+  };
+  HTTPRequest request = build(*bag.searchURL(), steps, trace);
   request.timeout = bag.timeoutIntervalForRequest();
   return proxiedIfEnabled(std::move(request));
 }
 
 HTTPRequest SBLNetworkRequestFactory::cardRequest(const SBLCardRequest& input, const SBLBag& bag,
-                                                  const UUID& userGuid) {
-  HTTPRequest request = build(input.cardURL, [&](Builder& builder) {
+                                                  const UUID& userGuid, RequestTrace* trace) {
+  const auto steps = [&](Builder& builder) {
+    builder.beginStep("client's items");
     builder.forceQueryItemsFromArray(input.queryItems);
     _addDebugQueryItems(builder);
     _addSecretKeyQueryItem(builder);
@@ -250,24 +262,26 @@ HTTPRequest SBLNetworkRequestFactory::cardRequest(const SBLCardRequest& input, c
     _addHttpRequestMapsSessionId(builder);
     _addHttpMapsEnvironmentName(builder, bag);
     _addHttpRequestSubscriptionInfo(builder);
-  });
+  };
+  HTTPRequest request = build(input.cardURL, steps, trace);
   request.timeout = bag.timeoutIntervalForRequest();
   return proxiedIfEnabled(std::move(request));
 }
 
 HTTPRequest SBLNetworkRequestFactory::fileDownloadRequest(std::string_view url, std::string_view version,
-                                                          bool includeLatLong) {
-  return build(url, [&](Builder& builder) {
+                                                          bool includeLatLong, RequestTrace* trace) {
+  const auto steps = [&](Builder& builder) {
     _addSecretKeyQueryItem(builder);
     _addHttpRequestUserAgent(builder, createUserAgentString("Beacon/1"));
     if (includeLatLong) _addHttpFuzzedLocation(builder);
     _addHttpIfNoneMatch(builder, version);
-  });
+  };
+  return build(url, steps, trace);
 }
 
 HTTPRequest SBLNetworkRequestFactory::flusherUploadRequest(std::string_view url, double timeout,
-                                                           std::string_view digest) {
-  HTTPRequest request = build(url, [&](Builder& builder) {
+                                                           std::string_view digest, RequestTrace* trace) {
+  const auto steps = [&](Builder& builder) {
     _addDebugQueryItems(builder);
     _addSecretKeyQueryItem(builder);
     _addDeviceCountryCodeQueryItem(builder);
@@ -275,7 +289,8 @@ HTTPRequest SBLNetworkRequestFactory::flusherUploadRequest(std::string_view url,
     _addDiagnosticsAndUsageQueryItem(builder);
     _addHttpRequestPreferredLanguages(builder);
     _addHttpRequestUserAgent(builder, sabledUserAgent_);
-  });
+  };
+  HTTPRequest request = build(url, steps, trace);
   request.headers.set("X-Kestrel-Digest", std::string(digest));
   request.method = "POST";
   request.cachePolicy = HTTPCachePolicy::ignoreLocal;

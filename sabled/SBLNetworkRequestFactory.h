@@ -54,32 +54,38 @@ class SBLNetworkRequestFactory final : public SableSubscriptionManagerDelegate {
   explicit SBLNetworkRequestFactory(Assembly& assembly);
   ~SBLNetworkRequestFactory() override;
 
+  // A `trace` is told how a request came about. Who brings one only wants to know: the device is not
+  // located for it.
   platform::HTTPRequest warmRequest(std::string_view url);
   platform::HTTPRequest bagFetchRequest(const SableBagController& bagController, std::string_view userAgent,
-                                        std::string_view version);
+                                        std::string_view version, RequestTrace* trace = nullptr);
   /// Never sent: its URL changes exactly when the locale, languages, country, agent or debug items
   /// do, which is how an outdated bag is recognised.
   platform::HTTPRequest bagCacheRequest(const SableBagController& bagController, std::string_view userAgent,
                                         std::string_view version);
 
-  // nullopt when the bag has no search URL. A `trace` is told how the request came about.
+  // nullopt when the bag has no search URL.
   std::optional<platform::HTTPRequest> searchRequest(const SBLSearchRequest& input, const SBLBag& bag,
                                                      const UUID& userGuid, unsigned fieldMask = 0,
                                                      RequestTrace* trace = nullptr);
   std::optional<platform::HTTPRequest> zeroKeywordRequest(const SBLZeroKeywordRequest& input,
                                                           const SBLBag& bag, const UUID& userGuid,
-                                                          unsigned fieldMask = 0);
+                                                          unsigned fieldMask = 0,
+                                                          RequestTrace* trace = nullptr);
   std::optional<platform::HTTPRequest> lookupRequest(const SBLLookupRequest& input, const SBLBag& bag,
-                                                     const UUID& userGuid);
+                                                     const UUID& userGuid, RequestTrace* trace = nullptr);
 
   platform::HTTPRequest moreResultsRequest(const SBLMoreResultsRequest& input, const SBLBag& bag,
-                                           const UUID& userGuid, unsigned fieldMask = 0);
-  platform::HTTPRequest cardRequest(const SBLCardRequest& input, const SBLBag& bag, const UUID& userGuid);
+                                           const UUID& userGuid, unsigned fieldMask = 0,
+                                           RequestTrace* trace = nullptr);
+  platform::HTTPRequest cardRequest(const SBLCardRequest& input, const SBLBag& bag, const UUID& userGuid,
+                                    RequestTrace* trace = nullptr);
 
   platform::HTTPRequest fileDownloadRequest(std::string_view url, std::string_view version,
-                                            bool includeLatLong);
+                                            bool includeLatLong, RequestTrace* trace = nullptr);
   /// `timeout` in seconds; `digest` identifies the body that the caller will add.
-  platform::HTTPRequest flusherUploadRequest(std::string_view url, double timeout, std::string_view digest);
+  platform::HTTPRequest flusherUploadRequest(std::string_view url, double timeout, std::string_view digest,
+                                             RequestTrace* trace = nullptr);
 
   /// A product token such as "Beacon/1" as a full user agent; "" for an empty token.
   std::string createUserAgentString(std::string_view product) const;
@@ -206,6 +212,7 @@ class SBLNetworkRequestFactory final : public SableSubscriptionManagerDelegate {
   void _setupLocationServices();
   void didChangeAuthorization(platform::LocationAuthorization status);
   void didUpdateLocation(const platform::LocationFix& fix);
+  void startUpdatingLocationFor(const Builder& builder);
   void _startUpdatingLocation();
   void stopUpdatingLocation();
   static std::string_view _locationSourceForLocation(const platform::LocationFix& fix);

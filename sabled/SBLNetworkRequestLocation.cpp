@@ -5,6 +5,7 @@
 #include "sabled/CoarseLocation.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SableLogging.h"
+#include "sabled/SableURLRequestBuilder.h"
 
 // Where the device is, as far as user, bag and host let requests say so. What the host tells is
 // made coarse before it is kept: nothing finer is there to be sent or logged.
@@ -78,6 +79,10 @@ void SBLNetworkRequestFactory::didUpdateLocation(const LocationFix& fix) {
   _setLocationIfAllowedByBag(fix);
   // One fix is enough: until a request finds it too old, the device need not look for another.
   stopUpdatingLocation();
+}
+
+void SBLNetworkRequestFactory::startUpdatingLocationFor(const Builder& builder) {
+  if (!builder.isTraced()) _startUpdatingLocation();
 }
 
 void SBLNetworkRequestFactory::_startUpdatingLocation() {

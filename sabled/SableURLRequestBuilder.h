@@ -27,6 +27,7 @@ class SableURLRequestBuilder {
 
   /// Names the step that what is added next belongs to, for the trace.
   void beginStep(std::string_view step);
+  bool isTraced() const { return trace_ != nullptr; }
 
   bool containsQueryItemWithName(std::string_view name) const;
   void forceQueryItem(platform::URLQueryItem item);

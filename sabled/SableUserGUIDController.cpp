@@ -12,10 +12,10 @@ SableUserGUIDController::SableUserGUIDController(Assembly& assembly)
       lastKnownUserGUID_(assembly.runtime.uuid()),
       lastKnownUserGUIDExpirationDate_(assembly.runtime.now() + kSBLUserGUIDLifetime) {}
 
-UUID SableUserGUIDController::currentUserGUID() {
+SableUserGUIDController::Current SableUserGUIDController::current() {
   return queue_->sync([this] {
     if (lastKnownUserGUIDExpirationDate_ <= assembly_.runtime.now()) roll();
-    return lastKnownUserGUID_;
+    return Current{lastKnownUserGUID_, lastKnownUserGUIDExpirationDate_};
   });
 }
 

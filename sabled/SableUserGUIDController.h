@@ -23,8 +23,13 @@ class SableUserGUIDController {
  public:
   explicit SableUserGUIDController(Assembly& assembly);
 
+  struct Current {
+    UUID guid;
+    platform::WallTime expires;
+  };
   /// The GUID in use; rolls first when its time is up.
-  UUID currentUserGUID();
+  UUID currentUserGUID() { return current().guid; }
+  Current current();
   /// Rolls soon: a following currentUserGUID() on any thread sees the new one.
   void reset();
 
