@@ -18,6 +18,7 @@
 #include "sabled/SableBagController.h"
 #include "sabled/SableFeedbackFlusher.h"
 #include "sabled/SableFlusherRelay.h"
+#include "sabled/SableDPAppDeepLinkIngester.h"
 #include "sabled/SableLogging.h"
 #include "sabled/SablePersistentStorage.h"
 #include "sabled/SableService.h"
@@ -74,6 +75,8 @@ void SableDaemon::createServices() {
   assembly_.bagController = std::make_unique<SableBagController>(assembly_);
   assembly_.clientStateManager = std::make_unique<ClientStateManager>(assembly_);
   assembly_.appWhitelistController = std::make_unique<AppWhitelistController>(assembly_);
+  deepLinkIngester_ = std::make_unique<SableDPAppDeepLinkIngester>(assembly_);
+  deepLinkIngester_->scheduleMaintenance();
   service_ = std::make_unique<SableService>(assembly_);
 }
 

@@ -9,6 +9,7 @@
 
 namespace sable {
 
+class SableDPAppDeepLinkIngester;
 class SableService;
 
 /// The daemon as a whole, on whatever platform it is given: makes the services in their order,
@@ -36,6 +37,7 @@ class SableDaemon {
 
   platform::Platform& platform_;
   Assembly assembly_;
+  std::unique_ptr<SableDPAppDeepLinkIngester> deepLinkIngester_;
   std::unique_ptr<SableService> service_;
   std::unique_ptr<platform::RelayListener> listener_;
   std::unique_ptr<platform::Process::SignalSource> interrupt_, terminate_;
