@@ -26,15 +26,14 @@ constexpr std::string_view kReportsKey = "SBLDeepLinkReports";
 /// A day's links that are looked at; an index below it takes a byte to draw.
 constexpr std::size_t kMaximumFiles = 256;
 
-constexpr double kHour = 3600;  // seconds
+constexpr double kDay = 24 * 60 * 60;  // seconds
 
 platform::ActivityCriteria maintenanceCriteria() {
   auto criteria = SableRelayCriteria::createCriteria();
   SableRelayCriteria::setRepeating(true, criteria);
-  SableRelayCriteria::setDelay(kHour, criteria);  // the start has other things to do
-  SableRelayCriteria::setInterval(24 * kHour, criteria);
-  SableRelayCriteria::setGracePeriod(2 * kHour, criteria);
-  // It takes milliseconds, and links should not lie about for long.
+  SableRelayCriteria::setInterval(kDay, criteria);
+  // It takes milliseconds and sends nothing, and links should not lie about for long. So it waits neither
+  // for power nor after the start: a daemon that is started on demand may not live to see an hour.
   SableRelayCriteria::setAllowBatteryUsage(true, criteria);
   return criteria;
 }
@@ -50,6 +49,8 @@ void SableDPAppDeepLinkIngester::scheduleMaintenance() {
 void SableDPAppDeepLinkIngester::ingest() {
   const bool allowed = assembly_.platform.managedConfiguration().diagnosticsSubmissionAllowed();
   const auto content = assembly_.platform.deepLinkSpool().take(allowed ? kMaximumFiles : 0);
+  const std::size_t found = content.links.size() + content.refused + content.unread + content.stuck;
+  if (found == 0) return;
   SableDefaultLog().info("deep links: {} read, {} refused, {} deleted unread, {} stuck", content.links.size(),
                          content.refused, content.unread, content.stuck);
   report(targetsOf(content.links));
