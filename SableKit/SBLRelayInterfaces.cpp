@@ -22,6 +22,7 @@ constexpr std::array kDaemonMethods{
 constexpr std::array kDiagnosticsMethods{
     RelayMethod{"Explain", "sa{sv}", "s"},
     RelayMethod{"Resources", "", "s"},
+    RelayMethod{"Privacy", "", "s"},
 };
 
 constexpr std::array kClientMethods{

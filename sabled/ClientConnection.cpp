@@ -18,6 +18,7 @@
 #include "sabled/ClientStateManager.h"
 #include "sabled/DownloadManager.h"
 #include "sabled/KeyboardLocale.h"
+#include "sabled/PrivacyReport.h"
 #include "sabled/RequestReply.h"
 #include "sabled/SableBagController.h"
 #include "sabled/SableFlusherRelay.h"
@@ -61,6 +62,7 @@ void ClientConnection::start() {
   });
   connection_->exportObject(kSBLDiagnosticsRelay, [weak = weak_from_this()](platform::RelayCall call) {
     if (const auto self = weak.lock()) self->diagnose(call);
+    if (const auto self = weak.lock()) self->diagnose(std::move(call));
   });
   armIdleTimer(kClientIdleTimeout);
   connection_->resume();
@@ -259,6 +261,25 @@ void ClientConnection::diagnose(platform::RelayCall& call) {
       [reply = std::move(call.reply)](const Dictionary& resources) mutable {
         reply(compactJSON(resources));
       });
+void ClientConnection::diagnose(platform::RelayCall call) {
+  lastCall_ = assembly_.runtime.ticks();
+  switch (call.method) {
+    case SBLDiagnosticsRelay::explain:
+      return explain(call);
+    case SBLDiagnosticsRelay::privacy:
+      return describePrivacy(std::move(call.reply));
+    default:
+      return;
+  }
+}
+
+void ClientConnection::describePrivacy(platform::RelayReply reply) {
+  if (!_ensureState()) return reply.fail("org.freedesktop.DBus.Error.InvalidArgs", "comes after Configure");
+  SBLRequest input;
+  fillDefaults(input);
+  PrivacyReport report;
+  state_->describePrivacy(input, report);
+  reply(report.json());
 }
 
 void ClientConnection::explain(platform::RelayCall& call) {

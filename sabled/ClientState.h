@@ -21,6 +21,7 @@ class QueryCache;
 class RequestTrace;
 class SBLBag;
 class SableUserGUIDController;
+struct PrivacyReport;
 struct SableAnswer;
 struct SearchExplanation;
 struct SearchResponse;
@@ -68,6 +69,9 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
 
   /// Adds to `why` what search() would do with the request; nothing is asked, replied or counted.
   void explain(const SBLSearchRequest& request, SearchExplanation& why);
+  /// Adds what this client's requests, and the daemon's own, would tell of the device now; nothing is sent.
+  /// `input` has the members that clients leave to the daemon.
+  void describePrivacy(const SBLRequest& input, PrivacyReport& report);
 
  private:
   struct QueryKind;
@@ -103,6 +107,8 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   SBLReply replyWith(const Query& query, Data data) const;
   bool routesThroughProxy(const Query& query) const;
   void enableProxy(platform::HTTPDataTask& task) const;
+  void describeQueries(const SBLRequest& input, PrivacyReport& report);
+  void describeOwnRequests(PrivacyReport& report) const;
   void recordSearchResult(int status);
   void forceFetch(const platform::HTTPRequest& request);
   void count(std::string_view event);

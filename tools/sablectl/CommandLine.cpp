@@ -166,6 +166,8 @@ void addAnyRequest(CLI::App& app, Invocation& invocation) {
 }
 
 void addQuestions(CLI::App& app, Invocation& invocation) {
+  add(app, invocation, "privacy", "Show what requests tell of this device now, and what changes that",
+      runPrivacy);
   add(app, invocation, "bag", "Show the bag as this agent sees it", runBag);
   add(app, invocation, "sessions", "List the sessions that the daemon holds open", runSessions);
 

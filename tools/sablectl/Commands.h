@@ -26,6 +26,8 @@ ExitCode runImages(const Context& context, const ImageOptions& options);
 // What the daemon tells.
 /// What a search would do, and why: nothing is asked of the service.
 ExitCode runExplain(const Context& context, const SBLSearchRequest& request);
+/// What requests would tell of this device now, and what changes that.
+ExitCode runPrivacy(const Context& context);
 ExitCode runBag(const Context& context);
 ExitCode runSessions(const Context& context);
 /// What sessions hold in memory.

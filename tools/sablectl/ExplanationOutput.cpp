@@ -4,43 +4,10 @@
 
 #include <nlohmann/json.hpp>
 
-#include "tools/sablectl/Text.h"
+#include "tools/sablectl/Section.h"
 
 namespace sable::sablectl {
 namespace {
-
-using Rows = std::vector<std::vector<std::string>>;
-
-Dictionary member(const Dictionary& object, const char* key) {
-  const auto found = object.find(key);
-  return found == object.end() ? Dictionary() : *found;
-}
-
-std::string textOf(const Dictionary& object, const char* key) {
-  return plainText(member(object, key));
-}
-
-/// A heading, and rows in columns that stay within the width.
-class Section {
- public:
-  Section(const Output& output, std::vector<std::string>& lines, std::string_view heading)
-      : output_(output), lines_(lines) {
-    if (!lines.empty()) lines.emplace_back();
-    lines.push_back(output.paint(Colour::bold, heading));
-  }
-  ~Section() {
-    for (const std::string& line : aligned(rows_)) lines_.push_back("  " + cut(line, output_.width - 2));
-  }
-  Section(const Section&) = delete;
-  Section& operator=(const Section&) = delete;
-
-  void row(std::vector<std::string> cells) { rows_.push_back(std::move(cells)); }
-
- private:
-  const Output& output_;
-  std::vector<std::string>& lines_;
-  Rows rows_;
-};
 
 std::string outcomeLine(const Dictionary& explanation) {
   const std::string outcome = textOf(explanation, "outcome");

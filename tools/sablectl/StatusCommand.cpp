@@ -133,10 +133,10 @@ Dictionary facilitiesStatus(const Host& host) {
 std::string bagText(const Dictionary& bag) {
   if (bag.contains("error")) return "cannot be read: " + plainText(bag["error"]);
   std::string text = "version " + plainText(bag["version"]);
-  if (const auto age = integerMember(bag, "age_seconds")) text += fmt::format(", {} old", duration(*age));
+  if (const auto age = integerMember(bag, "age_seconds")) text += fmt::format(", {} old", durationText(*age));
   if (const auto rest = integerMember(bag, "expires_in_seconds"))
-    text += *rest < 0 ? fmt::format(", expired {} ago", duration(*rest))
-                      : fmt::format(", expires in {}", duration(*rest));
+    text += *rest < 0 ? fmt::format(", expired {} ago", durationText(*rest))
+                      : fmt::format(", expires in {}", durationText(*rest));
   return text;
 }
 

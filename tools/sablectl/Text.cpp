@@ -4,6 +4,7 @@
 #include <unicode/uchar.h>
 #include <unicode/utext.h>
 
+#include <algorithm>
 #include <cstdint>
 #include <cstdlib>
 #include <functional>
@@ -105,6 +106,28 @@ std::vector<std::string> characters(std::string_view text) {
     }
   });
   return result;
+}
+
+std::vector<std::string> wrapped(std::string_view text, std::size_t width) {
+  std::vector<std::string> lines;
+  while (!text.empty()) {
+    const std::string word(text.substr(0, text.find(' ')));
+    text.remove_prefix(std::min(text.size(), word.size() + 1));
+    if (lines.empty() || displayWidth(lines.back()) + 1 + displayWidth(word) > width) {
+      lines.push_back(word);
+    } else {
+      lines.back().append(" ").append(word);
+    }
+  }
+  return lines;
+}
+
+std::string durationText(std::int64_t seconds) {
+  const std::int64_t whole = std::abs(seconds);
+  if (whole >= 86400) return fmt::format("{} d {} h", whole / 86400, whole % 86400 / 3600);
+  if (whole >= 3600) return fmt::format("{} h {} min", whole / 3600, whole % 3600 / 60);
+  if (whole >= 60) return fmt::format("{} min {} s", whole / 60, whole % 60);
+  return fmt::format("{} s", whole);
 }
 
 }  // namespace sable::sablectl

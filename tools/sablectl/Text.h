@@ -24,6 +24,9 @@ std::size_t displayWidth(std::string_view text);
 /// The text, if it fits, else its beginning with "…" at the end; at most `width` columns.
 std::string cut(std::string_view text, std::size_t width);
 
+/// The text's words in lines of at most `width` columns; a longer word stands alone.
+std::vector<std::string> wrapped(std::string_view text, std::size_t width);
+
 /// The text with blanks behind it up to `width` columns.
 std::string padded(std::string_view text, std::size_t width);
 
@@ -32,5 +35,8 @@ std::string duration(std::int64_t seconds);
 
 /// The text's code points, each as UTF-8; marks that combine stay with what they stand on.
 std::vector<std::string> characters(std::string_view text);
+
+/// "3 h 59 min", "12 s": the two largest units; without a sign.
+std::string durationText(std::int64_t seconds);
 
 }  // namespace sable::sablectl
