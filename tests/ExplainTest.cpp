@@ -1,12 +1,19 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
+#include <map>
+#include <set>
+
 #include "SableKit/SBLRelayCoding.h"
 #include "SableKit/SBLRelayInterfaces.h"
 #include "tests/support/VirtualDevice.h"
 
-// An explanation is made by the code that decides: what it foretells is what a search then does.
+// An explanation is made by the code that decides: what it foretells is what a search then does. So is a
+// report on privacy.
 namespace sable::test {
 namespace {
+
+using platform::HTTPRequest;
 
 class ExplainTest : public ::testing::Test {
  protected:
@@ -134,6 +141,121 @@ TEST_F(ExplainTest, ExplainsSearchesOnly) {
   device.run();
   EXPECT_NE(error.find("explains a SBLSearchRequest"), std::string::npos) << error;
   EXPECT_TRUE(client->isConnected());
+}
+
+/// Of what a request carried, that which a privacy report tells of requests of its kind: "name=value".
+class PrivacyTest : public ExplainTest {
+ protected:
+  json privacy() {
+    json report;
+    client->connection().call(kSBLDiagnosticsRelay, SBLDiagnosticsRelay::privacy, {}, 20s,
+                              [&](Expected<platform::RelayArguments> result) {
+                                ASSERT_TRUE(result) << result.error().reason;
+                                report = json::parse(std::get<std::string>((*result)[0]));
+                              });
+    device.run();
+    return report;
+  }
+
+  static std::set<std::string> told(const json& report, std::string_view request) {
+    std::set<std::string> values;
+    for (const json& value : report["values"]) {
+      const json& requests = value["requests"];
+      if (std::find(requests.begin(), requests.end(), request) == requests.end()) continue;
+      values.insert(value["name"].get<std::string>() + "=" + value["value"].get<std::string>());
+    }
+    return values;
+  }
+
+  /// What the newest request to the path carried, without what is the query's and not the device's.
+  std::set<std::string> carried(std::string_view path) {
+    const HTTPRequest request = device.service.requests(path).back().request;
+    const std::set<std::string> ofTheQuery{"q",     "qtype",   "key",   "card",     "ldomain",
+                                           "ltype", "context", "qlang", "lctxlang", "version"};
+    std::set<std::string> values;
+    for (const auto& item : platform::URL::parse(request.url)->queryItems()) {
+      if (!ofTheQuery.contains(item.name)) values.insert(item.name + "=" + item.value.value_or(""));
+    }
+    for (const auto& [name, value] : request.headers.fields()) values.insert(name + "=" + value);
+    return values;
+  }
+};
+
+TEST_F(PrivacyTest, WhatItTellsOfEachKindOfRequestIsWhatIsSent) {
+  device.bag["geo_location_sources"] = {"wifi"};
+  device.bag["send_geo_environment_header"] = true;
+  device.bag["feedback_url"] = "https://service.test/feedback";
+  device.platform.userDefaults().setByUser("SBLDebugParameters", "cc=XX");
+  device.platform.accountStore().values.managed = true;
+  device.platform.mapsService().sessions = {{"maps-session", {}}};
+  device.platform.locationService().authorize(platform::LocationAuthorization::always);
+  start("Rover/1");
+  device.platform.locationService().deliver({51.507351, -0.127758, 5, device.platform.runtime().now()});
+  device.run();
+  const int located = device.platform.locationService().starts();
+  const json report = privacy();
+  EXPECT_EQ(device.sent("/search"), 0u) << "nothing is sent for it";
+  EXPECT_EQ(device.platform.locationService().starts(), located) << "nor is the device located";
+  for (const json& value : report["values"]) {
+    EXPECT_NE(value["what"].get<std::string>().front(), '_') << "a step without words for users";
+  }
+
+  client->ask(searchFor("weather"));
+  EXPECT_EQ(told(report, "search"), carried("/search"));
+  client->ask(SBLZeroKeywordRequest{});
+  EXPECT_EQ(told(report, "zero keyword"), carried("/search"));
+  client->ask(SBLLookupRequest{});
+  EXPECT_EQ(told(report, "lookup"), carried("/search"));
+  SBLMoreResultsRequest more;
+  more.moreResultsURL = "https://service.test/more";
+  client->ask(more);
+  EXPECT_EQ(told(report, "more results"), carried("/more"));
+  SBLCardRequest card;
+  card.cardURL = "https://service.test/card";
+  client->ask(card);
+  EXPECT_EQ(told(report, "card"), carried("/card"));
+  EXPECT_EQ(told(report, "bag"), carried("/bag"));
+  EXPECT_TRUE(told(report, "search").contains("mode=managed"));
+  EXPECT_TRUE(told(report, "card").contains("latlng=51.500000,-0.100000"));
+  EXPECT_TRUE(told(report, "upload").contains("du_enabled=1"));
+
+  device.advance(14min);
+  client = &device.client("com.kestrel.rover", "Rover/1");
+  EXPECT_NEAR(privacy()["user_guid"]["rotates_in"].get<double>(), 60, 5);
+  device.advance(2min);
+  client = &device.client("com.kestrel.rover", "Rover/1");
+  EXPECT_NE(privacy()["user_guid"]["value"], report["user_guid"]["value"]);
+}
+
+TEST_F(PrivacyTest, WhatIsNotAskedForSaysWhyAndTellsNothing) {
+  device.bag["agents"]["rover"]["enabled"] = false;
+  const auto unsent = [](const json& report) {
+    std::map<std::string, std::string> why;
+    for (const json& request : report["requests"]) {
+      if (!request["sent"]) why[request["request"]] = request["why"];
+    }
+    return why;
+  };
+  start("Rover/1");
+  const json disabled = privacy();
+  EXPECT_EQ(unsent(disabled)["search"], "the bag does not enable it for this agent");
+  EXPECT_TRUE(told(disabled, "search").empty());
+  EXPECT_EQ(unsent(disabled)["upload"], "the bag collects no feedback from this agent");
+  EXPECT_EQ(unsent(disabled).count("bag"), 0u);
+
+  client = &device.client("com.kestrel.messages", "Messages/1");
+  const json messages = privacy();
+  EXPECT_FALSE(told(messages, "search").contains("geosrc=bagno.all"));
+  EXPECT_TRUE(told(messages, "card").contains("geosrc=bagno.all"));
+}
+
+TEST_F(PrivacyTest, WithoutABagOnlyTheRequestForItIsThere) {
+  device.service.on("/bag", answering("", 500));
+  start();
+  const json report = privacy();
+  EXPECT_TRUE(report["bag"].is_null());
+  EXPECT_TRUE(told(report, "search").empty());
+  EXPECT_EQ(told(report, "bag"), carried("/bag"));
 }
 
 }  // namespace
