@@ -76,7 +76,7 @@ void addUnsent(const Output& output, std::vector<std::string>& lines, const Dict
   for (const Dictionary& topic : unsent) section.row({textOf(topic, "what"), textOf(topic, "control")});
 }
 
-std::string guidLine(const Dictionary& guid) {
+std::string identifierLine(const Dictionary& guid) {
   const auto seconds = [&](const char* key) {
     return durationText(static_cast<std::int64_t>(numberMember(guid, key).value_or(0)));
   };
@@ -99,7 +99,7 @@ std::vector<std::string> privacyLines(const Output& output, const Dictionary& re
   addValues(output, lines, member(report, "values"));
   addUnsent(output, lines, member(report, "not_sent"));
   lines.insert(lines.end(),
-               {"", guidLine(member(report, "user_guid")), deepLinkLine(report),
+               {"", identifierLine(member(report, "user_guid")), deepLinkLine(report),
                 "Queries also carry what was typed and what their client adds to them. Images and "
                 "warm-ups carry none of this."});
   return lines;
