@@ -31,8 +31,7 @@ struct SBLDiagnosticsRelay {
   enum Method : std::size_t {
     explain,    ///< s class, a{sv} record -> s JSON: what the request would do, and why
     resources,  ///< -> s JSON: the resource files, what is held of them and what is planned
-    explain,  ///< s class, a{sv} record -> s JSON: what the request would do, and why
-    privacy,  ///< -> s JSON: what requests would tell of the device now
+    privacy,    ///< -> s JSON: what requests would tell of the device now
   };
 };
 

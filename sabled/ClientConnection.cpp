@@ -61,7 +61,6 @@ void ClientConnection::start() {
     if (const auto self = weak.lock()) self->handleInvocation(std::move(call));
   });
   connection_->exportObject(kSBLDiagnosticsRelay, [weak = weak_from_this()](platform::RelayCall call) {
-    if (const auto self = weak.lock()) self->diagnose(call);
     if (const auto self = weak.lock()) self->diagnose(std::move(call));
   });
   armIdleTimer(kClientIdleTimeout);
@@ -253,14 +252,6 @@ void ClientConnection::request(platform::RelayCall& call) {
   std::visit(Router{*this, reply}, *decoded);
 }
 
-void ClientConnection::diagnose(platform::RelayCall& call) {
-  lastCall_ = assembly_.runtime.ticks();
-  if (call.method == SBLDiagnosticsRelay::explain) return explain(call);
-  if (assembly_.downloadManager == nullptr) return call.reply(compactJSON(Dictionary::array()));
-  assembly_.downloadManager->describeResources(
-      [reply = std::move(call.reply)](const Dictionary& resources) mutable {
-        reply(compactJSON(resources));
-      });
 void ClientConnection::diagnose(platform::RelayCall call) {
   lastCall_ = assembly_.runtime.ticks();
   switch (call.method) {
@@ -268,9 +259,17 @@ void ClientConnection::diagnose(platform::RelayCall call) {
       return explain(call);
     case SBLDiagnosticsRelay::privacy:
       return describePrivacy(std::move(call.reply));
+    case SBLDiagnosticsRelay::resources:
+      return describeResources(std::move(call.reply));
     default:
       return;
   }
+}
+
+void ClientConnection::describeResources(platform::RelayReply reply) {
+  if (assembly_.downloadManager == nullptr) return reply(compactJSON(Dictionary::array()));
+  assembly_.downloadManager->describeResources(
+      [reply = std::move(reply)](const Dictionary& resources) mutable { reply(compactJSON(resources)); });
 }
 
 void ClientConnection::describePrivacy(platform::RelayReply reply) {

@@ -69,10 +69,10 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void pushAnswered(const Expected<platform::RelayArguments>& result);
 
   void request(platform::RelayCall& call);
-  void diagnose(platform::RelayCall& call);
   void diagnose(platform::RelayCall call);
   void explain(platform::RelayCall& call);
   void describePrivacy(platform::RelayReply reply);
+  void describeResources(platform::RelayReply reply);
   void fillDefaults(SBLRequest& request) const;
   void search(const SBLSearchRequest& request, SBLReplyHandler reply);
   // Feedback. The sender of what is none loses its connection.

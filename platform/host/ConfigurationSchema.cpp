@@ -13,24 +13,15 @@ namespace {
 using enum ValueType;
 
 constexpr std::array kSettings{
-    KnownKey{"SBLAppWhitelistSignature", string},
-    KnownKey{"SBLBagURL", string},
-    KnownKey{"SBLDebugParameters", string},
-    KnownKey{"SBLDefaultBagURL", string},
-    KnownKey{"SBLDefaultBagURLCN", string},
-    KnownKey{"SBLDonateInteractions", boolean},
-    KnownKey{"SBLHashtagImagesVisible", boolean},
-    KnownKey{"SBLKeepUploads", boolean},
-    KnownKey{"SBLKeepPrivateReports", boolean},
-    KnownKey{"SBLNewsVisible", boolean},
-    KnownKey{"SBLNoParallax", boolean},
-    KnownKey{"SBLNoQueryCache", boolean},
-    KnownKey{"SBLPersistSessions", boolean},
-    KnownKey{"SBLSessionMaxAge", integer},
-    KnownKey{"SBLSessionSizeLimit", integer},
-    KnownKey{"SBLSharedSession", boolean},
-    KnownKey{"SBLUseBramble", boolean},
-    KnownKey{"TraceEnabled", boolean},
+    KnownKey{"SBLAppWhitelistSignature", string}, KnownKey{"SBLBagURL", string},
+    KnownKey{"SBLDebugParameters", string},       KnownKey{"SBLDefaultBagURL", string},
+    KnownKey{"SBLDefaultBagURLCN", string},       KnownKey{"SBLDonateInteractions", boolean},
+    KnownKey{"SBLHashtagImagesVisible", boolean}, KnownKey{"SBLKeepUploads", boolean},
+    KnownKey{"SBLKeepPrivateReports", boolean},   KnownKey{"SBLNewsVisible", boolean},
+    KnownKey{"SBLNoParallax", boolean},           KnownKey{"SBLNoQueryCache", boolean},
+    KnownKey{"SBLPersistSessions", boolean},      KnownKey{"SBLSessionMaxAge", integer},
+    KnownKey{"SBLSessionSizeLimit", integer},     KnownKey{"SBLSharedSession", boolean},
+    KnownKey{"SBLUseBramble", boolean},           KnownKey{"TraceEnabled", boolean},
 };
 
 /// Of the domain that the clients of lookups share.

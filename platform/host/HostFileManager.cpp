@@ -230,15 +230,6 @@ Expected<FileAttributes> HostFileManager::attributes(const Path& path) {
   const auto folder = openTrustedFolder(path.parent_path(), MissingFolders::fail);
   if (!folder) return tl::unexpected(folder.error());
   return attributesAt(folder->number(), path.filename().c_str(), AT_SYMLINK_NOFOLLOW, path);
-  struct statx status {};
-  if (statx(folder->number(), path.filename().c_str(), AT_SYMLINK_NOFOLLOW,
-            STATX_TYPE | STATX_UID | STATX_SIZE | STATX_MTIME | STATX_BTIME, &status) != 0) {
-    return failed(errno, path);
-  }
-  if (const int number = refusalOf(status.stx_mode); number != 0) return failed(number, path);
-  WallTime created = timeOf(status.stx_mtime);
-  if ((status.stx_mask & STATX_BTIME) != 0) created = std::min(created, timeOf(status.stx_btime));
-  return FileAttributes{status.stx_size, created, status.stx_uid == geteuid()};
 }
 
 Expected<std::vector<std::string>> HostFileManager::list(const Path& path) {

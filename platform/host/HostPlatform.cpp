@@ -4,8 +4,8 @@
 #include <optional>
 
 #include "platform/ConfiguredServiceProxy.h"
-#include "platform/ICUWordTokenizer.h"
 #include "platform/DeepLinkSpool.h"
+#include "platform/ICUWordTokenizer.h"
 #include "platform/NotificationCenter.h"
 #include "platform/ScriptLanguageTagger.h"
 #include "platform/SpooledDataDetectors.h"
@@ -234,8 +234,11 @@ SubscriptionRegistry& HostPlatform::subscriptionRegistry() {
 WordTokenizer& HostPlatform::wordTokenizer() {
   return facilities_->wordTokenizer;
 }
+
 DataDetectors& HostPlatform::dataDetectors() {
   return facilities_->dataDetectors;
+}
+
 DeepLinkSpool& HostPlatform::deepLinkSpool() {
   auto& facilities = *facilities_;
   return facilities.deepLinkSpool.get(facilities.fileManager, facilities.runtime,

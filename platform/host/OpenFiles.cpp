@@ -41,13 +41,14 @@ int refusalOf(mode_t mode) {
 Expected<FileAttributes> attributesAt(int folder, const char* name, int flags,
                                       const std::filesystem::path& path) {
   struct statx status {};
-  if (statx(folder, name, flags, STATX_TYPE | STATX_SIZE | STATX_MTIME | STATX_BTIME, &status) != 0)
+  if (statx(folder, name, flags, STATX_TYPE | STATX_UID | STATX_SIZE | STATX_MTIME | STATX_BTIME, &status) !=
+      0)
     return tl::unexpected(posixError(errno, path.native()));
   if (const int number = refusalOf(status.stx_mode); number != 0)
     return tl::unexpected(posixError(number, path.native()));
   WallTime created = timeOf(status.stx_mtime);
   if ((status.stx_mask & STATX_BTIME) != 0) created = std::min(created, timeOf(status.stx_btime));
-  return FileAttributes{status.stx_size, created};
+  return FileAttributes{status.stx_size, created, status.stx_uid == geteuid()};
 }
 
 Expected<std::uint64_t> HostAppendableFile::size() {

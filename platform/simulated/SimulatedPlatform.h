@@ -1,8 +1,8 @@
 #pragma once
 
 #include "platform/ConfiguredServiceProxy.h"
-#include "platform/ICUWordTokenizer.h"
 #include "platform/DeepLinkSpool.h"
+#include "platform/ICUWordTokenizer.h"
 #include "platform/NotificationCenter.h"
 #include "platform/Platform.h"
 #include "platform/ScriptLanguageTagger.h"
