@@ -65,7 +65,6 @@ class BackgroundTransfers::Core : public std::enable_shared_from_this<Core> {
   void finished(std::int64_t identifier, int attempts, HTTPResult result);
   void again(Entry& entry, Duration pause, const std::string& why);
   void end(Entry& entry, std::optional<Error> error);
-  void endAndGoOn(Entry& entry, std::optional<Error> error);
   void report(const BackgroundTransfer& transfer);
   void tellDelegate(const BackgroundTransfer& transfer);
   void reported(const BackgroundTransfer& transfer);
@@ -233,14 +232,14 @@ void BackgroundTransfers::Core::finished(std::int64_t identifier, int attempts, 
   if (result.response) entry.transfer.task.currentURL = result.response->url;
   entry.transfer.task.response = std::move(result.response);
   if (result.error) {
-    if (!isWorthRetrying(*result.error)) return endAndGoOn(entry, std::move(result.error));
+    if (!isWorthRetrying(*result.error)) return end(entry, std::move(result.error));
     return again(entry, retryPause(attempts, chance()), result.error->description());
   }
   const HTTPResponse& response = *entry.transfer.task.response;
   const auto asked = retryAfter(response, runtime_.now());
   const Duration pause = asked ? retryPauseAsked(*asked, attempts, chance()) : Duration{};
   // Who is told to come back when it is too late takes that for the answer.
-  if (!asked || later(runtime_.ticks(), pause) >= entry.deadline) return endAndGoOn(entry, std::nullopt);
+  if (!asked || later(runtime_.ticks(), pause) >= entry.deadline) return end(entry, std::nullopt);
   again(entry, pause, "status " + std::to_string(response.status));
 }
 
@@ -265,11 +264,6 @@ void BackgroundTransfers::Core::end(Entry& entry, std::optional<Error> error) {
   report(entry.transfer);
 }
 
-void BackgroundTransfers::Core::endAndGoOn(Entry& entry, std::optional<Error> error) {
-  end(entry, std::move(error));
-  goOn();
-}
-
 void BackgroundTransfers::Core::report(const BackgroundTransfer& transfer) {
   callbackQueue_->async([self = shared_from_this(), transfer] {
     if (self->closed_) return;
@@ -290,6 +284,7 @@ void BackgroundTransfers::Core::reported(const BackgroundTransfer& transfer) {
   host_->noteReported(transfer);
   entries_.erase(transfer.task.identifier);
   rest();
+  goOn();  // one less runs
   if (!entries_.empty()) return;
   callbackQueue_->async([self = shared_from_this()] {
     if (!self->closed_) self->delegate_.didFinishEventsForBackgroundURLSession();
@@ -300,7 +295,7 @@ void BackgroundTransfers::Core::cancel(std::int64_t identifier) {
   const auto found = entries_.find(identifier);
   if (closed_ || found == entries_.end() || found->second.transfer.ended) return;
   if (found->second.attempt) found->second.attempt->cancel();
-  endAndGoOn(found->second, httpError(HTTPErrorCode::cancelled, "cancelled"));
+  end(found->second, httpError(HTTPErrorCode::cancelled, "cancelled"));
 }
 
 void BackgroundTransfers::Core::tell(Function<void(std::vector<HTTPBackgroundTask>)> completion) {

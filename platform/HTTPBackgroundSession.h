@@ -90,7 +90,8 @@ class HTTPBackgroundSession {
   virtual void resume(std::int64_t identifier) = 0;
   /// Ends it with HTTPErrorCode::cancelled unless it has ended already.
   virtual void cancel(std::int64_t identifier) = 0;
-  /// The tasks that have not ended, on callbackQueue().
+  /// The tasks that have not ended, on callbackQueue(): nobody may wait for them whom a delegate's call
+  /// waits for.
   virtual void getAllTasks(Function<void(std::vector<HTTPBackgroundTask>)> completion) = 0;
 
   virtual SerialQueue& callbackQueue() = 0;

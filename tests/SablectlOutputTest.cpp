@@ -9,6 +9,7 @@
 #include "tools/sablectl/RequestRecord.h"
 #include "tools/sablectl/StreamRows.h"
 #include "tools/sablectl/Text.h"
+#include "tools/sablectl/UploadsCommand.h"
 
 // What sablectl makes of what comes from outside: nothing harmful, columns that hold, and a JSON
 // form that others read.
@@ -48,6 +49,12 @@ TEST(Text, IsMeasuredAndCutInColumns) {
   EXPECT_EQ(aligned({{"日", "b"}, {"long", "c"}, {"x", ""}}),
             (std::vector<std::string>{"日    b", "long  c", "x"}));
   EXPECT_EQ(characters("ae\u0301日"), (std::vector<std::string>{"a", "e\u0301", "日"}));
+}
+
+TEST(Uploads, AreInflatedWholeOrNotAtAll) {
+  using namespace std::string_literals;
+  EXPECT_EQ(inflateUpload("\x8b\x8e\x05\x00"s).value(), "[]");
+  for (const auto& bad : {""s, "\x8b"s, "\x8b\x8e"s, "no stream"s}) EXPECT_FALSE(inflateUpload(bad)) << bad;
 }
 
 TEST(ImageFile, TypesAreToldByTheFirstBytes) {
