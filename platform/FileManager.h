@@ -74,9 +74,6 @@ class FileManager {
 
   virtual Expected<void> remove(const std::filesystem::path& path) = 0;
 
-  /// Gives a file another name in its folder, at once and as a whole; what had that name is gone.
-  virtual Expected<void> rename(const std::filesystem::path& path, const std::string& name) = 0;
-
   /// The folder for files that nobody misses after the process, created (0700) when missing.
   virtual Expected<std::filesystem::path> temporaryDirectory() = 0;
   /// Makes an empty file, 0600, and returns its path: `path` with its last six letters, "XXXXXX",

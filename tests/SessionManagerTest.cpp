@@ -2,6 +2,7 @@
 
 #include "SableKit/SBLError.h"
 #include "platform/NotificationCenter.h"
+#include "sabled/BackgroundFlusher.h"
 #include "sabled/ClientConnection.h"
 #include "sabled/ClientSession.h"
 #include "sabled/ClientSessionManager.h"
@@ -26,6 +27,7 @@ class Sessions : public testing::Test {
   void start(bool shared = true) {
     device.platform.userDefaults().setByUser("SBLSharedSession", shared);
     device.start();
+    device.assembly().backgroundFlusher->setStopFlushing(true);  // the files are read here
     ended();  // the bag's fetch was one
     for (const auto name : {kSBLSessionSoftLimitNotification, kSBLSessionMaxLimitNotification,
                             kSBLUserGUIDChangeNotification}) {

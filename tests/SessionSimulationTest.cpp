@@ -8,6 +8,7 @@
 #include "SableKit/SBLBag.h"
 #include "SableKit/SBLFeedbackLedger.h"
 #include "platform/LocaleInfo.h"
+#include "sabled/BackgroundFlusher.h"
 #include "sabled/ClientSession.h"
 #include "sabled/ClientSessionManager.h"
 #include "sabled/ClientState.h"
@@ -62,7 +63,7 @@ class Week {
   explicit Week(const Setting& setting) : chance_(setting.seed), device_(setting.seed) {
     device_.platform.userDefaults().setByUser("SBLSharedSession", setting.shared);
     device_.platform.userDefaults().setByUser("SBLSessionSizeLimit", setting.sizeLimit);
-    device_.start();
+    startDaemon();
   }
 
   Seen run() {
@@ -172,6 +173,12 @@ class Week {
     device_.advance(1s);
   }
 
+  /// The files are read here: nothing may upload them.
+  void startDaemon() {
+    device_.start();
+    assembly().backgroundFlusher->setStopFlushing(true);
+  }
+
   /// Reports are on their way when the daemon ends, each as far as chance would have it.
   void killInTheMiddle() {
     for (auto count = chance_() % 6; count > 0; --count)
@@ -181,7 +188,7 @@ class Week {
     device_.killDaemon();
     for (Client& client : clients_) client.connection = nullptr, client.mayHaveUsed = true;
     const auto tooOld = device_.counter("filetooold");
-    device_.start();
+    startDaemon();
     if (device_.counter("filetooold") > tooOld) allowGaps();
     wasKilled_ = true;
     ++seen_.kills;

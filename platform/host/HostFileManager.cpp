@@ -172,16 +172,6 @@ Expected<void> HostFileManager::remove(const Path& path) {
   return {};
 }
 
-Expected<void> HostFileManager::rename(const Path& path, const std::string& name) {
-  const auto folder = openTrustedFolder(path.parent_path(), MissingFolders::fail);
-  if (!folder) return tl::unexpected(folder.error());
-  const std::string oldName = path.filename();
-  if (renameat(folder->number(), oldName.c_str(), folder->number(), name.c_str()) != 0) {
-    return failed(errno, path);
-  }
-  return {};
-}
-
 Expected<Path> HostFileManager::temporaryDirectory() {
   if (auto created = createDirectory(folders_.temporary()); !created) {
     return tl::unexpected(std::move(created.error()));

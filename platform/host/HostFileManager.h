@@ -19,7 +19,6 @@ class HostFileManager final : public FileManager {
   Expected<void> replaceItem(const std::filesystem::path& path,
                              const std::filesystem::path& replacement) override;
   Expected<void> remove(const std::filesystem::path& path) override;
-  Expected<void> rename(const std::filesystem::path& path, const std::string& name) override;
   Expected<std::filesystem::path> temporaryDirectory() override;
   Expected<std::filesystem::path> createUniqueFile(const std::filesystem::path& path) override;
   Expected<void> createFile(const std::filesystem::path& path) override;

@@ -29,6 +29,7 @@ class SimulatedFileManager::Appendable final : public AppendableFile {
     return (*file)->size();
   }
   Expected<void> append(std::string_view head, std::string_view body) override {
+    if (auto checked = files_.check(path_, true); !checked) return checked;
     const auto file = files_.find(path_);
     if (file) (*file)->append(head).append(body);
     if (!file && file.error().code != ENOENT) return tl::unexpected(file.error());
@@ -69,13 +70,15 @@ class SimulatedFileManager::Readable final : public ReadableFile {
   const Path path_;
 };
 
-Expected<void> SimulatedFileManager::check(const Path& path) const {
-  if (failure_ != 0) return failed(failure_, path);
+Expected<void> SimulatedFileManager::check(const Path& path, bool needsRoom) const {
+  if (failure_ == 0 || (failure_ == ENOSPC && !needsRoom)) return {};
+  if (operationsLeft_ == 0) return failed(failure_, path);
+  --operationsLeft_;
   return {};
 }
 
 Expected<std::string*> SimulatedFileManager::find(const Path& path) {
-  if (auto checked = check(path); !checked) return tl::unexpected(checked.error());
+  if (auto checked = check(path, false); !checked) return tl::unexpected(checked.error());
   const Path file = path.lexically_normal();
   if (const auto found = files_.find(file); found != files_.end()) return &found->second;
   return failed(directories_.contains(file) ? EISDIR : ENOENT, path);
@@ -88,7 +91,7 @@ Expected<Path> SimulatedFileManager::cachesDirectory() {
 }
 
 Expected<void> SimulatedFileManager::createDirectory(const Path& path) {
-  if (auto checked = check(path); !checked) return checked;
+  if (auto checked = check(path, true); !checked) return checked;
   Path folder;
   for (const Path& component : path.lexically_normal()) {
     folder /= component;
@@ -106,7 +109,7 @@ Expected<std::string> SimulatedFileManager::read(const Path& path, std::size_t m
 }
 
 Expected<void> SimulatedFileManager::writeAtomically(const Path& path, std::string_view bytes) {
-  if (auto checked = check(path); !checked) return checked;
+  if (auto checked = check(path, true); !checked) return checked;
   const Path file = path.lexically_normal();
   if (directories_.contains(file)) return failed(EISDIR, path);
   if (!directories_.contains(file.parent_path())) return failed(ENOENT, path);
@@ -118,28 +121,22 @@ Expected<void> SimulatedFileManager::writeAtomically(const Path& path, std::stri
 Expected<void> SimulatedFileManager::replaceItem(const Path& path, const Path& replacement) {
   const auto from = find(replacement);
   if (!from) return tl::unexpected(from.error());
-  const auto created = creationDates_.at(replacement.lexically_normal());
-  if (auto written = writeAtomically(path, **from); !written) return written;
-  creationDates_.insert_or_assign(path.lexically_normal(), created);
-  return path.lexically_normal() == replacement.lexically_normal() ? Expected<void>() : remove(replacement);
-}
-
-Expected<void> SimulatedFileManager::remove(const Path& path) {
-  if (auto checked = check(path); !checked) return checked;
-  const Path file = path.lexically_normal();
-  if (directories_.contains(file)) return failed(EISDIR, path);
-  if (files_.erase(file) == 0) return failed(ENOENT, path);
+  const Path source = replacement.lexically_normal(), target = path.lexically_normal();
+  if (directories_.contains(target)) return failed(EISDIR, path);
+  if (!directories_.contains(target.parent_path())) return failed(ENOENT, path);
+  if (source == target) return {};
+  // At once, as a rename: whoever is killed has done all of it or nothing.
+  creationDates_.insert_or_assign(target, creationDates_.at(source));
+  files_.insert_or_assign(target, std::move(**from));
+  files_.erase(source);
   return {};
 }
 
-Expected<void> SimulatedFileManager::rename(const Path& path, const std::string& name) {
-  const auto file = find(path);
-  if (!file) return tl::unexpected(file.error());
-  const Path from = path.lexically_normal(), to = from.parent_path() / name;
-  if (directories_.contains(to)) return failed(EISDIR, path);
-  files_.insert_or_assign(to, std::move(**file));
-  creationDates_.insert_or_assign(to, creationDates_.at(from));
-  if (from != to) files_.erase(from);
+Expected<void> SimulatedFileManager::remove(const Path& path) {
+  if (auto checked = check(path, false); !checked) return checked;
+  const Path file = path.lexically_normal();
+  if (directories_.contains(file)) return failed(EISDIR, path);
+  if (files_.erase(file) == 0) return failed(ENOENT, path);
   return {};
 }
 
@@ -182,7 +179,7 @@ Expected<FileAttributes> SimulatedFileManager::attributes(const Path& path) {
 }
 
 Expected<std::vector<std::string>> SimulatedFileManager::list(const Path& path) {
-  if (auto checked = check(path); !checked) return tl::unexpected(checked.error());
+  if (auto checked = check(path, false); !checked) return tl::unexpected(checked.error());
   const Path folder = path.lexically_normal();
   if (!directories_.contains(folder)) return failed(files_.contains(folder) ? ENOTDIR : ENOENT, path);
   std::set<std::string> names;

@@ -22,7 +22,6 @@ class SimulatedFileManager final : public FileManager {
   Expected<void> replaceItem(const std::filesystem::path& path,
                              const std::filesystem::path& replacement) override;
   Expected<void> remove(const std::filesystem::path& path) override;
-  Expected<void> rename(const std::filesystem::path& path, const std::string& name) override;
   Expected<std::filesystem::path> temporaryDirectory() override;
   Expected<std::filesystem::path> createUniqueFile(const std::filesystem::path& path) override;
   Expected<void> createFile(const std::filesystem::path& path) override;
@@ -31,8 +30,16 @@ class SimulatedFileManager final : public FileManager {
   Expected<FileAttributes> attributes(const std::filesystem::path& path) override;
   Expected<std::vector<std::string>> list(const std::filesystem::path& path) override;
 
-  /// From now on every operation fails with this errno value; 0 ends that.
-  void failWith(int number) { failure_ = number; }
+  /// From now on every operation fails with this errno value, or, with ENOSPC, every one that needs room;
+  /// 0 ends that.
+  void failWith(int number) { failAfter(0, number); }
+  /// The same, but `operations` more are done before.
+  void failAfter(int operations, int number) {
+    operationsLeft_ = operations;
+    failure_ = number;
+  }
+  /// Whether an operation has failed for that.
+  bool hasFailed() const { return failure_ != 0 && operationsLeft_ == 0; }
 
   const std::map<std::filesystem::path, std::string>& files() const { return files_; }
   const std::set<std::filesystem::path>& directories() const { return directories_; }
@@ -41,7 +48,7 @@ class SimulatedFileManager final : public FileManager {
   class Appendable;
   class Readable;
 
-  Expected<void> check(const std::filesystem::path& path) const;
+  Expected<void> check(const std::filesystem::path& path, bool needsRoom) const;
   Expected<std::string*> find(const std::filesystem::path& path);
 
   const Runtime& clock_;
@@ -49,6 +56,7 @@ class SimulatedFileManager final : public FileManager {
   std::map<std::filesystem::path, WallTime> creationDates_;
   std::set<std::filesystem::path> directories_{"/"};
   int failure_ = 0;
+  mutable int operationsLeft_ = 0;  ///< that are still done before
   unsigned uniqueNames_ = 0;
 };
 

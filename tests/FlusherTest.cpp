@@ -1,0 +1,364 @@
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <openssl/evp.h>
+#include <zlib.h>
+
+#include <cerrno>
+
+#include "SableKit/SBLFeedbackLedger.h"
+#include "sabled/BackgroundFlusher.h"
+#include "sabled/ClientSession.h"
+#include "sabled/ClientSessionManager.h"
+#include "sabled/FileContainer.h"
+#include "sabled/SableFeedbackFlusher.h"
+#include "sabled/SablePersistentStorage.h"
+#include "tests/support/Feedback.h"
+#include "tests/support/VirtualDevice.h"
+
+// What becomes of sessions: the uploads that the service sees, on the whole daemon in virtual time.
+namespace sable::test {
+namespace {
+
+using platform::HTTPErrorCode;
+using platform::simulated::RecordedRequest;
+using testing::Contains;
+using testing::ElementsAre;
+using testing::EndsWith;
+using testing::IsEmpty;
+using testing::Not;
+using testing::UnorderedElementsAreArray;
+
+std::string inflated(const std::string& raw) {
+  z_stream stream{};
+  EXPECT_EQ(inflateInit2(&stream, -MAX_WBITS), Z_OK);
+  std::string text(1u << 20, '\0');
+  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(raw.data()));
+  stream.avail_in = static_cast<uInt>(raw.size());
+  stream.next_out = reinterpret_cast<Bytef*>(text.data());
+  stream.avail_out = static_cast<uInt>(text.size());
+  EXPECT_EQ(inflate(&stream, Z_FINISH), Z_STREAM_END);
+  text.resize(stream.total_out);
+  inflateEnd(&stream);
+  return text;
+}
+
+std::string sha512(const std::string& bytes) {
+  std::array<unsigned char, 64> digest{};
+  EVP_Digest(bytes.data(), bytes.size(), digest.data(), nullptr, EVP_sha512(), nullptr);
+  std::string text;
+  for (const unsigned char byte : digest) text += fmt::format("{:02x}", byte);
+  return text;
+}
+
+/// What was searched for in the uploads.
+std::vector<std::string> searchesIn(const std::vector<RecordedRequest>& uploads) {
+  std::vector<std::string> inputs;
+  for (const auto& upload : uploads) {
+    const json envelope = json::parse(inflated(*upload.request.body));
+    for (const json& record : envelope["fb"]) {
+      if (record["type"] == "search_start") inputs.push_back(record["input"]);
+    }
+  }
+  return inputs;
+}
+
+class Flusher : public testing::Test {
+ protected:
+  Flusher() {
+    device.bag["feedback_url"] = "https://service.test/feedback?old=1";
+    device.bag["crowdsourcing_url"] = "https://service.test/crowd";
+    for (const char* path : {"/feedback", "/crowd"}) device.service.on(path, answering("{}"));
+  }
+
+  /// Starts the daemon; what its own bag fetch leaves is gone.
+  void start() {
+    device.start();
+    for (const auto& container : storage().getAvailableSessionHandles())
+      storage().deleteSessionWithFileContainer(container);
+  }
+  SablePersistentStorage& storage() { return *device.assembly().persistentStorage; }
+  BackgroundFlusher& flusher() { return *device.assembly().backgroundFlusher; }
+  /// A complete session with a search for each input.
+  void session(const std::vector<std::string>& inputs) {
+    ClientSession session(device.assembly(), search(inputs.front()));
+    for (std::size_t i = 1; i < inputs.size(); ++i) session.addFeedback(search(inputs[i]));
+    session.sessionComplete();
+    device.run();
+  }
+  static std::shared_ptr<SableFeedback> search(const std::string& input) {
+    return feedbackFromJSON("RKStartSearchFeedback", R"({"input": ")" + input + "\"}");
+  }
+  /// Uploads what there is, now.
+  void flush() {
+    flusher().insertFlushActivity(0);
+    device.advance(5s);
+  }
+  std::vector<RecordedRequest> uploads(std::string_view path = "/feedback") {
+    return device.service.requests(path);
+  }
+  std::vector<std::string> uploaded(std::string_view path = "/feedback") { return searchesIn(uploads(path)); }
+  /// Files of sessions, and of their uploads.
+  std::vector<std::string> files() {
+    std::vector<std::string> names;
+    for (const auto& [path, bytes] : device.platform.fileManager().files()) {
+      const std::string name = path.filename();
+      const std::string prefix = name.substr(0, name.find_first_of("._"));
+      if (prefix == "session" || prefix == "flushing" || prefix == "crowdsourcing" || prefix == "flusher")
+        names.push_back(prefix);
+    }
+    return names;
+  }
+  SBLFeedbackLedger ledger() { return SBLFeedbackLedger(device.platform.tally().snapshot()); }
+
+  VirtualDevice device;
+};
+
+TEST_F(Flusher, ASessionIsUploadedAsItsEnvelopeWithTheDigestOfItsText) {
+  start();
+  VirtualClient& client = device.client();
+  client.search("we");
+  device.assembly().clientSessionManager->flushSession(nullptr);
+  device.advance(11min);
+  ASSERT_EQ(uploads().size(), 1u);
+  const auto request = uploads()[0].request;
+  const auto url = *platform::URL::parse(request.url);
+  EXPECT_EQ(request.method, "POST");
+  EXPECT_THAT(url.queryItems(), Contains(platform::URLQueryItem{"v", "2"}));
+  EXPECT_EQ(request.url.find("old"), std::string::npos);
+  EXPECT_EQ(*request.headers.find("Content-Encoding"), "deflate");
+  const std::string text = inflated(*request.body);
+  EXPECT_EQ(*request.headers.find("X-Kestrel-Digest"), sha512(text));
+
+  const json envelope = json::parse(text);
+  std::vector<std::string> keys, types;
+  for (const auto& [key, value] : envelope.items()) keys.push_back(key);
+  EXPECT_THAT(keys, ElementsAre("fb", "agent", "user_guid", "resource_versions", "first_use", "base_time",
+                                "previous_session_end_reason"));
+  EXPECT_THAT(std::string(envelope["agent"]), EndsWith(" Beacon/1"));
+  for (const json& record : envelope["fb"]) types.push_back(record["type"]);
+  EXPECT_THAT(types, ElementsAre("network_search_start", "network_search_end", "session_end"));
+  EXPECT_EQ(text, envelope.dump()) << "compact";
+
+  EXPECT_EQ(device.counter("feedbacksent"), 3);
+  EXPECT_EQ(ledger()[SBLLedgerEntry::uploaded], 3);
+  EXPECT_EQ(ledger().sending(), 0);
+  EXPECT_THAT(files(), Not(Contains(testing::StartsWith("fl"))));
+  for (const char* line :
+       {"started flush to wire in the background com.kestrel.sabled.flusher.background with interval "
+        "600.000000 seconds",
+        "scheduled flush feedbacks to wire com.kestrel.sabled.flusher.background",
+        "Initialize flusher for Feedbacks", "Initialize flusher for crowdsourcing",
+        "bag change notification received", "new endpoint: https://service.test/feedback?v=2",
+        "Sessions Flushed 1", "flushing to ", "File removed ",
+        "URLSession:task:didCompleteWithError: id=1, error=(null)",
+        "URLSessionDidFinishEventsForBackgroundURLSession called"})
+    EXPECT_TRUE(device.log.contains(line)) << line;
+  EXPECT_EQ(device.platform.transactions().openCount("_flusherActivity"), 0u);
+  EXPECT_GT(device.platform.transactions().openedCount("_flusherActivity"), 0u);
+}
+
+TEST_F(Flusher, WhatIsWrittenPieceByPieceIsTheEnvelopesJSON) {
+  start();
+  const auto results = feedbackFromJSON(
+      "RKVisibleResultsFeedback", R"({"results": [{"identifier": "a"}, {"identifier": "b\u0001\u20ac"}]})");
+  for (const bool isEmpty : {false, true}) {
+    ClientSession session(device.assembly(), isEmpty ? nullptr : search("we"));
+    if (!isEmpty) session.addFeedback(results);
+    session.sessionComplete();
+    std::string written;
+    EXPECT_TRUE(session.storageHandle()->read()->writeFeedbacksToSend([&](std::string_view text) {
+      written += text;
+      return true;
+    }));
+    EXPECT_EQ(written, compactJSON(session.storageHandle()->read()->getFeedbacksToSend()));
+  }
+}
+
+TEST_F(Flusher, OnlyA200CountsAsSentAndNothingElseIsTriedAgain) {
+  start();
+  session({"a", "b"});
+  device.service.on("/feedback", answering("{}", 500));
+  flush();
+  EXPECT_EQ(device.counter("feedbacksent"), 0);
+  EXPECT_EQ(device.counter("feedbacknotsent"), 2);
+  EXPECT_EQ(ledger()[SBLLedgerEntry::refused], 2);
+  EXPECT_TRUE(device.log.contains("response error 500 "));
+  device.advance(30min);
+  EXPECT_EQ(uploads().size(), 1u);
+
+  session({"c"});
+  platform::simulated::Scripted late;
+  late.error = HTTPErrorCode::timedOut;
+  device.service.on("/feedback", late);
+  flush();
+  device.advance(8 * 24h);
+  EXPECT_EQ(device.counter("fbrequesttimedout"), 1) << "when the upload's week is over";
+  EXPECT_EQ(device.counter("feedbacknotsent"), 3);
+  EXPECT_EQ(ledger()[SBLLedgerEntry::refused], 3);
+}
+
+TEST_F(Flusher, WithoutAnEndpointSessionsArePackedAndDropped) {
+  for (const bool enabled : {true, false}) {
+    VirtualDevice other;
+    other.bag["feedback_enabled"] = enabled;
+    if (!enabled) other.bag["feedback_url"] = "https://service.test/feedback";
+    other.start();
+    ClientSession session(other.assembly(), search("a"));
+    session.sessionComplete();
+    other.log.clear();
+    other.assembly().backgroundFlusher->insertFlushActivity(0);
+    other.advance(5s);
+    EXPECT_TRUE(other.log.contains("Server endpoint not set, data can't be sent to server"));
+    EXPECT_TRUE(other.log.contains("flushing to "));
+    EXPECT_TRUE(other.log.contains("File removed "));
+    EXPECT_TRUE(other.platform.httpSessions().pendingTransfers().empty());
+    EXPECT_TRUE(other.assembly().persistentStorage->getAvailableSessionHandles().empty());
+    EXPECT_GE(SBLFeedbackLedger(other.platform.tally().snapshot())[SBLLedgerEntry::unsent], 1);
+  }
+}
+
+TEST_F(Flusher, StoppedRunsLeaveTheFilesWhereTheyAre) {
+  start();
+  session({"a"});
+  flusher().setStopFlushing(true);
+  device.advance(25min);
+  EXPECT_THAT(files(), ElementsAre("session"));
+  EXPECT_TRUE(device.log.contains("flushing has been stopped, will start again with dump command"));
+  flusher().setStopFlushing(false);
+  device.advance(15min);
+  EXPECT_THAT(uploaded(), ElementsAre("a"));
+}
+
+TEST_F(Flusher, AFileThatCannotBeReadIsDroppedAndTheOthersGo) {
+  start();
+  session({"a"});
+  const auto damaged = storage().getAvailableSessionHandles()[0]->fileUrl();
+  session({"b"});
+  ASSERT_TRUE(device.platform.fileManager().writeAtomically(damaged, "no session"));
+  session({"c"});
+  ASSERT_TRUE(device.platform.fileManager().remove(storage().getAvailableSessionHandles()[2]->fileUrl()));
+  flush();
+  EXPECT_THAT(uploaded(), ElementsAre("b"));
+  EXPECT_THAT(files(), IsEmpty());
+  EXPECT_TRUE(storage().getAvailableSessionHandles().empty());
+}
+
+TEST_F(Flusher, CrowdsourcingHasItsOwnFilesAndAddress) {
+  start();
+  ClientSession session(device.assembly(),
+                        feedbackFromJSON("RKStartSearchFeedback", R"({"input": "crowd"})"));
+  storage().closeCrowdsourcingSessionWithFileContainer(session.storageHandle());
+  device.run();
+  EXPECT_THAT(files(), ElementsAre("crowdsourcing"));
+  device.killDaemon();
+  device.start();
+  flush();
+  EXPECT_THAT(uploaded("/crowd"), ElementsAre("crowd"));
+  EXPECT_EQ(uploaded("/feedback"), std::vector<std::string>());
+  EXPECT_THAT(files(), IsEmpty());
+}
+
+TEST_F(Flusher, WithoutRoomOnTheDiskSessionsWaitForTheNextRun) {
+  start();
+  session({"a", "b"});
+  device.platform.httpSessions().failAccepting(ENOSPC);
+  flush();
+  EXPECT_TRUE(
+      device.log.contains("Error creating Upload Task. Exception POSIXErrorDomain occurred for reason"));
+  EXPECT_THAT(files(), ElementsAre("flushing"));
+  device.platform.httpSessions().failAccepting(0);
+  for (int operations = 0; operations < 12; ++operations) {
+    device.platform.fileManager().failAfter(operations, ENOSPC);
+    flush();
+    device.platform.fileManager().failWith(0);
+  }
+  EXPECT_TRUE(device.log.contains("Error creating file to write feedbacks to disk"));
+  EXPECT_TRUE(device.log.contains("Invalid JSON Object Beacon/1 error POSIXErrorDomain"));
+  flush();
+  EXPECT_THAT(uploaded(), ElementsAre("a", "b"));
+}
+
+TEST_F(Flusher, CountsOfUploadsOutliveTheProcess) {
+  start();
+  session({"a", "b", "c"});
+  platform::simulated::Scripted unreachable;
+  unreachable.error = HTTPErrorCode::cannotConnect;
+  device.service.on("/feedback", unreachable);
+  flush();
+  EXPECT_EQ(ledger().sending(), 3);
+  device.killDaemon();
+  device.service.on("/feedback", answering("{}"));
+  device.start();
+  device.advance(2h);
+  EXPECT_EQ(device.counter("feedbacksent"), 3);
+  EXPECT_EQ(ledger().sending(), 0);
+  EXPECT_EQ(ledger()[SBLLedgerEntry::lostSending], 0);
+}
+
+TEST_F(Flusher, AKillAtAnyMomentNeitherLosesASessionNorSendsItTwice) {
+  // What the disk does not take any more is what a killed process has not done.
+  for (int operations = 0;; ++operations) {
+    VirtualDevice other;
+    other.bag["feedback_url"] = "https://service.test/feedback";
+    other.service.on("/feedback", answering("{}"));
+    other.start();
+    for (const char* input : {"a", "b", "c"}) {
+      ClientSession session(other.assembly(), search(input));
+      session.sessionComplete();
+    }
+    other.run();
+    other.platform.fileManager().failAfter(operations, EIO);
+    other.assembly().backgroundFlusher->insertFlushActivity(0);
+    other.advance(5s);  // so that no upload is on its way, which would begin anew
+    const bool wasKilled = other.platform.fileManager().hasFailed();
+    other.killDaemon();
+    other.platform.fileManager().failWith(0);
+    other.start();
+    other.advance(20min);
+
+    const auto inputs = searchesIn(other.service.requests("/feedback"));
+    EXPECT_THAT(inputs, UnorderedElementsAreArray({"a", "b", "c"})) << operations;
+    const SBLFeedbackLedger ledger(other.platform.tally().snapshot());
+    EXPECT_EQ(ledger.sending(), 0) << operations;
+    EXPECT_EQ(ledger.stored(), 0) << operations;
+    for (const auto& [path, bytes] : other.platform.fileManager().files())
+      EXPECT_FALSE(path.filename().string().starts_with("fl")) << path << " after " << operations;
+    if (wasKilled) continue;
+    EXPECT_GT(operations, 20);
+    return;
+  }
+}
+
+TEST_F(Flusher, ItsBufferAndItsAddresses) {
+  start();
+  SableFeedbackFlusher feedbacks(device.assembly(), 1), odd(device.assembly(), 2);
+  const auto session = std::make_shared<ClientSession>(device.assembly(), search("a"));
+  bool called = false;
+  feedbacks.flush(session, [&] { called = true; });
+  EXPECT_FALSE(called);
+  device.run();
+  EXPECT_TRUE(called);
+  feedbacks.flushSyncFromArray({session});
+  EXPECT_EQ(feedbacks.countOfDatabuffer(), 2u);
+  EXPECT_EQ(feedbacks.sessionBuffer()[1], session);
+  feedbacks.dropFeedbacks();
+  device.run();
+  EXPECT_EQ(feedbacks.countOfDatabuffer(), 0u);
+  EXPECT_TRUE(feedbacks.flushToWireSync(true).empty()) << "no file, no upload";
+  EXPECT_TRUE(files() == std::vector<std::string>{"session"});
+
+  feedbacks.flushSyncFromArray({session});
+  const auto envelopes = feedbacks.flushToWireSync(true);
+  ASSERT_EQ(envelopes.size(), 1u);
+  EXPECT_EQ(json::parse(envelopes[0])["agent"], "Beacon/1");
+  EXPECT_TRUE(odd.flushToWireSync(false).empty());
+  EXPECT_TRUE(device.log.contains("Initialize flusher for "));
+
+  const auto endpoint = SableFeedbackFlusher::getServerEndpointForFeedback;
+  EXPECT_EQ(endpoint("https://service.test/a?b=c&d"), "https://service.test/a?v=2");
+  EXPECT_EQ(endpoint("https://service.test/a"), "https://service.test/a?v=2");
+  EXPECT_FALSE(endpoint("no URL") || endpoint(std::nullopt));
+}
+
+}  // namespace
+}  // namespace sable::test
