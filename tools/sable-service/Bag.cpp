@@ -2,8 +2,8 @@
 
 #include <fmt/format.h>
 
+#include <algorithm>
 #include <array>
-#include <map>
 
 namespace service {
 
@@ -61,11 +61,15 @@ const std::map<std::string, std::string> kResources = {
 
 }  // namespace
 
-Bag::Bag(const std::string& base) : keys_(builtIn(base)), resources_(kResources) {
-  for (const auto& [identifier, content] : resources_) {
-    keys_["download_resources_list"].push_back(identifier);
-    keys_[identifier] = base + "/resources/" + identifier;
-  }
+Bag::Bag(std::string base) : base_(std::move(base)), keys_(builtIn(base_)) {
+  for (const auto& [identifier, resource] : resources_.all()) list(identifier);
+}
+
+void Bag::list(const std::string& identifier) {
+  Json& listed = keys_["download_resources_list"];
+  if (!listed.is_array()) listed = Json::array();
+  if (std::find(listed.begin(), listed.end(), Json(identifier)) == listed.end()) listed.push_back(identifier);
+  keys_[identifier] = base_ + resources_.path(identifier);
 }
 
 void Bag::merge(const Json& keys) {
@@ -75,7 +79,8 @@ void Bag::merge(const Json& keys) {
 
 void Bag::setResource(const std::string& identifier, std::string content) {
   const std::lock_guard lock(mutex_);
-  resources_[identifier] = std::move(content);
+  resources_.set(identifier, std::move(content));
+  list(identifier);
 }
 
 Answer Bag::answer(const Request& request, const std::optional<std::string>& version) {
@@ -90,9 +95,7 @@ Answer Bag::answer(const Request& request, const std::optional<std::string>& ver
 
 Answer Bag::resourceAnswer(const Request& request) {
   const std::lock_guard lock(mutex_);
-  const auto found = resources_.find(request.path.substr(std::string_view("/resources/").size()));
-  if (found == resources_.end()) return Answer::error(404, "there is no such resource");
-  return Answer::tagged(request, "application/octet-stream", found->second, "private, no-cache");
+  return resources_.answer(request);
 }
 
 }  // namespace service

@@ -4,6 +4,7 @@
 #include <string>
 
 #include "Message.h"
+#include "Resources.h"
 
 namespace service {
 
@@ -13,22 +14,26 @@ class Bag {
  public:
   /// `base` is the service's own address without a trailing slash: all URLs of the built-in bag begin with
   /// it.
-  explicit Bag(const std::string& base);
+  explicit Bag(std::string base);
 
   /// Merges the members of an object into the bag (RFC 7396).
   void merge(const Json& keys);
-  /// Replaces the content of a resource.
+  /// Gives a resource a new content, and the bag its URL: of another version, so that devices which see a new
+  /// bag fetch it.
   void setResource(const std::string& identifier, std::string content);
 
   /// GET /bag, with an entity tag. `version` stands over the bag's own.
   Answer answer(const Request& request, const std::optional<std::string>& version);
-  /// GET /resources/ID, with an entity tag.
+  /// GET /resources/...: see Resources.
   Answer resourceAnswer(const Request& request);
 
  private:
+  void list(const std::string& identifier);
+
+  const std::string base_;
   std::mutex mutex_;
+  Resources resources_;
   Json keys_;
-  std::map<std::string, std::string> resources_;
 };
 
 }  // namespace service

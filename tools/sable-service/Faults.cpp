@@ -170,7 +170,9 @@ void FaultPlan::apply(Answer& answer) const {
   }
   if (redirect) answer.headers.emplace_back("Location", *redirect);
   if (retryAfter) answer.headers.emplace_back("Retry-After", *retryAfter);
-  if (body) answer.body = *body;
+  if (!body) return;
+  answer.body = *body;
+  answer.zeros = 0;
 }
 
 }  // namespace service

@@ -34,6 +34,7 @@ struct Answer {
   int status = 200;
   std::string type = "application/json";
   std::string body;
+  size_t zeros = 0;  ///< bytes of 0 that follow the body, made while they are sent
   Pairs headers;
   Json record = Json::object();
 

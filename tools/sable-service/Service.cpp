@@ -5,6 +5,7 @@
 #include <httplib.h>
 
 #include <algorithm>
+#include <array>
 #include <chrono>
 #include <ctime>
 
@@ -23,25 +24,30 @@ double secondsNow() {
 }
 
 /// The body a piece at a time, ended early or slowed down as planned; false closes the connection.
-bool sendPart(const std::string& body, const FaultPlan& plan, size_t offset, httplib::DataSink& sink) {
+bool sendPart(const std::string& body, size_t length, const FaultPlan& plan, size_t offset,
+              httplib::DataSink& sink) {
+  static constexpr std::array<char, 65536> kZeros{};
   auto& connection = Connection::current();
-  const size_t end = std::min(body.size(), plan.truncateAfter.value_or(body.size()));
+  const size_t end = std::min(length, plan.truncateAfter.value_or(length));
   const size_t speed = plan.bytesPerSecond.value_or(0);
   const size_t piece = speed == 0 ? end : std::max<size_t>(1, speed / 10);
   if (offset >= end) return false;
-  const size_t count = std::min(piece, end - offset);
+  const bool inBody = offset < body.size();
+  const size_t count = std::min({piece, end - offset, inBody ? body.size() - offset : kZeros.size()});
   if (speed > 0 && !connection.pause(milliseconds(count * 1000 / speed))) return false;
-  return sink.write(body.data() + offset, count) && (speed == 0 || connection.flush());
+  return sink.write(inBody ? body.data() + offset : kZeros.data(), count) &&
+         (speed == 0 || connection.flush());
 }
 
 void deliver(Answer answer, const FaultPlan& plan, httplib::Response& response) {
   response.status = answer.status;
   response.set_header("Date", fmt::format("{:%a, %d %b %Y %H:%M:%S GMT}", fmt::gmtime(std::time(nullptr))));
   for (const auto& [name, value] : answer.headers) response.set_header(name, value);
-  if (plan.truncateAfter || plan.bytesPerSecond) {
-    const size_t length = answer.body.size();
-    auto send = [body = std::move(answer.body), plan](size_t offset, size_t, httplib::DataSink& sink) {
-      return sendPart(body, plan, offset, sink);
+  if (plan.truncateAfter || plan.bytesPerSecond || answer.zeros > 0) {
+    const size_t length = answer.body.size() + answer.zeros;
+    auto send = [body = std::move(answer.body), length, plan](size_t offset, size_t,
+                                                              httplib::DataSink& sink) {
+      return sendPart(body, length, plan, offset, sink);
     };
     response.set_content_provider(length, answer.type, std::move(send));
   } else if (!answer.body.empty()) {
