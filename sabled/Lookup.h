@@ -1,26 +1,37 @@
 #pragma once
 
+#include <filesystem>
+#include <map>
 #include <memory>
+#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
 
+#include "platform/DataDetectors.h"
 #include "platform/Dictionary.h"
+#include "platform/NotificationCenter.h"
 #include "platform/Runtime.h"
 
 namespace sable {
 
 namespace platform {
 class Platform;
-}
+class ReadableFile;
+}  // namespace platform
 
 class Assembly;
 struct SBLLookupRequest;
 
-/// Lookups of selected text, and which results fit the text around it. Any thread.
+/// Lookups of selected text: which results fit the text around it, and the hint files by which the
+/// device's data detectors know beforehand what a lookup would find. Each hint file that arrives is
+/// handed to them with its version as signature; at start-up those are handed over once more whose
+/// signature is not the version of what the daemon holds: a file that came while the detectors could
+/// not take it, or whose version was known only after it. Any thread.
 class Lookup {
  public:
   explicit Lookup(Assembly& assembly);
+  ~Lookup();
 
   /// Whether the user wants lookup suggestions: not "LookupSuggestionsDisabled" of the domain
   /// "com.kestrel.lookup.shared". Read anew at each call; may block on the disk.
@@ -43,8 +54,21 @@ class Lookup {
   void _drainQueue();
 
  private:
+  using Source = platform::DataDetectorSource;
+  using Versions = std::map<std::string, std::string>;
+
+  void _handleHintsFile(const platform::Notification& notification);
+  void _reprocessHintsFiles();
+
+  // On queue_.
+  void _handleHintsFile(const std::optional<std::filesystem::path>& url, Source sourceKind);
+  void _pushDDSourceFile(platform::ReadableFile& file, Source sourceKind, const std::string& version);
+  void _reprocessHintsFile(Source sourceKind, const Versions& versions);
+  Versions resourceVersions() const;
+
   Assembly& assembly_;
   const std::shared_ptr<platform::SerialQueue> queue_;
+  std::vector<platform::NotificationCenter::Token> observations_;
 };
 
 }  // namespace sable

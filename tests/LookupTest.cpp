@@ -2,7 +2,9 @@
 #include <gtest/gtest.h>
 
 #include "platform/WordTokenizer.h"
+#include "sabled/DownloadManager.h"
 #include "sabled/Lookup.h"
+#include "sabled/SableBagController.h"
 #include "tests/support/VirtualDevice.h"
 
 // Lookups of selected text on the virtual device.
@@ -222,6 +224,121 @@ TEST_F(LookupFilter, WordsAreTheLanguagesOwn) {
       << "however the mark is encoded";
   EXPECT_THAT(words("no such locale", "one two"), ElementsAre("one", "two"));
   EXPECT_THAT(words("en_US", " \n…"), ElementsAre());
+}
+
+// Hint files
+
+struct LookupHints : LookupTest {
+  static constexpr const char* kWeekly = "https://files.test/hints/weekly";
+
+  LookupHints() {
+    device.bag["download_resources_list"] = {"lookup_hints_weekly", "lookup_hints_monthly", "other"};
+    device.bag["lookup_hints_weekly"] = kWeekly;
+    device.bag["lookup_hints_monthly"] = "https://files.test/hints/monthly?version=9";
+    device.bag["other"] = "https://files.test/other?version=1";
+    device.service.on("/hints/monthly", answering("monthly words"));
+    device.service.on("/other", answering("others"));
+    publish("1");
+  }
+  /// The service has these weekly hints.
+  void publish(const std::string& number) {
+    platform::simulated::Scripted answer = answering("weekly words " + number);
+    answer.url = "https://files.test/store/en/US/" + number + "/hints";
+    device.service.on("/hints/weekly", answer);
+  }
+  void fetch() {
+    ++version;
+    device.bag["version"] = std::to_string(version);
+    device.assembly().bagController->forceFetchBag({{"bag", version}});
+    device.advance(24h);
+  }
+  std::string kept(const std::string& name) {
+    const auto found = device.platform.fileManager().files().find("/state/hints/" + name);
+    return found == device.platform.fileManager().files().end() ? "-" : found->second;
+  }
+  void post(std::string_view name, std::map<std::string, std::any> userInfo) {
+    device.platform.notificationCenter().post({name, nullptr, std::move(userInfo)});
+    device.run();
+  }
+
+  int version = 1;
+};
+
+TEST_F(LookupHints, AHintFileIsHandedOverAsItArrivesAndAgainUntilItsVersionIsKnown) {
+  device.start();
+  EXPECT_EQ(kept("2") + kept("3"), "--");
+  device.advance(24h);
+  EXPECT_EQ(kept("2"), "weekly words 1");
+  EXPECT_EQ(kept("3"), "monthly words");
+  EXPECT_TRUE(device.log.contains("processing lookup hints for location: "));
+  EXPECT_EQ(device.log.count("sourceKind: "), 2u) << "other resources are nobody's hints";
+
+  publish("2");
+  fetch();
+  EXPECT_EQ(kept("2"), "weekly words 2");
+  device.restart();
+  EXPECT_EQ(kept("2.signature"), "US-2-en");
+  EXPECT_EQ(kept("3.signature"), "9");
+  const auto before = device.log.count("requires reprocessing");
+  device.restart();
+  EXPECT_EQ(device.log.count("requires reprocessing"), before) << "versions and signatures agree";
+  EXPECT_EQ(device.log.count("reprocessing lookup hints files"), 3u);
+  EXPECT_EQ(device.log.count(platform::LogLevel::error, "Sable_LookUp"), 0u);
+}
+
+TEST_F(LookupHints, WhatTheDetectorsHaveLostOrHaveOfAnotherVersionIsHandedOverAtTheNextStart) {
+  device.start();
+  device.advance(24h);
+  device.restart();
+  for (const char* name : {"2", "2.signature", "3.signature"})
+    ASSERT_TRUE(device.platform.fileManager().remove(std::string("/state/hints/") + name));
+  ASSERT_TRUE(device.platform.fileManager().writeAtomically("/state/hints/3.signature", "8"));
+  device.log.clear();
+  device.restart();
+  EXPECT_TRUE(device.log.contains(
+      "signature ((null)) does not match version (US-1-en), DD for kind: 2 requires reprocessing"));
+  EXPECT_TRUE(
+      device.log.contains("signature (8) does not match version (9), DD for kind: 3 requires reprocessing"));
+  EXPECT_EQ(kept("2") + kept("2.signature") + kept("3.signature"), "weekly words 1US-1-en9");
+}
+
+TEST_F(LookupHints, AFileThatIsGoneOrCannotBeKeptIsToldOfAndLosesNothing) {
+  device.start();
+  device.advance(24h);
+  device.restart();
+  auto& files = device.platform.fileManager();
+  post(kSBLFileDeletedNotification, {{"identifier", std::string("lookup_hints_weekly")}});
+  EXPECT_TRUE(device.log.contains("processing lookup hints for location: (null) sourceKind: 2"));
+  EXPECT_EQ(device.log.count("error trying to open hints file: "), 1u);
+  post(kSBLFileDeletedNotification, {{"identifier", std::string("other")}});
+  post(kSBLFileDeletedNotification, {});
+  EXPECT_EQ(device.log.count("error trying to open hints file: "), 1u);
+
+  ASSERT_TRUE(files.writeAtomically("/huge", std::string((64u << 20) + 1, 'x')));
+  post(kSBLFileDownloadCompletedNotification,
+       {{"identifier", std::string("lookup_hints_weekly")}, {"url", std::filesystem::path("/huge")}});
+  EXPECT_EQ(device.log.count("failed to push data to data detectors"), 1u);
+  EXPECT_EQ(kept("2") + kept("2.signature"), "weekly words 1US-1-en");
+
+  const auto resource = std::ranges::find_if(
+      files.files(), [](const auto& file) { return file.first.filename() == "lookup_hints_weekly"; });
+  ASSERT_NE(resource, files.files().end());
+  ASSERT_TRUE(files.remove(std::filesystem::path(resource->first)));
+  ASSERT_TRUE(files.remove("/state/hints/2.signature"));
+  device.restart();
+  EXPECT_EQ(device.log.count("reprocess file doesn't exist or there was an error. file: "), 1u);
+  EXPECT_EQ(kept("2"), "weekly words 1");
+}
+
+TEST_F(LookupHints, WhileTheUserWantsNoLookupsNoHintsAreFetched) {
+  device.platform.userDefaults().setShared("com.kestrel.lookup.shared", "LookupSuggestionsDisabled", true);
+  device.start();
+  device.advance(24h);
+  EXPECT_EQ(device.sent("/hints") + device.sent("/other"), 1u);
+  EXPECT_EQ(kept("2") + kept("3"), "--");
+  device.platform.userDefaults().setShared("com.kestrel.lookup.shared", "LookupSuggestionsDisabled", false);
+  fetch();
+  EXPECT_EQ(kept("2"), "weekly words 1");
 }
 
 }  // namespace
