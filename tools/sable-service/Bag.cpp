@@ -39,26 +39,6 @@ Json builtIn(const std::string& base) {
   return bag;
 }
 
-/// Applications by number. That the list holds its entries as text is the format's.
-std::string installedAppWhitelist() {
-  Json apps = Json::object();
-  int number = 0;
-  for (const auto* name : {"org.example.Mail", "org.example.News", "org.kestrel.Reader", "firefox-esr",
-                           "org.gnome.Nautilus", "org.kde.dolphin", "vlc", "gimp"}) {
-    apps[name] = Json::array({{{"encoding_id", ++number}}});
-  }
-  return toText({{"apps", toText({{"version", "0001"}, {"apps", apps}})},
-                 {"compression", "RLE"},
-                 {"encoding", "bitmap"}});
-}
-
-// The hints name the parts of speech or the packages they are for; the clients only hand them on.
-const std::map<std::string, std::string> kResources = {
-    {"lookup_hints_weekly", "noun\nverb\n"},
-    {"lookup_hints_monthly", "adjective\nadverb\n"},
-    {"installed_app_whitelist", installedAppWhitelist()},
-};
-
 }  // namespace
 
 Bag::Bag(std::string base) : base_(std::move(base)), keys_(builtIn(base_)) {
