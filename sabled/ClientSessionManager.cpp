@@ -6,6 +6,7 @@
 #include "platform/NotificationCenter.h"
 #include "platform/Transaction.h"
 #include "sabled/Assembly.h"
+#include "sabled/BackgroundFlusher.h"
 #include "sabled/ClientSession.h"
 #include "sabled/ClientSessionShared.h"
 #include "sabled/FeedbackLedger.h"
@@ -116,6 +117,8 @@ void ClientSessionManager::Sessions::_updateState(const std::shared_ptr<SableFee
     if (!callback) callback = [this, reason] { logFlush(*reason); };
     _flushSessionWithReason(*reason, std::move(callback));
   }
+  if (transition->requestsUpload && assembly_.backgroundFlusher)
+    assembly_.backgroundFlusher->insertFlushActivity(0);
   if (transition->resetsGUID) guidController.reset();
   if (transition->beginsSession) {
     if (transition->resetsGUID) feedback->setUserGuid(guidController.currentUserGUID());

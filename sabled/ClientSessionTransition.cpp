@@ -24,7 +24,10 @@ std::optional<SessionTransition> sessionTransition(SessionEvent event, SessionSt
       if (!isOpen && !isNone) return unchanged;
       return SessionTransition{.end = SessionEndReason::externalRequest};
     case SessionEvent::criticalMemory:
-      return SessionTransition{.end = SessionEndReason::criticalMemory};
+      return SessionTransition{.end = SessionEndReason::criticalMemory, .requestsUpload = true};
+    case SessionEvent::flushRequest:
+    case SessionEvent::otherFlushRequest:
+      return SessionTransition{.requestsUpload = true, .next = state};
     case SessionEvent::idleAfterSoftLimit:
       if (!isPastLimit) return unchanged;
       return SessionTransition{.end = SessionEndReason::sessionIdle,

@@ -18,7 +18,9 @@ enum class SessionEvent : std::uint64_t {
   softLimitReached = 1,
   maxTimerExpired = 2,
   externalFlushRequest = 3,
+  flushRequest = 5,
   criticalMemory = 6,
+  otherFlushRequest = 7,   ///< the same
   idleAfterSoftLimit = 8,  ///< a feedback after a pause, past the soft limit
   guidChanged = 9,         ///< a feedback under another user GUID than the session's
   sentinelFeedback = 10,   ///< a feedback past the soft limit that concludes what the user did
@@ -28,6 +30,7 @@ enum class SessionEvent : std::uint64_t {
 struct SessionTransition {
   bool addsFeedback = false;                                     ///< to the open session
   std::optional<feedback::SessionEndReason> end = std::nullopt;  ///< of the open session, if there is one
+  bool requestsUpload = false;                                   ///< of complete sessions
   bool resetsGUID = false;
   bool beginsSession = false;  ///< with the feedback
   SessionState next = SessionState::noSession;
@@ -40,7 +43,8 @@ struct SessionTransition {
 ///     softLimitReached                       -> soft limit reached
 ///     maxTimerExpired                                          end -> no session
 ///     externalFlushRequest  -> no session    end -> no session end -> no session
-///     criticalMemory        -> no session    end -> no session end -> no session
+///     flushRequests         upload           upload            upload
+///     criticalMemory        upload           end, upload       end, upload -> no session
 ///     idleAfterSoftLimit                                       end, new GUID, begin -> active
 ///     guidChanged                            end, begin        end, begin -> active
 ///     sentinelFeedback                                         add, end, new GUID -> no session

@@ -90,23 +90,25 @@ TEST(SessionTransitions, AreThisTable) {
     if (!transition) return "none";
     std::string text = transition->addsFeedback ? "add " : "";
     if (transition->end) text += "end " + std::to_string(static_cast<unsigned>(*transition->end)) + " ";
+    if (transition->requestsUpload) text += "upload ";
     if (transition->resetsGUID) text += "reset ";
     if (transition->beginsSession) text += "begin ";
     return text + "-> " + std::to_string(static_cast<std::uint64_t>(transition->next));
   };
-  const char* const table[][4] = {// active, soft limit reached, no session, a state that is none
-                                  {"add -> 0", "add -> 1", "begin -> 0", "none"},
-                                  {"-> 1", "-> 1", "-> 2", "-> 3"},
-                                  {"-> 0", "end 3 -> 2", "-> 2", "-> 3"},
-                                  {"end 1 -> 2", "end 1 -> 2", "end 1 -> 2", "-> 3"},
-                                  {"none", "none", "none", "none"},
-                                  {"none", "none", "none", "none"},
-                                  {"end 5 -> 2", "end 5 -> 2", "end 5 -> 2", "end 5 -> 2"},
-                                  {"none", "none", "none", "none"},
-                                  {"-> 0", "end 2 reset begin -> 0", "-> 2", "-> 3"},
-                                  {"end 4 begin -> 0", "end 4 begin -> 0", "-> 2", "-> 3"},
-                                  {"-> 0", "add end 6 reset -> 2", "-> 2", "-> 3"},
-                                  {"none", "none", "none", "none"}};
+  const char* const table[][4] = {
+      // active, soft limit reached, no session, a state that is none
+      {"add -> 0", "add -> 1", "begin -> 0", "none"},
+      {"-> 1", "-> 1", "-> 2", "-> 3"},
+      {"-> 0", "end 3 -> 2", "-> 2", "-> 3"},
+      {"end 1 -> 2", "end 1 -> 2", "end 1 -> 2", "-> 3"},
+      {"none", "none", "none", "none"},
+      {"upload -> 0", "upload -> 1", "upload -> 2", "upload -> 3"},
+      {"end 5 upload -> 2", "end 5 upload -> 2", "end 5 upload -> 2", "end 5 upload -> 2"},
+      {"upload -> 0", "upload -> 1", "upload -> 2", "upload -> 3"},
+      {"-> 0", "end 2 reset begin -> 0", "-> 2", "-> 3"},
+      {"end 4 begin -> 0", "end 4 begin -> 0", "-> 2", "-> 3"},
+      {"-> 0", "add end 6 reset -> 2", "-> 2", "-> 3"},
+      {"none", "none", "none", "none"}};
   for (std::uint64_t event = 0; event < std::size(table); ++event) {
     for (std::uint64_t state = 0; state < 4; ++state)
       EXPECT_EQ(show(event, state), table[event][state]) << "event " << event << " in state " << state;
