@@ -1,5 +1,6 @@
 #include <fmt/format.h>
 
+#include <algorithm>
 #include <nlohmann/json.hpp>
 
 #include "SableKit/SBLFeedbackLedger.h"
@@ -45,6 +46,10 @@ std::string nameOf(SBLLedgerEntry entry) {
   return std::string(key.substr(key.rfind('.') + 1));
 }
 
+/// How the names of files with a session begin: one that is written or complete, one that is on its way
+/// to an upload, and one for crowd sourcing.
+constexpr std::string_view kSessionFiles[] = {"session.", "flushing.", "crowdsourcing."};
+
 struct Stock {
   std::int64_t records = 0, files = 0;
 };
@@ -54,7 +59,7 @@ Stock stockOf(const Host& host) {
   constexpr std::size_t kMaximumSessionBytes = 1u << 30;
   Stock stock;
   for (const std::string& name : host.fileManager.list(host.caches).value_or(std::vector<std::string>())) {
-    if (!name.starts_with("session.")) continue;
+    if (std::ranges::none_of(kSessionFiles, [&](auto prefix) { return name.starts_with(prefix); })) continue;
     const auto file = host.fileManager.openForReading(host.caches / name);
     const auto bytes = file ? (*file)->map(kMaximumSessionBytes) : tl::unexpected(file.error());
     if (!bytes) continue;
