@@ -2,6 +2,7 @@
 
 #include <cerrno>
 
+#include "sabled/BackgroundFlusher.h"
 #include "sabled/ClientSession.h"
 #include "sabled/ClientSessionManager.h"
 #include "sabled/FeedbackLedger.h"
@@ -28,19 +29,27 @@ class FeedbackLedger : public testing::Test {
   void handOver() {
     auto& storage = *device.assembly().persistentStorage;
     for (const auto& container : storage.getAvailableSessionHandles()) {
-      container->read();
+      const auto session = container->read();
       storage.deleteSessionWithFileContainer(container);
+      if (session)
+        ledger::count(device.platform.tally(), unsent,
+                      static_cast<std::int64_t>(session->getSessionFeedbacks().size()));
     }
+  }
+  /// One that uploads nothing by itself.
+  void startDaemon() {
+    device.start();
+    device.assembly().backgroundFlusher->setStopFlushing(true);
   }
   /// A daemon that has handed over the session of its own first fetch.
   void start() {
-    device.start();
+    startDaemon();
     handOver();
     before = counters();
   }
   void restart() {
     device.killDaemon();
-    device.start();
+    startDaemon();
   }
   SBLFeedbackLedger ledger() { return SBLFeedbackLedger(device.platform.tally().snapshot()); }
   using Counters = std::map<std::string, std::int64_t>;
@@ -111,14 +120,14 @@ TEST_F(FeedbackLedger, WhatAKillLeavesOnTheWayIsLostOrWrittenAtTheNextStart) {
     device.assembly().clientSessionManager->addSableFeedback(feedbackFromJSON("RKStartSearchFeedback", "{}"));
   device.killDaemon();
   EXPECT_EQ(ledger().waiting(), 2);
-  device.start();
+  startDaemon();
   expectEnded(lostWriting, 2);
   expectEnded(written, 3 + grown(taken) - 5);
 
   // Killed after writing, before counting.
   device.killDaemon();
   device.platform.tally().add(counterOf(written), -1);
-  device.start();
+  startDaemon();
   expectEnded(lostWriting, 2);
   expectEnded(found, 0);
 }
@@ -133,14 +142,14 @@ TEST_F(FeedbackLedger, AFileThatIsNotHandedOverSaysWhy) {
   std::string other = whole;
   other[8] = '?';
   replace(path, other);
-  device.start();
+  startDaemon();
   handOver();
   expectEnded(otherVersion, 3, 1);
 
   const auto again = [&](const std::string& bytes) {
     device.killDaemon();
     replace(path, bytes);
-    device.start();
+    startDaemon();
     EXPECT_EQ(ledger().waiting(), 0);
     handOver();
   };
@@ -157,6 +166,40 @@ TEST_F(FeedbackLedger, AFileThatIsNotHandedOverSaysWhy) {
   EXPECT_EQ(ledger().stored(), 0);
 }
 
+TEST_F(FeedbackLedger, WhatIsUploadedIsCountedByTheServicesAnswer) {
+  device.bag["feedback_url"] = "https://service.test/feedback";
+  int status = 200;
+  device.service.on("/feedback", [&](const platform::HTTPRequest&) { return answering("", status); });
+  start();
+  const auto upload = [&] {
+    report(3);
+    device.assembly().clientSessionManager->flushSession(nullptr);
+    device.run();
+    device.assembly().backgroundFlusher->insertFlushActivity(0);
+    device.advance(1min);
+    EXPECT_EQ(ledger().sending(), 0);
+    EXPECT_EQ(ledger().stored(), 0);
+    EXPECT_EQ(ledger().waiting(), 0);
+  };
+  upload();
+  expectEnded(uploaded, 4);
+  status = 500;
+  upload();
+  expectEnded(refused, 4);
+  EXPECT_EQ(grown(taken), 8);
+
+  report(3);
+  device.assembly().clientSessionManager->flushSession(nullptr);
+  device.run();
+  device.service.setDefaultLatency(1h);
+  device.assembly().backgroundFlusher->insertFlushActivity(0);
+  device.advance(1s);
+  EXPECT_EQ(ledger().sending(), 4);
+  restart();
+  EXPECT_EQ(ledger().sending() + grown(refused) + grown(uploaded), 12) << "it is still under way";
+  EXPECT_EQ(grown(lostSending), 0);
+}
+
 TEST_F(FeedbackLedger, FilesThatComeAndGoWhileNoDaemonRunsAreNoticed) {
   start();
   report(3);
@@ -164,11 +207,11 @@ TEST_F(FeedbackLedger, FilesThatComeAndGoWhileNoDaemonRunsAreNoticed) {
   const auto path = sessionFile();
   const std::string whole = bytesOf(path);
   replace(path.parent_path() / "session.77", whole);
-  device.start();
+  startDaemon();
   expectEnded(found, 3);
   device.killDaemon();
   ASSERT_TRUE(device.platform.fileManager().remove(path));
-  device.start();
+  startDaemon();
   expectEnded(missing, 3);
   device.advance(72h);
   handOver();
@@ -188,7 +231,7 @@ TEST_F(FeedbackLedger, CountersThatWereLostBeginWithWhatIsInTheFiles) {
   device.killDaemon();
   for (const auto& [key, value] : counters()) device.platform.tally().set(key, 0);
   before.clear();
-  device.start();
+  startDaemon();
   EXPECT_GE(grown(found), 3);
   EXPECT_EQ(ledger().waiting(), 0);
 }
