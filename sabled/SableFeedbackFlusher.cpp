@@ -243,9 +243,11 @@ void SableFeedbackFlusher::settle(ClientSession& session, Outcome outcome) {
   if (!container) return;
   if (outcome == Outcome::kept)
     return assembly_.persistentStorage->releaseSessionWithFileContainer(container);
-  const auto count = static_cast<std::int64_t>(session.getSessionFeedbacks().size());
   assembly_.persistentStorage->deleteSessionWithFileContainer(container);
-  if (outcome == Outcome::dropped) ledger::count(assembly_.tally, SBLLedgerEntry::unsent, count);
+  if (outcome == Outcome::dropped) {
+    ledger::count(assembly_.tally, SBLLedgerEntry::unsent,
+                  static_cast<std::int64_t>(session.getSessionFeedbacks().size()));
+  }
 }
 
 }  // namespace sable
