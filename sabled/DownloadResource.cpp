@@ -17,8 +17,8 @@ bool isControl(char c) {
 
 /// The daemon's own files and folders beside the resources.
 bool isTaken(std::string_view name) {
-  return name == "bag.plist" || name == "http" || name.starts_with("session.") ||
-         name.starts_with("flushing.");
+  return name == "bag.plist" || name == "http" || name == "temporary" || name.starts_with("session.") ||
+         name.starts_with("flushing.") || name.starts_with("crowdsourcing.");
 }
 
 }  // namespace

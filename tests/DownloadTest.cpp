@@ -392,6 +392,8 @@ TEST_F(Downloads, AnIdentifierIsAFileNameOrNothing) {
                            "http",
                            "session.12",
                            "flushing.first",
+                           "crowdsourcing.first",
+                           "temporary",
                            ".hidden",
                            "a\nb",
                            std::string("a\0b", 3),

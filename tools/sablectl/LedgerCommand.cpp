@@ -54,12 +54,17 @@ struct Stock {
   std::int64_t records = 0, files = 0;
 };
 
+bool isSessionFile(std::string_view name) {
+  return name.starts_with("session.") || name.starts_with("flushing.") || name.starts_with("crowdsourcing.");
+}
+
 /// What session files hold now.
 Stock stockOf(const Host& host) {
   constexpr std::size_t kMaximumSessionBytes = 1u << 30;
   Stock stock;
   for (const std::string& name : host.fileManager.list(host.caches).value_or(std::vector<std::string>())) {
     if (std::ranges::none_of(kSessionFiles, [&](auto prefix) { return name.starts_with(prefix); })) continue;
+    if (!isSessionFile(name)) continue;
     const auto file = host.fileManager.openForReading(host.caches / name);
     const auto bytes = file ? (*file)->map(kMaximumSessionBytes) : tl::unexpected(file.error());
     if (!bytes) continue;
