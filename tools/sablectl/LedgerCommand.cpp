@@ -46,14 +46,11 @@ std::string nameOf(SBLLedgerEntry entry) {
   return std::string(key.substr(key.rfind('.') + 1));
 }
 
-/// How the names of files with a session begin: one that is written or complete, one that is on its way
-/// to an upload, and one for crowd sourcing.
-constexpr std::string_view kSessionFiles[] = {"session.", "flushing.", "crowdsourcing."};
-
 struct Stock {
   std::int64_t records = 0, files = 0;
 };
 
+/// A session that is written or complete, one that is on its way to an upload, or one for crowd sourcing.
 bool isSessionFile(std::string_view name) {
   return name.starts_with("session.") || name.starts_with("flushing.") || name.starts_with("crowdsourcing.");
 }
@@ -63,7 +60,6 @@ Stock stockOf(const Host& host) {
   constexpr std::size_t kMaximumSessionBytes = 1u << 30;
   Stock stock;
   for (const std::string& name : host.fileManager.list(host.caches).value_or(std::vector<std::string>())) {
-    if (std::ranges::none_of(kSessionFiles, [&](auto prefix) { return name.starts_with(prefix); })) continue;
     if (!isSessionFile(name)) continue;
     const auto file = host.fileManager.openForReading(host.caches / name);
     const auto bytes = file ? (*file)->map(kMaximumSessionBytes) : tl::unexpected(file.error());
