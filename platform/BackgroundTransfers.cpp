@@ -110,7 +110,7 @@ Expected<std::int64_t> BackgroundTransfers::Core::accept(BackgroundTransfer tran
                                                          const std::filesystem::path& body) {
   if (auto error = invalidity(transfer.task.originalRequest)) return tl::unexpected(std::move(*error));
   transfer.accepted = runtime_.now();
-  const auto identifier = host_->accept(transfer, token, body);
+  auto identifier = host_->accept(transfer, token, body);
   if (!identifier) {
     rest();
     return identifier;

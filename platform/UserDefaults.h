@@ -10,6 +10,9 @@
 
 namespace sable::platform {
 
+/// What the clients of lookups have in common.
+inline constexpr std::string_view kLookupDomain = "com.kestrel.lookup.shared";
+
 /// Typed settings by key. Precedence: profile, then user, then what the daemon wrote, then the
 /// registered default. A value of another type than asked for counts as absent and is reported
 /// once at error level. Any thread; reads of the daemon's own domain do not block on the disk.
@@ -28,7 +31,7 @@ class UserDefaults {
   virtual std::optional<Dictionary> array(std::string_view key) const = 0;
   virtual std::optional<Dictionary> dictionary(std::string_view key) const = 0;
 
-  /// A setting of a domain that the user's programs share, as it is now; nullopt when it is absent or
+  /// A setting of a domain that the user's programs share, such as kLookupDomain, as it is now; nullopt when it is absent or
   /// no boolean. May block on the disk.
   virtual std::optional<bool> sharedBoolean(std::string_view domain, std::string_view key) const = 0;
 

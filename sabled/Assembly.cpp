@@ -5,6 +5,7 @@
 #include "platform/HTTPBackgroundSession.h"
 #include "platform/NotificationCenter.h"
 #include "platform/ProgrammingError.h"
+#include "platform/Subsystem.h"
 #include "platform/Tally.h"
 #include "platform/UserDefaults.h"
 #include "sabled/AppWhitelistController.h"
@@ -76,7 +77,7 @@ platform::HTTPBackgroundSession& Assembly::downloadURLSession() {
   std::call_once(downloadURLSessionOnce_, [this] {
     if (downloadSessionDelegate == nullptr) platform::programmingError("downloads without a delegate");
     platform::HTTPBackgroundSessionConfiguration configuration;
-    configuration.identifier = "com.kestrel.sabled";
+    configuration.identifier = platform::kSubsystem;
     configuration.discretionary = true;
     configuration.allowsExpensiveNetworkAccess = false;
     downloadURLSession_ =

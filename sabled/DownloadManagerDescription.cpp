@@ -39,14 +39,14 @@ Dictionary DownloadManager::description(const DownloadResource& resource, const 
   described["size"] = file ? Dictionary(file->size) : Dictionary();
   described["created"] = file ? Dictionary(platform::secondsSince1970(file->creationDate)) : Dictionary();
   const auto delayed = delayed_.find(resource.identifier);
-  const bool inFlight =
+  const bool isOnItsWay =
       std::ranges::any_of(tasks, [&](const auto& task) { return identifierOf(task) == resource.identifier; });
   if (delayed != delayed_.end()) {
     described["state"] = "delayed";
     described["reason"] = delayed->second.reason;
     described["starts_in"] = platform::toSeconds(delayed->second.due - assembly_.runtime.ticks());
   } else {
-    described["state"] = inFlight ? "in flight" : file ? "there" : "missing";
+    described["state"] = isOnItsWay ? "in flight" : file ? "there" : "missing";
   }
   return described;
 }

@@ -61,7 +61,7 @@ Lookup::Lookup(Assembly& assembly)
 Lookup::~Lookup() = default;
 
 bool Lookup::lookupEnabled() const {
-  return !assembly_.userDefaults.sharedBoolean("com.kestrel.lookup.shared", "LookupSuggestionsDisabled")
+  return !assembly_.userDefaults.sharedBoolean(platform::kLookupDomain, "LookupSuggestionsDisabled")
               .value_or(false);
 }
 

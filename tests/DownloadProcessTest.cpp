@@ -40,7 +40,7 @@ TEST(DownloadProcess, FilesOfAnEarlierRunAreHandedOutListedAndDropped) {
     EXPECT_EQ(world.sablectl({"resource", identifier}).exitCode, 1) << identifier;
   }
   EXPECT_THAT(world.sablectl({"resource", "bag.plist"}).errors,
-              HasSubstr("identifier: bag.plist exception: no name of a resource"));
+              HasSubstr("identifier: bag.plist exception: no place for a resource of that name"));
   EXPECT_FALSE(std::filesystem::exists(caches / "dropped"));
 
   const json resources = world.sablectlJSON({"resources"});

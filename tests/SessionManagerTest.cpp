@@ -28,7 +28,7 @@ class Sessions : public testing::Test {
     device.platform.userDefaults().setByUser("SBLSharedSession", shared);
     device.start();
     device.assembly().backgroundFlusher->setStopFlushing(true);  // the files are read here
-    ended();  // the bag's fetch was one
+    ended();                                                     // the bag's fetch was one
     for (const auto name : {kSBLSessionSoftLimitNotification, kSBLSessionMaxLimitNotification,
                             kSBLUserGUIDChangeNotification}) {
       observations.push_back(device.assembly().notificationCenter.observe(

@@ -186,7 +186,7 @@ std::vector<std::string> checkConfiguration(const Folders& folders) {
   std::vector<std::string> problems;
   checkFile(folders.profileSettings, knownSettings(), problems);
   checkFile(folders.userSettings(), knownSettings(), problems);
-  checkFile(folders.sharedSettings("com.kestrel.lookup.shared"), kLookupSettings, problems);
+  checkFile(folders.sharedSettings(kLookupDomain), kLookupSettings, problems);
   checkFile(folders.systemFacts, knownFacts(), problems);
   checkFile(folders.userFacts(), knownFacts(), problems);
   for (const auto& folder : {folders.systemSubscriptions(), folders.userSubscriptions()}) {
