@@ -95,17 +95,14 @@ class Downloads : public testing::Test {
     return value == nullptr ? "(none)" : *value;
   }
   std::vector<RecordedRequest> requests() { return device.service.requests("/resources"); }
-  /// "identifier reason" of each download that began.
+  /// "identifier reason: reason" of each download that began.
   Strings begun() {
     Strings found;
     for (const auto& line : device.log.lines()) {
-      const std::string_view text = line.message, head = "starting download of ", middle = " reason: ";
+      const std::string_view text = line.message, head = "starting download of ";
       if (!text.starts_with(head)) continue;
-      const auto at = text.find(middle);
-      found.push_back(
-          std::string(text.substr(head.size(), at - head.size())) + " " +
-          std::string(text.substr(at + middle.size(), text.find(" delay: ") - at - middle.size())));
-      EXPECT_NE(text.find(" delay: 86400.000000 headers: {"), text.npos) << text;
+      const auto end = text.find(" delay: 86400.000000 headers: {");
+      found.emplace_back(text.substr(head.size(), end - head.size()));
     }
     return found;
   }
@@ -166,7 +163,7 @@ TEST_F(Downloads, ANewResourceComesAMinuteAfterItsBag) {
   EXPECT_EQ(request.request.url, "https://service.test/resources/notes?key=tandem4371&version=3");
   EXPECT_EQ(header(request, "X-Kestrel-Download-Identifier"), "notes");
   EXPECT_EQ(header(request, "If-None-Match"), "(none)") << "there is none to compare with";
-  EXPECT_THAT(begun(), ElementsAre("notes update"));
+  EXPECT_THAT(begun(), ElementsAre("notes reason: update"));
   EXPECT_EQ(file("notes"), "text");
   EXPECT_THAT(posted, ElementsAre("completed notes " + path("notes").string()));
   EXPECT_EQ(device.counter("resourcefilesfetched"), 2) << "one for the file, one for the end";
@@ -188,9 +185,9 @@ TEST_F(Downloads, ABagDecidesByUrlAndFileWhatIsFetched) {
   startWithFiles();
   for (const Row& row :
        {Row{"the same", kNotes, false, {}}, Row{"another API key", file + "?key=other&version=3", false, {}},
-        Row{"the same without its file", kNotes, true, {"notes missing"}},
-        Row{"another version", file + "?version=4", false, {"notes update"}},
-        Row{"an item more", file + "?version=4&a=b%2Fc", false, {"notes update"}},
+        Row{"the same without its file", kNotes, true, {"notes reason: missing"}},
+        Row{"another version", file + "?version=4", false, {"notes reason: update"}},
+        Row{"an item more", file + "?version=4&a=b%2Fc", false, {"notes reason: update"}},
         Row{"in another order", file + "?a=b/c&version=4", false, {}}}) {
     forget();
     EXPECT_EQ(row.lose && !device.platform.fileManager().remove(path("notes")), false);
@@ -229,7 +226,7 @@ TEST_F(Downloads, HintsForLookupsAreAskedForWithEveryBagByTheVersionOfTheirRedir
   for (int i = 0; i < 2; ++i) {
     newBag();
     device.advance(70s);
-    EXPECT_THAT(begun(), ElementsAre(std::string(kWeekly) + " lookup"));
+    EXPECT_THAT(begun(), ElementsAre(std::string(kWeekly) + " reason: lookup"));
     ASSERT_EQ(requests().size(), 1u);
     EXPECT_EQ(header(requests()[0], "If-None-Match"), "2026-11-23-7-weekly");
     EXPECT_EQ(file(kWeekly), "hints");
@@ -353,7 +350,7 @@ TEST_F(Downloads, AnotherDaemonKnowsWhatIsThereAndFetchesWhatWasUnderWay) {
   EXPECT_EQ(manager().resourceVersions().at("notes"), "3");
   EXPECT_TRUE(device.log.contains("canceling https://service.test/resources/other?"));
   device.advance(100s);
-  EXPECT_THAT(begun(), ElementsAre("other update"));
+  EXPECT_THAT(begun(), ElementsAre("other reason: update"));
   EXPECT_EQ(file("notes"), "text");
   EXPECT_EQ(file("other"), "late");
   EXPECT_THAT(reports(), IsEmpty());
