@@ -126,6 +126,8 @@ void DownloadManager::_saveResources() {
       log().error("exception saving resource {}: {}", identifier, exception.what());
     }
   }
+  // Most bags change nothing.
+  if (assembly_.userDefaults.dictionary(kDownloadResources).value_or(Dictionary::object()) == saved) return;
   assembly_.userDefaults.set(kDownloadResources, saved);
   assembly_.userDefaults.synchronize();
 }
