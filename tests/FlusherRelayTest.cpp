@@ -92,7 +92,7 @@ struct FlusherRelay : testing::Test {
     device.start();
     auto made = std::make_unique<RecordingFlusher>();
     flusher = made.get();
-    device.assembly().backgroundFlusher = std::move(made);
+    replaced = std::exchange(device.assembly().backgroundFlusher, std::move(made));
   }
   void report(VirtualClient& client, std::size_t count = 1) {
     const auto bytes = messageFromJSON("RKDidGoToSiteFeedback", R"({"input": "dog"})");
@@ -107,6 +107,7 @@ struct FlusherRelay : testing::Test {
   SableFlusherRelay& relay() { return *device.assembly().flusherRelayListener; }
 
   VirtualDevice device;
+  std::unique_ptr<BackgroundFlusher> replaced;  ///< still there: it is the delegate of uploads
   RecordingFlusher* flusher = nullptr;
 };
 

@@ -229,10 +229,10 @@ TEST(StreamRows, HoldTheirColumnsTheirWidthAndNothingHarmful) {
   }
   const std::string session = sessionRow(output, time,
                                          {{"fb", {1, 2, 3}},
-                                          {"agent", "Rover/1"},
+                                          {"agent", "Sabled/1.0 (Linux; Debian 12) Rover/1 (x) y"},
                                           {"user_guid", "79A14834-90CD"},
                                           {"previous_session_end_reason", "idle"}});
-  EXPECT_EQ(session.substr(14), "      3  79A14834  idle                     Rover/1");
+  EXPECT_EQ(session.substr(14), "      3  79A14834  idle                     Rover/1 (x) y");
   EXPECT_EQ(sessionHeading(output).find("agent"), session.find("Rover/1"));
   EXPECT_EQ(sessionRow(output, time, {{"other", 1}}).substr(14), R"({"other":1})");
   EXPECT_EQ(droppedRow(output, time, 3).substr(14),

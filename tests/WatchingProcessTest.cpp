@@ -87,7 +87,13 @@ TEST_F(Watching, StopAndDumpAnswerWhenTheDaemonHasDoneIt) {
   world.waitForLog("session flushed because of dump command Sabled/1.0 (");
   const auto sessions = watch({"watch", "--sent"});
   EXPECT_THAT(sessions->readLine(), HasSubstr("agent"));
+  ASSERT_EQ(world.sablectl({"--agent", "Rover/7", "report", "RKDidGoToSiteFeedback", "input=a"}).exitCode, 0);
   EXPECT_EQ(world.sablectl({"dump"}).output, "all sessions have ended and are being uploaded\n");
+  std::string row;
+  do {
+    row = sessions->readLine();
+  } while (row.find("Rover/7") == std::string::npos);
+  EXPECT_THAT(row, testing::ContainsRegex(" [0-9]+  [0-9A-F]{8}  [a-z ]+ Rover/7$"));
   EXPECT_EQ(world.sablectl({"watch", "--unheard-of"}).exitCode, 2);
 }
 

@@ -85,6 +85,12 @@ std::string members(const Dictionary& feedback) {
   return parts[0] + parts[1] + parts[2];
 }
 
+/// The client's own part of an agent, which the daemon's and the device's stand before.
+std::string clientOf(const std::string& agent) {
+  const auto device = agent.find(") ");
+  return agent.starts_with("Sabled/") && device != std::string::npos ? agent.substr(device + 2) : agent;
+}
+
 bool isError(std::string_view kind) {
   return kind.find("error") != std::string_view::npos;
 }
@@ -128,7 +134,7 @@ std::string sessionRow(const Output& output, platform::WallTime time, const Dict
               {std::to_string(records->size()), kCountWidth, Colour::cyan, true},
               {memberText(envelope, "user_guid").substr(0, kGUIDWidth), kGUIDWidth, Colour::dim},
               {memberText(envelope, "previous_session_end_reason"), kReasonWidth}},
-             memberText(envelope, "agent"));
+             clientOf(memberText(envelope, "agent")));
 }
 
 std::string droppedRow(const Output& output, platform::WallTime time, std::uint64_t count) {

@@ -18,8 +18,8 @@ std::string sessionHeading(const Output& output);
 /// kind, the query's id, and the other members that say something; of lists and objects their size.
 std::string feedbackRow(const Output& output, platform::WallTime time, const Dictionary& feedback);
 
-/// "12:03:04.123      12  1B4E28BA  session_idle  Sabled/1.0 (...) Rover/1": the local time, how many
-/// records it has, the beginning of its user GUID, why the session before it ended, and its agent.
+/// "12:03:04.123       12  1B4E28BA  external request         Rover/1": the local time, how many records it
+/// has, the beginning of its user GUID, why the session before it ended, and the client's own agent.
 std::string sessionRow(const Output& output, platform::WallTime time, const Dictionary& envelope);
 
 /// "12:03:04.123  124 records left out: ...".
