@@ -6,6 +6,8 @@
 #include <array>
 #include <nlohmann/json.hpp>
 
+#include "platform/UserDefaults.h"
+
 namespace sable::platform::host {
 
 namespace {
