@@ -84,7 +84,8 @@ std::optional<DownloadResource> DownloadManager::resourceForKey(const std::strin
 Expected<std::unique_ptr<platform::ReadableFile>> DownloadManager::fileHandleForResource(
     const std::string& identifier, platform::FileAttributes& attributes) {
   const auto path = _pathToResource(identifier);
-  if (!path) return tl::unexpected(makeSBLError(SBLErrorCode::daemonSide, "no place for a resource of that name"));
+  if (!path)
+    return tl::unexpected(makeSBLError(SBLErrorCode::daemonSide, "no place for a resource of that name"));
   auto file = assembly_.fileManager.openForReading(*path);
   if (!file) return file;
   const auto known = (*file)->attributes();
