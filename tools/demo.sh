@@ -77,6 +77,15 @@ show explain "weath"
 show type "image viewer"
 printf '\n$ sablectl bag      (its first lines)\n'
 sablectl bag | sed -n '1,12p'
+show dump
+# The uploads run on their own; the sums of the ledger meet when they have ended.
+for ((try = 0; try < 100; ++try)); do
+  [[ $(sablectl uploads) == *ended* ]] && sablectl ledger >"$world/ledger.log" && break
+  sleep 0.1
+done
+show uploads
+printf '\n$ sablectl ledger      (what is not 0)\n'
+sablectl ledger | awk '$2 != 0'
 show counters
 
 if [[ -t 0 && -t 1 ]]; then
