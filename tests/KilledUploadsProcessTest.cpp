@@ -1,0 +1,200 @@
+#include <fmt/core.h>
+#include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/inotify.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdlib>
+#include <iostream>
+#include <map>
+#include <random>
+
+#include "SableKit/SBLRelayInterfaces.h"
+#include "SableKit/messages/MessageJSON.h"
+#include "tests/support/TestClient.h"
+#include "tests/support/World.h"
+
+// The real daemon, killed again and again while it uploads: what the service has in the end.
+namespace sable::test {
+namespace {
+
+using nlohmann::json;
+
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr int kRounds = 4;
+#else
+constexpr int kRounds = 15;
+#endif
+
+/// Tells when a number of things have happened to the files in some folders.
+class FileEvents {
+ public:
+  explicit FileEvents(const std::vector<std::filesystem::path>& folders)
+      : queue_(inotify_init1(IN_CLOEXEC | IN_NONBLOCK)) {
+    for (const auto& folder : folders) {
+      std::filesystem::create_directories(folder);
+      std::filesystem::permissions(folder, std::filesystem::perms::owner_all);
+      inotify_add_watch(queue_, folder.c_str(), IN_CREATE | IN_MODIFY | IN_MOVED_TO | IN_DELETE);
+    }
+  }
+  ~FileEvents() { close(queue_); }
+  FileEvents(const FileEvents&) = delete;
+  FileEvents& operator=(const FileEvents&) = delete;
+
+  /// Returns how many there were: fewer when nothing happens any more.
+  int wait(int count) const {
+    constexpr int kQuietMilliseconds = 100;
+    int seen = 0;
+    alignas(inotify_event) char events[4096];
+    for (pollfd descriptor{queue_, POLLIN, 0};
+         seen < count && poll(&descriptor, 1, kQuietMilliseconds) > 0;) {
+      const ssize_t bytes = read(queue_, events, sizeof events);
+      for (ssize_t at = 0; at < bytes; ++seen)
+        at += ssize_t(sizeof(inotify_event)) + reinterpret_cast<const inotify_event*>(events + at)->len;
+    }
+    return seen;
+  }
+
+ private:
+  const int queue_;
+};
+
+struct Figures {
+  int flushing = 0;  ///< kills that left sessions on their way to an upload
+  int queued = 0;    ///< kills that left uploads without an end
+  int packing = 0;   ///< kills that left a temporary file
+  int repeated = 0;  ///< uploads that arrived twice
+  int atOnce = 0;    ///< feedback reported while the daemon was about to be killed
+  int lost = 0;      ///< of these
+};
+
+class KilledUploads : public testing::Test {
+ protected:
+  KilledUploads() {
+    // Without a bag nobody wants feedback.
+    waitForChange(caches_, [this] { return std::filesystem::exists(caches_ / "bag.plist"); });
+    world_.killDaemon();
+  }
+
+  std::string report(TestClient& client) {
+    const std::string input = fmt::format("number {}", ++reported_);
+    const auto message = messageFromJSON("RKStartSearchFeedback", json{{"input", input}}.dump());
+    client.client().call(
+        kSBLDaemonRelay, SBLDaemonRelay::reportEvent,
+        {std::uint64_t{0}, std::int64_t{reported_}, std::string("RKStartSearchFeedback"), makeData(*message)},
+        [](const Expected<platform::RelayArguments>&) {});
+    return input;
+  }
+
+  json ledgerWhen(const std::function<bool(const json&)>& holds) const {
+    json ledger;
+    for (int attempt = 0; attempt < 1000; ++attempt) {
+      ledger = world_.sablectlJSON({"ledger"});
+      if (holds(ledger)) break;
+    }
+    return ledger;
+  }
+
+  /// Feedback that is in its files is flushed, other feedback comes in, and then the daemon is killed.
+  void round(int number) {
+    world_.startDaemon({"--log-level", "error"});
+    platform::host::HostRuntime runtime(2);
+    TestClient client(runtime, world_.address(), {"test", fmt::format("round{}", number)});
+    const auto taken = ledgerWhen([](const json&) { return true; })["began"]["taken"].get<std::int64_t>();
+    constexpr int kCount = 3;
+    for (int i = 0; i < kCount; ++i) stored_.push_back(report(client));
+    const auto ledger = ledgerWhen([&](const json& now) {
+      return now["waiting"] == 0 && now["began"]["taken"].get<std::int64_t>() >= taken + kCount;
+    });
+    ASSERT_EQ(ledger["waiting"], 0) << ledger.dump(1);
+    const FileEvents events(
+        {caches_, caches_ / "temporary", world_.folder("state"), world_.folder("state") / "transfers"});
+    const auto dump = world_.start({World::program("sablectl"), "dump"});
+    (void)events.wait(static_cast<int>(chance_() % 40));
+    for (auto left = chance_() % 3; left > 0; --left) atOnce_.push_back(report(client));
+    (void)events.wait(static_cast<int>(chance_() % 4));
+    world_.killDaemon();
+    noteWhatIsLeft();
+  }
+
+  void noteWhatIsLeft() {
+    const auto holds = [](const std::filesystem::path& folder, std::string_view prefix) {
+      return std::ranges::any_of(std::filesystem::directory_iterator(folder), [&](const auto& entry) {
+        return entry.path().filename().string().starts_with(prefix);
+      });
+    };
+    figures_.flushing += holds(caches_, "flushing.");
+    figures_.packing += holds(caches_ / "temporary", "flusher_");
+    figures_.queued += holds(world_.folder("state") / "transfers", "");
+  }
+
+  /// But for what tells that sablectl has disconnected after its dump.
+  json expectEverythingSent() const {
+    ledgerWhen([this](const json& now) {
+      return now["meets"] == true && now["in_files"] <= 1 && now["sending"] == 0 && queued() == 0;
+    });
+    const json ledger = world_.sablectlJSON({"ledger"});
+    EXPECT_EQ(ledger["meets"], true);
+    EXPECT_LE(ledger["in_files"], 1);
+    EXPECT_EQ(ledger["sending"], 0);
+    EXPECT_EQ(queued(), 0);
+    return ledger;
+  }
+
+  std::ptrdiff_t queued() const {
+    return std::ranges::count_if(world_.sablectlJSON({"uploads"}),
+                                 [](const json& upload) { return upload["state"] != "ended"; });
+  }
+
+  void expectEachOnce() {
+    std::map<std::string, int> accepted;
+    for (const json& upload : world_.requests("/feedback", 0)) {
+      if (upload["status"] != 200) continue;
+      EXPECT_EQ(upload["digest_ok"], true);
+      if (upload["repeated"] == true) {
+        ++figures_.repeated;
+        continue;
+      }
+      for (const json& record : upload["json"]["fb"])
+        if (record["type"] == "search_start") ++accepted[record["input"]];
+    }
+    for (const std::string& input : stored_) EXPECT_EQ(accepted[input], 1) << input;
+    for (const std::string& input : atOnce_) {
+      EXPECT_LE(accepted[input], 1) << input;
+      figures_.lost += accepted[input] == 0;
+    }
+    figures_.atOnce = static_cast<int>(atOnce_.size());
+  }
+
+  World world_{{.serviceArguments = {"--fault", "/feedback:latency=3"}}};
+  const std::filesystem::path caches_ = world_.folder("caches") / "com.kestrel.sabled";
+  std::mt19937 chance_{1};
+  std::int64_t reported_ = 0;
+  std::vector<std::string> stored_, atOnce_;  ///< inputs of feedback
+  Figures figures_;
+};
+
+TEST_F(KilledUploads, BringEachSessionToTheServiceOnce) {
+  const char* wanted = std::getenv("SABLED_KILL_ROUNDS");
+  const int rounds = wanted == nullptr ? kRounds : std::atoi(wanted);
+  for (int number = 0; number < rounds && !HasFailure(); ++number) round(number);
+  world_.startDaemon();
+  ASSERT_EQ(world_.sablectl({"dump"}).exitCode, 0);
+  const json ledger = expectEverythingSent();
+  expectEachOnce();
+  for (const char* end : {"unsent", "lostsending", "refused", "damaged", "unwritten", "bagdisabled"})
+    EXPECT_EQ(ledger["ended"][end], 0) << end;
+  if (HasFailure()) {
+    std::cout << world_.sablectl({"ledger"}).output << world_.sablectl({"uploads"}).output;
+  }
+  if (wanted != nullptr || HasFailure())
+    std::cout << fmt::format(
+        "{} rounds: {} kills while flushing, {} while packing, {} with uploads under way, {} uploads "
+        "repeated; {} of {} reported at the kill lost\n",
+        rounds, figures_.flushing, figures_.packing, figures_.queued, figures_.repeated, figures_.lost,
+        figures_.atOnce);
+}
+
+}  // namespace
+}  // namespace sable::test
