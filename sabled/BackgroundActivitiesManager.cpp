@@ -161,11 +161,15 @@ void BackgroundActivitiesManager::State::adoptEarlierRuns() {
   assembly.persistentStorage->adoptHeldSessions(
       [&](const std::string& token) { return uploads.hasAccepted(token); });
   removeTemporaryFiles();
-  uploads.getAllTasks([&tally = assembly.tally](const std::vector<platform::HTTPBackgroundTask>& tasks) {
+  const auto settled = assembly.runtime.semaphore(0);
+  uploads.getAllTasks([&](const std::vector<platform::HTTPBackgroundTask>& tasks) {
     std::int64_t sending = 0;
     for (const auto& task : tasks) sending += countIn(task.description);
-    ledger::settleSending(tally, sending);
+    ledger::settleSending(assembly.tally, sending);
+    settled->signal();
   });
+  // A session handed over before that would count as lost.
+  (void)settled->wait(platform::MonotonicTime::max());
 }
 
 void BackgroundActivitiesManager::State::removeTemporaryFiles() {

@@ -30,11 +30,12 @@ void settleStored(platform::Tally& tally, const SBLFeedbackLedger& before, std::
 }
 
 void settleSending(platform::Tally& tally, std::int64_t sending) {
-  const std::int64_t before = SBLFeedbackLedger(tally.snapshot()).sending();
-  count(tally, SBLLedgerEntry::lostSending, std::max<std::int64_t>(before - sending, 0));
-  // The counters were lost meanwhile: what was sent had been in a file.
-  count(tally, SBLLedgerEntry::found, std::max<std::int64_t>(-before, 0));
-  count(tally, SBLLedgerEntry::handedOver, std::max<std::int64_t>(-before, 0));
+  const std::int64_t surplus = sending - SBLFeedbackLedger(tally.snapshot()).sending();
+  count(tally, SBLLedgerEntry::lostSending, std::max<std::int64_t>(-surplus, 0));
+  // A kill came between deleting a file and counting, or the counters were lost: what is sent had
+  // been in a file.
+  count(tally, SBLLedgerEntry::found, std::max<std::int64_t>(surplus, 0));
+  count(tally, SBLLedgerEntry::handedOver, std::max<std::int64_t>(surplus, 0));
 }
 
 }  // namespace sable::ledger

@@ -34,7 +34,8 @@ void countFile(platform::Tally& tally, SBLLedgerEntry entry, std::int64_t record
 void settleStored(platform::Tally& tally, const SBLFeedbackLedger& before, std::int64_t stored);
 
 /// At a start, before a first session is handed over or the end of an upload heard of: uploads of
-/// `sending` records are still under way. What else was being sent is lost.
+/// `sending` records are still under way. What else was being sent is lost; what is sent beyond the
+/// counters is found.
 void settleSending(platform::Tally& tally, std::int64_t sending);
 
 }  // namespace sable::ledger

@@ -248,6 +248,9 @@ TEST(FeedbackLedgerOfUploads, WhatNoUploadCarriesAfterAStartIsLost) {
   EXPECT_EQ(tally.value(std::string(counterOf(lostSending))), 6);
   EXPECT_EQ(sending(), 8);
 
+  ledger::settleSending(tally, 12);  // a kill came before a deleted file was counted
+  EXPECT_EQ(sending(), 12);
+
   platform::simulated::SimulatedTally lost;
   ledger::count(lost, uploaded, 7);
   ledger::settleSending(lost, 0);
