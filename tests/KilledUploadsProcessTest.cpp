@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <cstdlib>
 #include <iostream>
+#include <list>
 #include <map>
 #include <random>
 
@@ -60,6 +61,33 @@ class FileEvents {
   const int queue_;
 };
 
+json ledgerWhen(const World& world, const std::function<bool(const json&)>& holds) {
+  json ledger;
+  for (int attempt = 0; attempt < 2000; ++attempt) {
+    ledger = world.sablectlJSON({"ledger"});
+    if (holds(ledger)) break;
+  }
+  return ledger;
+}
+
+std::ptrdiff_t queued(const World& world) {
+  return std::ranges::count_if(world.sablectlJSON({"uploads"}),
+                               [](const json& upload) { return upload["state"] != "ended"; });
+}
+
+/// But for what tells that sablectl has disconnected after its dump. Returns the ledger.
+json expectEverythingSent(const World& world) {
+  ledgerWhen(world, [&](const json& now) {
+    return now["meets"] == true && now["in_files"] <= 1 && now["sending"] == 0 && queued(world) == 0;
+  });
+  json ledger = world.sablectlJSON({"ledger"});
+  EXPECT_EQ(ledger["meets"], true) << ledger.dump(1);
+  EXPECT_LE(ledger["in_files"], 1) << ledger.dump(1);
+  EXPECT_EQ(ledger["sending"], 0) << ledger.dump(1);
+  EXPECT_EQ(queued(world), 0);
+  return ledger;
+}
+
 struct Figures {
   int flushing = 0;  ///< kills that left sessions on their way to an upload
   int queued = 0;    ///< kills that left uploads without an end
@@ -87,24 +115,16 @@ class KilledUploads : public testing::Test {
     return input;
   }
 
-  json ledgerWhen(const std::function<bool(const json&)>& holds) const {
-    json ledger;
-    for (int attempt = 0; attempt < 1000; ++attempt) {
-      ledger = world_.sablectlJSON({"ledger"});
-      if (holds(ledger)) break;
-    }
-    return ledger;
-  }
-
   /// Feedback that is in its files is flushed, other feedback comes in, and then the daemon is killed.
   void round(int number) {
     world_.startDaemon({"--log-level", "error"});
     platform::host::HostRuntime runtime(2);
     TestClient client(runtime, world_.address(), {"test", fmt::format("round{}", number)});
-    const auto taken = ledgerWhen([](const json&) { return true; })["began"]["taken"].get<std::int64_t>();
+    const auto taken =
+        ledgerWhen(world_, [](const json&) { return true; })["began"]["taken"].get<std::int64_t>();
     constexpr int kCount = 3;
     for (int i = 0; i < kCount; ++i) stored_.push_back(report(client));
-    const auto ledger = ledgerWhen([&](const json& now) {
+    const auto ledger = ledgerWhen(world_, [&](const json& now) {
       return now["waiting"] == 0 && now["began"]["taken"].get<std::int64_t>() >= taken + kCount;
     });
     ASSERT_EQ(ledger["waiting"], 0) << ledger.dump(1);
@@ -126,25 +146,7 @@ class KilledUploads : public testing::Test {
     };
     figures_.flushing += holds(caches_, "flushing.");
     figures_.packing += holds(caches_ / "temporary", "flusher_");
-    figures_.queued += holds(world_.folder("state") / "transfers", "");
-  }
-
-  /// But for what tells that sablectl has disconnected after its dump.
-  json expectEverythingSent() const {
-    ledgerWhen([this](const json& now) {
-      return now["meets"] == true && now["in_files"] <= 1 && now["sending"] == 0 && queued() == 0;
-    });
-    const json ledger = world_.sablectlJSON({"ledger"});
-    EXPECT_EQ(ledger["meets"], true);
-    EXPECT_LE(ledger["in_files"], 1);
-    EXPECT_EQ(ledger["sending"], 0);
-    EXPECT_EQ(queued(), 0);
-    return ledger;
-  }
-
-  std::ptrdiff_t queued() const {
-    return std::ranges::count_if(world_.sablectlJSON({"uploads"}),
-                                 [](const json& upload) { return upload["state"] != "ended"; });
+    figures_.queued += queued(world_) > 0;
   }
 
   void expectEachOnce() {
@@ -181,7 +183,7 @@ TEST_F(KilledUploads, BringEachSessionToTheServiceOnce) {
   for (int number = 0; number < rounds && !HasFailure(); ++number) round(number);
   world_.startDaemon();
   ASSERT_EQ(world_.sablectl({"dump"}).exitCode, 0);
-  const json ledger = expectEverythingSent();
+  const json ledger = expectEverythingSent(world_);
   expectEachOnce();
   for (const char* end : {"unsent", "lostsending", "refused", "damaged", "unwritten", "bagdisabled"})
     EXPECT_EQ(ledger["ended"][end], 0) << end;
@@ -194,6 +196,69 @@ TEST_F(KilledUploads, BringEachSessionToTheServiceOnce) {
         "repeated; {} of {} reported at the kill lost\n",
         rounds, figures_.flushing, figures_.packing, figures_.queued, figures_.repeated, figures_.lost,
         figures_.atOnce);
+}
+
+/// A world whose service is at fault once, and feedback on its way there.
+class FaultyUpload {
+ public:
+  explicit FaultyUpload(World::Options options) : world(std::move(options)) {
+    const auto caches = world.folder("caches") / "com.kestrel.sabled";
+    waitForChange(caches, [&] { return std::filesystem::exists(caches / "bag.plist"); });
+  }
+
+  void send() const {
+    EXPECT_EQ(world.sablectl({"report", "RKStartSearchFeedback", "input=precious"}).exitCode, 0);
+    EXPECT_EQ(world.sablectl({"dump"}).exitCode, 0);
+  }
+
+  World world;
+};
+
+TEST(FaultsOfUploads, CostWhatTheServiceRefusesAndNothingElse) {
+  const struct Fault {
+    const char* name;
+    std::vector<std::string> rules;
+    int status;    // of the request that met the fault
+    bool refused;  // its feedback is not sent again
+    bool pauses;   // it is sent again after some seconds
+  } faults[] = {
+      {"a failure", {"status=500*1"}, 500, true, false},
+      {"unavailable", {"status=503*1"}, 503, true, false},
+      {"a slow reader", {"slow-body=1000*1"}, 200, false, false},
+      {"a slow answer", {"latency=300*1"}, 200, false, false},
+      {"unavailable for a second", {"status=503*1", "retry-after=1*1"}, 503, false, true},
+      {"reset amid the body", {"reset-body=100*1"}, 400, false, true},
+      {"reset instead of an answer", {"reset*1"}, 200, false, true},
+      {"an answer cut short", {"truncate=1*1"}, 200, false, true},
+  };
+  const bool withPauses = std::getenv("SABLED_SLOW_FAULTS") != nullptr;
+  std::list<std::pair<const Fault&, FaultyUpload>> uploads;
+  for (const Fault& fault : faults) {
+    if (fault.pauses && !withPauses) continue;
+    World::Options options;
+    for (const std::string& rule : fault.rules)
+      options.serviceArguments.insert(options.serviceArguments.end(), {"--fault", "/feedback:" + rule});
+    uploads.emplace_back(fault, options).second.send();
+  }
+  for (const auto& [fault, upload] : uploads) {
+    SCOPED_TRACE(fault.name);
+    const json ledger = expectEverythingSent(upload.world);
+    EXPECT_EQ(ledger["ended"]["refused"] > 0, fault.refused) << ledger.dump(1);
+    std::map<std::string, json> lastWith;  // by digest; what did not arrive whole has none
+    bool metTheFault = false;
+    for (const json& request : upload.world.requests("/feedback", 1)) {
+      metTheFault = metTheFault || request["status"] == fault.status;
+      if (request.contains("digest")) lastWith[request["digest"]] = request;
+    }
+    int precious = 0, refused = 0;
+    for (const auto& [digest, request] : lastWith) {
+      precious += request["json"].dump().find("precious") != std::string::npos;
+      refused += request["status"] != 200;
+    }
+    EXPECT_EQ(precious, 1);
+    EXPECT_EQ(refused, fault.refused ? 1 : 0);
+    EXPECT_TRUE(metTheFault);
+  }
 }
 
 }  // namespace
