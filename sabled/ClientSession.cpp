@@ -172,7 +172,7 @@ void ClientSession::_addFeedback(const std::shared_ptr<SableFeedback>& feedback)
   ledger::take(assembly_.tally, *feedback);
   platform::Function<void()> done;
   if (assembly_.testFeedbacks) done = keepWhenWritten(feedback);
-  if (storageHandle_) return storageHandle_->writeFeedback(*feedback, std::move(done));
+  if (storageHandle_) return storageHandle_->writeFeedback(feedback, std::move(done));
   ledger::count(assembly_.tally, SBLLedgerEntry::noFile);
   if (done) done();
 }

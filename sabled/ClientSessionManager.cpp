@@ -1,5 +1,6 @@
 #include "sabled/ClientSessionManager.h"
 
+#include <optional>
 #include <utility>
 
 #include "SableKit/SBLBag.h"
@@ -69,6 +70,7 @@ class ClientSessionManager::Sessions : public std::enable_shared_from_this<Sessi
   void post(std::string_view notification) const;
 
   Assembly& assembly_;
+  std::optional<UUID> sessionGuid_;   ///< under which it began; asking it would be to wait for its queue
   std::uint64_t sessionCounter_ = 0;  ///< tells a timer whether its session is still the current one
   SessionEndReason flushReason_ = SessionEndReason::noPreviousSession;
   std::shared_ptr<const SBLBag> bagOfLastAgent_;  ///< kept, for a client reports many things in a row
@@ -93,7 +95,7 @@ bool ClientSessionManager::Sessions::isWanted(const SableFeedback& feedback) {
 
 SessionEvent ClientSessionManager::Sessions::eventOf(const SableFeedback& feedback) const {
   if (currentState == SessionState::noSession) return SessionEvent::feedbackReceived;
-  if (session->userGuid() != feedback.userGuid()) return SessionEvent::guidChanged;
+  if (sessionGuid_ != feedback.userGuid()) return SessionEvent::guidChanged;
   if (currentState == SessionState::active) return SessionEvent::feedbackReceived;
   if (suggestsSessionEnd(feedback)) return SessionEvent::sentinelFeedback;
   return expirationTime > assembly_.runtime.now() ? SessionEvent::feedbackReceived
@@ -129,6 +131,7 @@ void ClientSessionManager::Sessions::_updateState(const std::shared_ptr<SableFee
 
 void ClientSessionManager::Sessions::_setNewSession(const std::shared_ptr<SableFeedback>& feedback) {
   ++sessionCounter_;
+  sessionGuid_ = feedback->userGuid();
   const auto reason = static_cast<std::uint32_t>(flushReason_);
   if (assembly_.sharedSession) {
     session = std::make_shared<ClientSessionShared>(assembly_, feedback, reason);

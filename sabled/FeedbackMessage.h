@@ -9,6 +9,10 @@
 
 #include "platform/Dictionary.h"
 
+namespace google::protobuf {
+class MessageLite;
+}
+
 namespace sable {
 
 class SessionProcessingHelper;
@@ -68,8 +72,8 @@ class FeedbackMessage {
   virtual std::optional<SearchViewAppearance> searchViewAppearance() const = 0;
   virtual std::optional<std::uint32_t> customFeedbackType() const = 0;
 
-  /// The serialised message; parse() reads it back.
-  virtual std::string data() const = 0;
+  /// The message itself, for whoever serialises it; parse() reads that back.
+  virtual const google::protobuf::MessageLite& message() const = 0;
 };
 
 }  // namespace sable

@@ -65,7 +65,7 @@ class FeedbackOfKind final : public FeedbackMessage {
     return std::nullopt;
   }
 
-  std::string data() const override { return message_.SerializeAsString(); }
+  const M& message() const override { return message_; }
 
  private:
   std::string_view className_;

@@ -108,17 +108,22 @@ void FileContainer::writeSessionHeader(const ClientSession& session) {
   });
 }
 
-void FileContainer::writeFeedback(const SableFeedback& feedback, platform::Function<void()> done) {
-  queue_->async([self = shared_from_this(), data = feedback.data(), done = std::move(done)]() mutable {
-    self->addFeedback(data, std::move(done));
-  });
+void FileContainer::writeFeedback(std::shared_ptr<const SableFeedback> feedback,
+                                  platform::Function<void()> done) {
+  // Without a third thing to hold, this work needs no memory of its own in the queue.
+  if (!done) {
+    return queue_->async(
+        [self = shared_from_this(), feedback = std::move(feedback)] { self->addFeedback(*feedback, {}); });
+  }
+  queue_->async([self = shared_from_this(), feedback = std::move(feedback),
+                 done = std::move(done)]() mutable { self->addFeedback(*feedback, std::move(done)); });
 }
 
 /// Writes behind what the queue has to do already, so that what is behind in that is written together.
-void FileContainer::addFeedback(std::string_view data, platform::Function<void()> done) {
+void FileContainer::addFeedback(const SableFeedback& feedback, platform::Function<void()> done) {
   if (!fileHandle_) return ledger::count(assembly_.tally, endOfLaterRecords_);
   const bool isFirst = buffer_.empty();
-  if (_archiveData(data)) {
+  if (_archiveData(feedback.data())) {
     ++bufferedFeedbacks_;
     if (done) written_.push_back(std::move(done));
     if (buffer_.size() >= kMaximumBufferBytes) write();

@@ -56,9 +56,9 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
 
   /// Writes the first two records, later, from the session as it is now.
   void writeSessionHeader(const ClientSession& session);
-  /// Writes a record, later, and then calls `done` on the storage's queue. Where the file is closed
-  /// `done` is destroyed uncalled.
-  void writeFeedback(const SableFeedback& feedback, platform::Function<void()> done = {});
+  /// Writes a record, later, of the feedback, which does not change any more, and then calls `done` on the
+  /// storage's queue. Where the file is closed `done` is destroyed uncalled.
+  void writeFeedback(std::shared_ptr<const SableFeedback> feedback, platform::Function<void()> done = {});
 
   /// The session with its feedback; null when the file is none that this daemon can use, which is
   /// logged. Waits for the disk.
@@ -84,7 +84,7 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
  private:
   bool _archiveData(std::string_view bytes);
   bool hasRoomFor(std::uint64_t bytes);
-  void addFeedback(std::string_view data, platform::Function<void()> done);
+  void addFeedback(const SableFeedback& feedback, platform::Function<void()> done);
   bool write();
   std::shared_ptr<ClientSession> readFile();
   std::shared_ptr<ClientSession> _unarchiveObject(platform::ReadableFile& fileHandle);

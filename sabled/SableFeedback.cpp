@@ -1,5 +1,9 @@
 #include "sabled/SableFeedback.h"
 
+#include <google/protobuf/io/coded_stream.h>
+#include <google/protobuf/wire_format_lite.h>
+
+#include <algorithm>
 #include <nlohmann/json.hpp>
 
 #include "SableKit/SBLError.h"
@@ -12,6 +16,15 @@ namespace sable {
 namespace {
 
 constexpr std::uint64_t kNanosecondsPerMillisecond = 1'000'000;
+constexpr std::size_t kTagBytes = 1;  // of fields up to 15
+
+/// The tag and length of a field whose bytes follow.
+std::uint8_t* writeLength(int field, std::size_t length, std::uint8_t* to) {
+  using Wire = google::protobuf::internal::WireFormatLite;
+  to = Wire::WriteTagToArray(field, Wire::WIRETYPE_LENGTH_DELIMITED, to);
+  return google::protobuf::io::CodedOutputStream::WriteVarint32ToArray(static_cast<std::uint32_t>(length),
+                                                                       to);
+}
 
 }  // namespace
 
@@ -35,14 +48,30 @@ Expected<SableFeedback> SableFeedback::parse(std::string_view bytes) {
   return feedback;
 }
 
+/// Straight into one string: a record object would have to hold the message's bytes, and be made of four
+/// allocations, for every feedback.
 std::string SableFeedback::data() const {
-  messages::_SKSableFeedback record;
-  record.mutable_payload()->set_class_name(std::string(feedback_->className()));
-  record.mutable_payload()->set_feedback(feedback_->data());
-  record.set_query_id(queryId_);
-  record.set_client_query_id(clientQueryId_);
-  record.set_rel_timestamp(relTimestamp_);
-  return record.SerializeAsString();
+  using Record = messages::_SKSableFeedback;
+  using Payload = messages::_SKFeedbackPayload;
+  using Wire = google::protobuf::internal::WireFormatLite;
+  const auto lengthBytes = [](std::size_t size) { return kTagBytes + Wire::LengthDelimitedSize(size); };
+  const google::protobuf::MessageLite& message = feedback_->message();
+  const std::string_view name = feedback_->className();
+  const std::size_t messageSize = message.ByteSizeLong();
+  const std::size_t payloadSize = lengthBytes(name.size()) + lengthBytes(messageSize);
+  std::string bytes(lengthBytes(payloadSize) + 3 * kTagBytes + Wire::SInt64Size(queryId_) +
+                        Wire::UInt64Size(clientQueryId_) + Wire::UInt64Size(relTimestamp_),
+                    '\0');
+  auto* to = reinterpret_cast<std::uint8_t*>(bytes.data());
+  to = writeLength(Record::kPayloadFieldNumber, payloadSize, to);
+  to = writeLength(Payload::kClassNameFieldNumber, name.size(), to);
+  to = std::copy(name.begin(), name.end(), to);
+  to = writeLength(Payload::kFeedbackFieldNumber, messageSize, to);
+  to = message.SerializeWithCachedSizesToArray(to);
+  to = Wire::WriteSInt64ToArray(Record::kQueryIdFieldNumber, queryId_, to);
+  to = Wire::WriteUInt64ToArray(Record::kClientQueryIdFieldNumber, clientQueryId_, to);
+  Wire::WriteUInt64ToArray(Record::kRelTimestampFieldNumber, relTimestamp_, to);
+  return bytes;
 }
 
 Dictionary SableFeedback::dictionary() const {

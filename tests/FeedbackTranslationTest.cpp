@@ -1,3 +1,5 @@
+#include <fmt/core.h>
+#include <google/protobuf/message_lite.h>
 #include <gtest/gtest.h>
 
 #include <fstream>
@@ -208,6 +210,21 @@ TEST(FeedbackTranslation, APayloadIsAMessageAndItsClass) {
   EXPECT_EQ(compactJSON((*read)->dictionary()), R"({"uuid":"U1"})");
 }
 
+TEST(FeedbackTranslation, ARecordIsTheMessageThatItsSchemaDescribes) {
+  for (const int inputBytes : {0, 100, 200, 20000}) {  // lengths of one byte, two and three
+    const auto start =
+        *messageFromJSON("RKStartSearchFeedback", fmt::format(R"({{"input": "{:x>{}}"}})", "", inputBytes));
+    for (const std::int64_t queryId : {std::int64_t{0}, std::int64_t{-7}, std::int64_t{1} << 62}) {
+      const SableFeedback feedback(*FeedbackMessage::parse("RKStartSearchFeedback", start), queryId,
+                                   std::nullopt, "", 3);
+      const auto json = messageToJSON("_SKSableFeedback", feedback.data());
+      ASSERT_TRUE(json) << json.error().reason;
+      EXPECT_EQ(*messageFromJSON("_SKSableFeedback", *json), feedback.data()) << inputBytes << " " << queryId;
+      EXPECT_EQ(SableFeedback::parse(feedback.data())->queryId(), queryId);
+    }
+  }
+}
+
 TEST(FeedbackTranslation, ARecordSurvivesItsSessionFile) {
   // The last field is one that this build does not know.
   auto unknown =
@@ -217,7 +234,7 @@ TEST(FeedbackTranslation, ARecordSurvivesItsSessionFile) {
   const auto read = SableFeedback::parse(stored.data());
   ASSERT_TRUE(read) << read.error().reason;
   EXPECT_EQ(read->data(), stored.data());
-  EXPECT_EQ(read->feedback().data(), unknown);
+  EXPECT_EQ(read->feedback().message().SerializeAsString(), unknown);
   EXPECT_EQ(read->dictionary(), stored.dictionary());
   EXPECT_EQ(read->queryId(), 7);
   EXPECT_EQ(read->description(),
