@@ -207,6 +207,8 @@ void ClientSession::sessionComplete() {
 SableFeedbacks ClientSession::getSessionFeedbacks() {
   return sessionQueue_->sync([this] {
     SableFeedbacks sorted = *sessionFeedbacks_;
+    for (const auto& stored : storedFeedbacks_)
+      sorted.push_back(std::make_shared<SableFeedback>(read(stored)));
     std::ranges::stable_sort(sorted, [](const auto& one, const auto& other) {
       return SableFeedback::timeStampComparator(*one, *other) < 0;
     });
@@ -214,8 +216,25 @@ SableFeedbacks ClientSession::getSessionFeedbacks() {
   });
 }
 
-void ClientSession::addSessionFeedbacks(std::shared_ptr<SableFeedback> feedback) {
-  sessionQueue_->sync([&] { sessionFeedbacks_->push_back(std::move(feedback)); });
+std::size_t ClientSession::countOfSessionFeedbacks() {
+  return sessionQueue_->sync([this] { return sessionFeedbacks_->size() + storedFeedbacks_.size(); });
+}
+
+void ClientSession::addSessionFeedbacks(std::string_view record, const SableFeedback& feedback) {
+  storedFeedbacks_.push_back({record, feedback.feedback().timestamp(), feedback.feedback().hasIdentifiers()});
+}
+
+void ClientSession::setFile(std::unique_ptr<platform::ReadableFile> file) {
+  file_ = std::move(file);
+  std::ranges::stable_sort(storedFeedbacks_, {}, &StoredFeedback::timestamp);
+}
+
+/// It was read before, so it can be read.
+SableFeedback ClientSession::read(const StoredFeedback& stored) const {
+  auto feedback = SableFeedback::parse(stored.record);
+  feedback->setUserAgent(agent_);
+  feedback->setUserGuid(userGuid_);
+  return *std::move(feedback);
 }
 
 void ClientSession::enumerateSessions(const std::function<void(ClientSession&, bool)>& callback) {

@@ -7,8 +7,10 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/Error.h"
+#include "platform/FileManager.h"
 #include "platform/Function.h"
 #include "platform/Runtime.h"
 #include "sabled/FeedbackSession.h"
@@ -17,6 +19,7 @@ namespace sable {
 
 class Assembly;
 class FileContainer;
+class SessionProcessingHelper;
 
 /// What one client reported between two session boundaries.
 ///
@@ -47,8 +50,13 @@ class ClientSession final : public FeedbackSession {
   /// Hands the file over to the storage.
   void sessionComplete();
 
+  /// Of a session that was read back they are made anew each time.
   SableFeedbacks getSessionFeedbacks() override;
-  void addSessionFeedbacks(std::shared_ptr<SableFeedback> feedback);
+  std::size_t countOfSessionFeedbacks();
+  /// A record of the file that the session is read back from, and what it says. The bytes are kept by
+  /// setFile(), which follows; the feedback is not kept, but read again whenever it is needed.
+  void addSessionFeedbacks(std::string_view record, const SableFeedback& feedback);
+  void setFile(std::unique_ptr<platform::ReadableFile> file);
   Dictionary feedbacksWithRelativeTimestamp() override;
   Dictionary privacyFilteredFeedbacksWithRelativeTimestamp(const SableFeedbacks& feedbacks) override;
   /// The upload's envelope of a session that was read back. Once: its feedback is processed.
@@ -79,10 +87,19 @@ class ClientSession final : public FeedbackSession {
  private:
   explicit ClientSession(Assembly& assembly);
 
-  using RecordVisitor = std::function<bool(const Dictionary& record)>;
+  /// Feedback in file_.
+  struct StoredFeedback {
+    std::string_view record;
+    std::uint64_t timestamp = 0;
+    bool hasIdentifiers = false;
+  };
+  using RecordVisitor = std::function<bool(const SableFeedback& record)>;
 
   void begin(const SableFeedback* feedback);
   bool visitRecordsToSend(const SableFeedbacks& feedbacks, const RecordVisitor& visit);
+  bool visitStoredRecordsToSend(const RecordVisitor& visit);
+  bool visitMissing(const SessionProcessingHelper& helper, const RecordVisitor& visit);
+  SableFeedback read(const StoredFeedback& stored) const;
   Dictionary envelopeBehindFeedback();
   bool _firstUseOfTheDay(const std::string& agent);
   bool _updateFirstUseDate(platform::WallTime date, const std::string& agent);
@@ -103,6 +120,8 @@ class ClientSession final : public FeedbackSession {
   std::uint32_t previousSessionEndReason_ = 0;
   bool firstUseOfTheDay_ = false;
   std::shared_ptr<FileContainer> storageHandle_;
+  std::unique_ptr<platform::ReadableFile> file_;  ///< null when the session was not read back
+  std::vector<StoredFeedback> storedFeedbacks_;   ///< by time; not changed any more once there is file_
 
   std::optional<platform::WallTime> firstUseDate_;  ///< on dateQueue_
 };

@@ -15,10 +15,11 @@ namespace sable {
 namespace {
 
 constexpr std::uint64_t kNanosecondsPerMillisecond = 1'000'000;
+/// So much JSON is handed on at once, and a record more.
+constexpr std::size_t kPieceBytes = 32u << 10;
 
-/// Times a record from the first one of its list; one that is older than that is of its time.
-void setRelativeTimestamp(SableFeedback& feedback, const SableFeedback& first) {
-  const std::uint64_t base = first.feedback().timestamp();
+/// Times a record from `base`, the time of the first one; one that is older than that is of its time.
+void setRelativeTimestamp(SableFeedback& feedback, std::uint64_t base) {
   const std::uint64_t time = std::max(base, feedback.feedback().timestamp());
   feedback.setRelTimestamp((time - base) / kNanosecondsPerMillisecond);
 }
@@ -36,7 +37,7 @@ Dictionary ClientSession::feedbacksWithRelativeTimestamp() {
   Dictionary result = Dictionary::array();
   const auto feedbacks = getSessionFeedbacks();
   for (const auto& feedback : feedbacks) {
-    setRelativeTimestamp(*feedback, *feedbacks.front());
+    setRelativeTimestamp(*feedback, feedbacks.front()->feedback().timestamp());
     result.push_back(feedback->dictionary());
   }
   return result;
@@ -44,8 +45,8 @@ Dictionary ClientSession::feedbacksWithRelativeTimestamp() {
 
 Dictionary ClientSession::privacyFilteredFeedbacksWithRelativeTimestamp(const SableFeedbacks& feedbacks) {
   Dictionary result = Dictionary::array();
-  visitRecordsToSend(feedbacks, [&](const Dictionary& record) {
-    result.push_back(record);
+  visitRecordsToSend(feedbacks, [&](const SableFeedback& record) {
+    result.push_back(record.dictionary());
     return true;
   });
   return result;
@@ -56,17 +57,39 @@ Dictionary ClientSession::privacyFilteredFeedbacksWithRelativeTimestamp(const Sa
 bool ClientSession::visitRecordsToSend(const SableFeedbacks& feedbacks, const RecordVisitor& visit) {
   SessionProcessingHelper helper;
   for (const auto& feedback : feedbacks) {
-    setRelativeTimestamp(*feedback, *feedbacks.front());
+    setRelativeTimestamp(*feedback, feedbacks.front()->feedback().timestamp());
     feedback->process(helper);
   }
-  const auto visitMissing = [&](const std::vector<std::string>& missing, auto message) {
-    if (missing.empty()) return true;
-    return visit(
-        SableFeedback(message(assembly_.runtime.ticks(), missing), 0, userGuid(), agent_).dictionary());
+  return visitMissing(helper, visit) &&
+         std::ranges::all_of(feedbacks, [&](const auto& feedback) { return visit(*feedback); });
+}
+
+/// The same of the feedback in the file, which is never in memory as a whole: what is missing is found on a
+/// way of its own, and on the second one each identifier gets the same replacement again.
+bool ClientSession::visitStoredRecordsToSend(const RecordVisitor& visit) {
+  SableFeedbackReader reader;
+  const auto read = [&](const StoredFeedback& stored) -> SableFeedback& {
+    return **reader.read(stored.record);  // as it could be when the file was read
   };
-  return visitMissing(helper.missingSuggestions(), feedback::sessionMissingSuggestions) &&
-         visitMissing(helper.missingResults(), feedback::sessionMissingResults) &&
-         std::ranges::all_of(feedbacks, [&](const auto& feedback) { return visit(feedback->dictionary()); });
+  SessionProcessingHelper first, second;
+  for (const auto& stored : storedFeedbacks_) {
+    if (stored.hasIdentifiers) read(stored).process(first);
+  }
+  return visitMissing(first, visit) && std::ranges::all_of(storedFeedbacks_, [&](const auto& stored) {
+           SableFeedback& feedback = read(stored);
+           setRelativeTimestamp(feedback, storedFeedbacks_.front().timestamp);
+           feedback.process(second);
+           return visit(feedback);
+         });
+}
+
+bool ClientSession::visitMissing(const SessionProcessingHelper& helper, const RecordVisitor& visit) {
+  const auto visitOne = [&](const std::vector<std::string>& missing, auto message) {
+    if (missing.empty()) return true;
+    return visit(SableFeedback(message(assembly_.runtime.ticks(), missing), 0, userGuid(), agent_));
+  };
+  return visitOne(helper.missingSuggestions(), feedback::sessionMissingSuggestions) &&
+         visitOne(helper.missingResults(), feedback::sessionMissingResults);
 }
 
 Dictionary ClientSession::getFeedbacksToSend() {
@@ -77,13 +100,20 @@ Dictionary ClientSession::getFeedbacksToSend() {
 }
 
 bool ClientSession::writeFeedbacksToSend(const std::function<bool(std::string_view)>& write) {
-  std::string_view separator = R"({"fb":[)";
-  const bool written = visitRecordsToSend(getSessionFeedbacks(), [&](const Dictionary& record) {
-    return write(std::exchange(separator, ",")) && write(compactJSON(record));
-  });
-  if (!written || (separator != "," && !write(separator))) return false;
-  const std::string rest = compactJSON(envelopeBehindFeedback());
-  return write("],") && write(std::string_view(rest).substr(1));
+  std::string piece = R"({"fb":[)";
+  bool isFirst = true;
+  const auto writeRecord = [&](const SableFeedback& record) {
+    if (!std::exchange(isFirst, false)) piece += ',';
+    record.writeJSON(piece);
+    if (piece.size() < kPieceBytes) return true;
+    const bool wanted = write(piece);
+    piece.clear();
+    return wanted;
+  };
+  const bool written =
+      file_ ? visitStoredRecordsToSend(writeRecord) : visitRecordsToSend(getSessionFeedbacks(), writeRecord);
+  piece.append("],").append(compactJSON(envelopeBehindFeedback()), 1);
+  return written && write(piece);
 }
 
 /// The keys that follow "fb".

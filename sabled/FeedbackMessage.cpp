@@ -12,14 +12,33 @@
 
 namespace sable {
 
+namespace {
+
+tl::unexpected<Error> refusal(std::string reason) {
+  return tl::unexpected(makeSBLError(SBLErrorCode::daemonSide, std::move(reason)));
+}
+
+}  // namespace
+
 namespace feedback {
 
-void Untranslated::write(const messages::_SKFeedback&, Dictionary&) {
+tl::unexpected<Error> noMessage(std::string_view className) {
+  return refusal(fmt::format("the bytes are no {}", className));
+}
+
+Expected<void> checkOwnObject(std::string_view className, const std::string& text) {
+  const auto json = parseJSON(text, text.size());
+  if (!json) return refusal(fmt::format("JSON of {}: {}", className, json.error().reason));
+  if (!json->is_object()) return refusal(fmt::format("JSON of {} is no object", className));
+  return {};
+}
+
+void Untranslated::write(const messages::_SKFeedback&, JSONObject&) {
   SableLogForCategory(SableLoggingCategoryFeedbackErrors)
       .error("Feedback dictionary translation for {} fell back to default implementation.", "_SKFeedback");
 }
 
-void ResultGrading::writeGrade(std::uint32_t grade, Dictionary& d) {
+void ResultGrading::writeGrade(std::uint32_t grade, JSONObject& d) {
   if (grade < std::size(kResultGrades)) {
     d["grade"] = kResultGrades[grade];
   } else {
@@ -31,10 +50,6 @@ void ResultGrading::writeGrade(std::uint32_t grade, Dictionary& d) {
 }  // namespace feedback
 
 namespace {
-
-tl::unexpected<Error> refusal(std::string reason) {
-  return tl::unexpected(makeSBLError(SBLErrorCode::daemonSide, std::move(reason)));
-}
 
 std::optional<Error> tooLong(std::string_view bytes) {
   if (bytes.size() <= kMaximumFeedbackBytes) return std::nullopt;
@@ -49,16 +64,9 @@ struct FeedbackClass {
 
 template <class Kind, class M>
 Expected<std::unique_ptr<FeedbackMessage>> parseAs(std::string_view name, std::string_view bytes) {
-  M message;
-  if (!parseMessage(message, bytes)) {
-    return refusal(fmt::format("the bytes are no {}", name));
-  }
-  if constexpr (std::is_same_v<Kind, feedback::Custom>) {
-    const auto json = parseJSON(message.json_feedback(), message.json_feedback().size());
-    if (!json) return refusal(fmt::format("JSON of {}: {}", name, json.error().reason));
-    if (!json->is_object()) return refusal(fmt::format("JSON of {} is no object", name));
-  }
-  return std::make_unique<feedback::FeedbackOfKind<Kind, M>>(name, std::move(message));
+  auto message = std::make_unique<feedback::FeedbackOfKind<Kind, M>>(name);
+  if (auto assigned = message->assign(bytes); !assigned) return tl::unexpected(std::move(assigned.error()));
+  return message;
 }
 
 #define FEEDBACK_CLASS(kind, name) \
@@ -132,6 +140,16 @@ constexpr FeedbackClass kClasses[] = {
 #undef FEEDBACK_CLASS
 
 }  // namespace
+
+Dictionary FeedbackMessage::dictionary() const {
+  if (auto own = ownObject()) return *std::move(own);
+  std::string text;
+  {
+    JSONObject object{JSONPlace(text)};
+    write(object);
+  }
+  return *parseJSON(text, text.size());
+}
 
 Expected<std::unique_ptr<FeedbackMessage>> FeedbackMessage::parse(std::string_view className,
                                                                   std::string_view bytes) {

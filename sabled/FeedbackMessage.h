@@ -15,6 +15,7 @@ class MessageLite;
 
 namespace sable {
 
+class JSONObject;
 class SessionProcessingHelper;
 
 /// A client's longer message is refused: it would be kept, and translated as a whole.
@@ -51,13 +52,23 @@ class FeedbackMessage {
   /// The classes that a feedback may have, in the order of their kinds.
   static std::vector<std::string_view> classNames();
 
+  /// Becomes another message of its class, in the memory of this one. The error is that of parse(), and
+  /// then the message is of no use.
+  virtual Expected<void> assign(std::string_view bytes) = 0;
+
   virtual std::string_view className() const = 0;
-  /// The kind's own keys, in order, as they are uploaded.
-  virtual Dictionary dictionary() const = 0;
+  /// Writes the kind's own keys, in order, as they are uploaded; none where there is an ownObject().
+  virtual void write(JSONObject& object) const = 0;
+  /// The object that the client itself has made, for a kind that has such: any keys in any order.
+  virtual std::optional<Dictionary> ownObject() const = 0;
+  /// Either of them.
+  Dictionary dictionary() const;
   /// Index into SableFeedback::eventTypes().
   virtual unsigned type() const = 0;
   /// Whether the record names the query that it belongs to.
   virtual bool requiresQueryId() const = 0;
+  /// Whether process() does anything.
+  virtual bool hasIdentifiers() const = 0;
   /// Puts the helper's replacements in place of identifiers, and tells it which ones were only
   /// shown and which were used.
   virtual void process(SessionProcessingHelper& helper) = 0;

@@ -5,26 +5,43 @@
 #include "sabled/FeedbackKinds.h"
 #include "sabled/FeedbackMessage.h"
 #include "sabled/FeedbackProcessing.h"
+#include "sabled/ParsedMessage.h"
 
 namespace sable::feedback {
+
+/// Why bytes are no message of the class.
+tl::unexpected<Error> noMessage(std::string_view className);
+/// Whether the text is a JSON object; if not, why it is refused.
+Expected<void> checkOwnObject(std::string_view className, const std::string& text);
 
 /// A message of a class and the kind that the class is of. The name is a constant.
 template <class Kind, class M>
 class FeedbackOfKind final : public FeedbackMessage {
  public:
-  FeedbackOfKind(std::string_view className, M message)
+  explicit FeedbackOfKind(std::string_view className, M message = {})
       : className_(className), message_(std::move(message)) {}
+
+  Expected<void> assign(std::string_view bytes) override {
+    if (!parseMessage(message_, bytes)) return noMessage(className_);
+    if constexpr (std::is_same_v<Kind, Custom>) return checkOwnObject(className_, message_.json_feedback());
+    return {};
+  }
 
   std::string_view className() const override { return className_; }
 
-  Dictionary dictionary() const override {
-    Dictionary dictionary = Dictionary::object();
-    Kind::write(message_, dictionary);
-    return dictionary;
+  void write(JSONObject& object) const override {
+    if constexpr (!std::is_same_v<Kind, Custom>) Kind::write(message_, object);
+  }
+
+  std::optional<Dictionary> ownObject() const override {
+    if constexpr (std::is_same_v<Kind, Custom>) return Custom::own(message_);
+    return std::nullopt;
   }
 
   unsigned type() const override { return Kind::type(message_); }
   bool requiresQueryId() const override { return Kind::requiresQueryId(message_); }
+
+  bool hasIdentifiers() const override { return Kind::identifiers != Identifiers::kept; }
 
   void process(SessionProcessingHelper& helper) override {
     if constexpr (Kind::identifiers != Identifiers::kept) {

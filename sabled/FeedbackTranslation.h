@@ -1,56 +1,73 @@
 #pragma once
 
-#include <nlohmann/json.hpp>
+#include <optional>
 #include <span>
 #include <string>
 #include <string_view>
 #include <unordered_map>
-#include <utility>
+#include <vector>
 
 #include "SableKit/messages/Shared.pb.h"
-#include "platform/Dictionary.h"
 #include "sabled/FeedbackTables.h"
+#include "sabled/JSONWriter.h"
 
-/// The parts that several kinds of feedback have in common, as JSON. A template takes the message of
-/// either family.
+/// The parts that several kinds of feedback have in common, as JSON: each writes a value into its
+/// place, or members into an object. A template takes the message of either family.
 namespace sable::feedback {
 
-inline Dictionary orNull(bool present, const std::string& text) {
-  return present ? Dictionary(text) : Dictionary();
+/// Nothing is null. The text is the caller's.
+inline std::optional<std::string_view> orNull(bool present, const std::string& text) {
+  return present ? std::optional<std::string_view>(text) : std::nullopt;
 }
 
 /// A number without a word is null.
-inline Dictionary word(std::span<const std::string_view> table, std::uint32_t index) {
+inline std::optional<std::string_view> word(std::span<const std::string_view> table, std::uint32_t index) {
   const std::string_view text = wordOf(table, index);
-  return text.empty() ? Dictionary() : Dictionary(text);
+  return text.empty() ? std::nullopt : std::optional(text);
 }
 
-/// An array of translated members; null for an empty list, which on the wire is no list.
+/// An array of translated members.
 template <class List, class Translate>
-Dictionary listOrNull(const List& list, Translate translate) {
-  Dictionary array;
-  for (const auto& member : list) array.push_back(translate(member));
-  return array;
+void list(JSONPlace place, const List& members, Translate translate) {
+  JSONArray array(place);
+  for (const auto& member : members) translate(array.next(), member);
 }
 
-/// An object whose members a stranger counts: setting one takes the same time whatever their number.
-class ObjectBuilder {
- public:
-  /// Of members with one name the last value counts, in the first one's place.
-  void set(const std::string& key, Dictionary value);
-  Dictionary take() { return std::move(object_); }
+/// The same; null for an empty list, which on the wire is no list.
+template <class List, class Translate>
+void listOrNull(JSONPlace place, const List& members, Translate translate) {
+  if (members.empty()) {
+    place = nullptr;
+  } else {
+    list(place, members, translate);
+  }
+}
 
- private:
-  Dictionary object_ = Dictionary::object();
-  std::unordered_map<std::string, std::size_t> places_;
-};
+/// Of fields with one key the last one, in the first one's place; `keyOf` leaves a field out with nothing.
+/// A stranger counts them: it takes time in proportion to their number.
+template <class Field, class KeyOf>
+std::vector<const Field*> withoutRepeated(const google::protobuf::RepeatedPtrField<Field>& fields,
+                                          KeyOf keyOf) {
+  std::vector<const Field*> kept;
+  std::unordered_map<std::string_view, std::size_t> places;
+  for (const Field& field : fields) {
+    const std::optional<std::string_view> key = keyOf(field);
+    if (!key) continue;
+    const auto [place, isNew] = places.try_emplace(*key, kept.size());
+    if (isNew) kept.push_back(nullptr);
+    kept[place->second] = &field;
+  }
+  return kept;
+}
 
 /// The first URL, or null.
-Dictionary firstURL(const messages::SBLPunchout& punchout);
-Dictionary localFeatures(const google::protobuf::RepeatedPtrField<messages::SBLLocalFeature>& features);
-Dictionary headerFields(const google::protobuf::RepeatedPtrField<messages::SBLHeaderField>& fields);
-Dictionary errorRecord(const messages::SBLErrorRecord& error);
-Dictionary searchSuggestion(const messages::RKSearchSuggestion& suggestion);
+std::optional<std::string_view> firstURL(const messages::SBLPunchout& punchout);
+void localFeatures(JSONPlace place,
+                   const google::protobuf::RepeatedPtrField<messages::SBLLocalFeature>& features);
+void headerFields(JSONPlace place,
+                  const google::protobuf::RepeatedPtrField<messages::SBLHeaderField>& fields);
+void errorRecord(JSONPlace place, const messages::SBLErrorRecord& error);
+void searchSuggestion(JSONPlace place, const messages::RKSearchSuggestion& suggestion);
 
 inline constexpr std::uint32_t kSableResult = 1;
 inline constexpr std::uint32_t kUserActivityResult = 4;
@@ -60,15 +77,14 @@ inline constexpr std::uint32_t kFirstWebEngineResult = 9, kLastWebEngineResult =
 inline constexpr std::string_view kAnyApplication = "com.kestrel.application";
 
 template <class Result>
-Dictionary resultBundleIdentifier(const Result& result) {
-  if (!result.has_result_bundle_id() && !result.has_application_bundle_identifier()) return nullptr;
+std::optional<std::string_view> resultBundleIdentifier(const Result& result) {
+  if (!result.has_result_bundle_id() && !result.has_application_bundle_identifier()) return std::nullopt;
   if (result.is_local_application_result()) return kAnyApplication;
   return result.has_result_bundle_id() ? result.result_bundle_id() : result.application_bundle_identifier();
 }
 
 template <class Result>
-Dictionary searchResult(const Result& result) {
-  Dictionary d;
+void writeSearchResult(const Result& result, JSONObject& d) {
   d["id"] = orNull(result.has_identifier(), result.identifier());
   d["score"] = result.ranking_score();
   d["result_type"] = word(kResultTypes, result.type());
@@ -77,55 +93,56 @@ Dictionary searchResult(const Result& result) {
   d["section_bundle_id"] = orNull(result.has_section_bundle_id(), result.section_bundle_id());
   d["bundle_id"] = resultBundleIdentifier(result);
   d["fbr"] = orNull(result.has_fbr(), result.fbr());
-  if (result.local_features_size() > 0) d["local_features"] = localFeatures(result.local_features());
+  if (result.local_features_size() > 0) localFeatures(d["local_features"], result.local_features());
   if (result.has_corrected_query()) d["corrected_query"] = result.corrected_query();
   d["static_correction"] = result.static_correction();
-  return d;
 }
 
-template <class List>
-Dictionary searchResults(const List& results) {
-  return listOrNull(results, [](const auto& result) { return searchResult(result); });
-}
+inline constexpr auto searchResult = [](JSONPlace place, const auto& result) {
+  JSONObject d(place);
+  writeSearchResult(result, d);
+};
 
 template <class Section>
-Dictionary resultSection(const Section& section) {
-  Dictionary d;
+void writeSectionWithoutResults(const Section& section, JSONObject& d) {
   d["id"] = orNull(section.has_identifier(), section.identifier());
   d["score"] = section.score();
   d["bundle_id"] = orNull(section.has_bundle_id(), section.bundle_id());
-  d["results"] = searchResults(section.results());
-  return d;
 }
+
+inline constexpr auto resultSection = [](JSONPlace place, const auto& section) {
+  JSONObject d(place);
+  writeSectionWithoutResults(section, d);
+  listOrNull(d["results"], section.results(), searchResult);
+};
 
 /// What the ranker did with a result, behind the result's own keys.
-template <class Ranking>
-Dictionary resultRanking(const Ranking& ranking) {
-  Dictionary d = ranking.has_result() ? searchResult(ranking.result()) : Dictionary();
+inline constexpr auto resultRanking = [](JSONPlace place, const auto& ranking) {
+  JSONObject d(place);
+  if (ranking.has_result()) writeSearchResult(ranking.result(), d);
   d["local_result_position"] = ranking.local_result_position();
-  d["hidden_results"] = Dictionary::array();
-  for (const auto& hidden : ranking.hidden_results()) d["hidden_results"].push_back(searchResult(hidden));
-  d["duplicate_results"] = Dictionary::array();
-  for (const auto& duplicate : ranking.duplicate_results()) {
-    d["duplicate_results"].push_back(searchResult(duplicate));
-  }
-  return d;
-}
+  list(d["hidden_results"], ranking.hidden_results(), searchResult);
+  list(d["duplicate_results"], ranking.duplicate_results(), searchResult);
+};
 
 /// What the ranker did with a section; its "results" are ranked ones, in the place of the section's.
-template <class Ranking>
-Dictionary sectionRanking(const Ranking& ranking) {
-  Dictionary d = ranking.has_section() ? resultSection(ranking.section()) : Dictionary();
-  d["local_section_position"] = ranking.local_section_position();
-  d["results"] = listOrNull(ranking.results(), [](const auto& result) { return resultRanking(result); });
-  return d;
-}
+inline constexpr auto sectionRanking = [](JSONPlace place, const auto& ranking) {
+  JSONObject d(place);
+  if (ranking.has_section()) {
+    writeSectionWithoutResults(ranking.section(), d);
+    listOrNull(d["results"], ranking.results(), resultRanking);
+    d["local_section_position"] = ranking.local_section_position();
+  } else {
+    d["local_section_position"] = ranking.local_section_position();
+    listOrNull(d["results"], ranking.results(), resultRanking);
+  }
+};
 
 /// The "result" of an engagement: who it was, and where the user went.
 template <class Engagement>
-Dictionary engagedResult(const Engagement& engagement) {
+void engagedResult(JSONPlace place, const Engagement& engagement) {
   const auto& result = engagement.result();
-  Dictionary d;
+  JSONObject d(place);
   d["id"] = orNull(result.has_identifier(), result.identifier());
   if (result.type() >= kFirstWebEngineResult && result.type() <= kLastWebEngineResult &&
       engagement.result_had_title()) {
@@ -139,7 +156,6 @@ Dictionary engagedResult(const Engagement& engagement) {
   } else {
     d["action_destination"] = firstURL(result.punchout());
   }
-  return d;
 }
 
 }  // namespace sable::feedback

@@ -59,20 +59,18 @@ std::uint64_t wholeRecords(std::string_view bytes) {
 
 /// Reads the records after the first two, up to one that cannot be used; says how many.
 std::uint64_t decodeFeedbacks(ArchivedDataIterator& records, std::size_t dataLength, ClientSession& session) {
-  const auto userGuid = session.userGuid();
+  SableFeedbackReader reader;
   std::uint64_t count = 0;
   while (records.hasMore()) {
     const auto record = records.readNextObject();
     if (!record) break;
-    auto feedback = SableFeedback::parse(*record);
+    const auto feedback = reader.read(*record);
     if (!feedback) {
       log().error("{}", feedback.error().reason);
       log().error("could not unarchive feedback range {} size {}", records.position(), dataLength);
       break;
     }
-    feedback->setUserAgent(session.agent());
-    feedback->setUserGuid(userGuid);
-    session.addSessionFeedbacks(std::make_shared<SableFeedback>(*std::move(feedback)));
+    session.addSessionFeedbacks(*record, **feedback);
     ++count;
   }
   return count;
@@ -245,17 +243,18 @@ std::shared_ptr<ClientSession> FileContainer::readFile() {
     log().error("Session too big to process");
     return nullptr;
   }
-  const auto file = assembly_.fileManager.openForReading(location_);
+  auto file = assembly_.fileManager.openForReading(location_);
   if (!file) {
     log().error("Could not open file for reading {}", fileUrl_.native());
     return nullptr;
   }
-  return _unarchiveObject(**file);
+  return _unarchiveObject(*std::move(file));
 }
 
-std::shared_ptr<ClientSession> FileContainer::_unarchiveObject(platform::ReadableFile& fileHandle) {
+std::shared_ptr<ClientSession> FileContainer::_unarchiveObject(
+    std::unique_ptr<platform::ReadableFile> fileHandle) {
   queue_->assertIsCurrent();
-  const auto data = mmapFileHandle(fileHandle);
+  const auto data = mmapFileHandle(*fileHandle);
   if (!data) return nullptr;
   log().debug("unarchive {}", fileUrl_.native());
   if (data->empty()) {
@@ -263,7 +262,9 @@ std::shared_ptr<ClientSession> FileContainer::_unarchiveObject(platform::Readabl
     return nullptr;
   }
   try {
-    return decode(*data);
+    auto session = decode(*data);
+    if (session) session->setFile(std::move(fileHandle));
+    return session;
   } catch (const std::exception& failure) {
     log().error("exception reading session archive {}", failure.what());
     return nullptr;

@@ -61,7 +61,7 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
   void writeFeedback(std::shared_ptr<const SableFeedback> feedback, platform::Function<void()> done = {});
 
   /// The session with its feedback; null when the file is none that this daemon can use, which is
-  /// logged. Waits for the disk.
+  /// logged. The session keeps the file open, and readable though it be deleted. Waits for the disk.
   std::shared_ptr<ClientSession> read();
 
   // For the storage, on its queue.
@@ -87,7 +87,7 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
   void addFeedback(const SableFeedback& feedback, platform::Function<void()> done);
   bool write();
   std::shared_ptr<ClientSession> readFile();
-  std::shared_ptr<ClientSession> _unarchiveObject(platform::ReadableFile& fileHandle);
+  std::shared_ptr<ClientSession> _unarchiveObject(std::unique_ptr<platform::ReadableFile> fileHandle);
   std::shared_ptr<ClientSession> decode(std::string_view data);
 
   Assembly& assembly_;

@@ -4,7 +4,7 @@
 
 #include <algorithm>
 #include <cmath>
-#include <nlohmann/json.hpp>
+#include <optional>
 #include <vector>
 
 #include "platform/IPAddress.h"
@@ -32,7 +32,8 @@ struct SableNetEventTimingFeedback {
 
 struct SableNetEventStatsFeedback {
   std::string_view name;
-  Dictionary stats;
+  const messages::SBLNetworkTiming& stats;
+  void (*write)(JSONPlace place, const messages::SBLNetworkTiming& stats);
 };
 
 std::string_view withoutPrefix(std::string_view key) {
@@ -45,42 +46,47 @@ bool isTimingKey(std::string_view key, std::string_view name) {
   return key.starts_with(kTimingPrefix) && withoutPrefix(key) == name;
 }
 
-Dictionary everyEntry(const messages::SBLNetworkTiming& statistics);
+void everyEntry(JSONPlace place, const messages::SBLNetworkTiming& statistics);
 
-Dictionary value(const Entry& entry) {
+void writeValue(JSONPlace place, const Entry& entry) {
   switch (entry.value_case()) {
     case Entry::kNumber:
-      return entry.number();
+      return place = entry.number();
     case Entry::kInteger:
-      return entry.integer();
+      return place = entry.integer();
     case Entry::kFlag:
-      return entry.flag();
+      return place = entry.flag();
     case Entry::kText:
-      return entry.text();
+      return place = entry.text();
     case Entry::kStatistics:
-      return everyEntry(entry.statistics());
+      return everyEntry(place, entry.statistics());
     case Entry::kData:  // JSON has no bytes
     case Entry::VALUE_NOT_SET:
       break;
   }
-  return nullptr;
+  place = nullptr;
 }
 
-Dictionary everyEntry(const messages::SBLNetworkTiming& statistics) {
-  ObjectBuilder stats;
-  for (const Entry& entry : statistics.entries()) stats.set(entry.key(), value(entry));
-  return stats.take();
+void everyEntry(JSONPlace place, const messages::SBLNetworkTiming& statistics) {
+  JSONObject stats(place);
+  const auto key = [](const Entry& entry) -> std::optional<std::string_view> { return entry.key(); };
+  for (const Entry* entry : withoutRepeated(statistics.entries(), key))
+    writeValue(stats[entry->key()], *entry);
+}
+
+std::string_view statName(const Entry& entry) {
+  return std::string_view(entry.key()).substr(std::min(kStatPrefixLength, entry.key().size()));
 }
 
 /// Those whose integer part is not 0.
-Dictionary countsOf(const messages::SBLNetworkTiming& statistics) {
-  ObjectBuilder stats;
-  for (const Entry& entry : statistics.entries()) {
+void countsOf(JSONPlace place, const messages::SBLNetworkTiming& statistics) {
+  JSONObject stats(place);
+  const auto countName = [](const Entry& entry) {
     const bool counts = entry.has_number() ? std::abs(entry.number()) >= 1 : entry.integer() != 0;
-    const std::string_view key = entry.key();
-    if (counts) stats.set(std::string(key.substr(std::min(kStatPrefixLength, key.size()))), value(entry));
-  }
-  return stats.take();
+    return counts ? std::optional(statName(entry)) : std::nullopt;
+  };
+  for (const Entry* entry : withoutRepeated(statistics.entries(), countName))
+    writeValue(stats[statName(*entry)], *entry);
 }
 
 std::int64_t roundedMilliseconds(double seconds) {
@@ -116,44 +122,53 @@ std::string peerAddress(std::string_view data) {
 
 }  // namespace
 
-void writeNetworkTiming(const messages::SBLNetworkTiming& timing, Dictionary& dictionary) {
-  dictionary["network_timing_data"] = formatNetworkTimingData(timing);
+void writeNetworkTiming(const messages::SBLNetworkTiming& timing, JSONObject& object) {
+  formatNetworkTimingData(object["network_timing_data"], timing);
   const Entry* reused = find(timing, kConnectionReused);
-  dictionary["connection_reused"] =
-      reused != nullptr && reused->has_flag() ? Dictionary(reused->flag()) : Dictionary();
+  if (reused != nullptr && reused->has_flag()) {
+    object["connection_reused"] = reused->flag();
+  } else {
+    object["connection_reused"] = nullptr;
+  }
   const Entry* interface = find(timing, kConnectionInterface);
-  if (interface != nullptr && !interface->text().empty()) dictionary["interface"] = interface->text();
+  if (interface != nullptr && !interface->text().empty()) object["interface"] = interface->text();
   const Entry* peer = find(timing, kConnectionPeerAddress);
   const std::string address = peer == nullptr ? std::string() : peerAddress(peer->data());
-  if (!address.empty()) dictionary["peer_address"] = address;
+  if (!address.empty()) object["peer_address"] = address;
 }
 
-Dictionary formatNetworkTimingData(const messages::SBLNetworkTiming& timing) {
+void formatNetworkTimingData(JSONPlace place, const messages::SBLNetworkTiming& timing) {
   std::vector<SableNetEventTimingFeedback> moments;
   std::vector<SableNetEventStatsFeedback> statistics;
   for (const Entry& entry : timing.entries()) {
     const std::string_view key = entry.key();
     const std::string_view name = withoutPrefix(key);
     if (isTimingKey(key, kConnectionStartTimeCounts) || isTimingKey(key, kConnectionStopTimeCounts)) {
-      if (entry.has_statistics()) statistics.push_back({name, countsOf(entry.statistics())});
+      if (entry.has_statistics()) statistics.push_back({name, entry.statistics(), countsOf});
     } else if (key.find(kTCPFastOpenStats) != key.npos) {
-      if (entry.has_statistics()) statistics.push_back({name, everyEntry(entry.statistics())});
+      if (entry.has_statistics()) statistics.push_back({name, entry.statistics(), everyEntry});
     } else if (key.find("Start") != key.npos || key.find("End") != key.npos) {
       const double moment = entry.has_number() ? entry.number() : static_cast<double>(entry.integer());
       if (std::isfinite(moment) && moment != 0) moments.push_back({name, moment});
     } else if (key == kBramble && entry.has_statistics()) {
-      statistics.push_back({kBramble, everyEntry(entry.statistics())});
+      statistics.push_back({kBramble, entry.statistics(), everyEntry});
     }
   }
   std::stable_sort(moments.begin(), moments.end(),
                    [](const auto& one, const auto& other) { return one.value < other.value; });
 
-  Dictionary data;
+  if (moments.empty() && statistics.empty()) return place = nullptr;
+  JSONArray data(place);
   for (const auto& [name, moment] : moments) {
-    data.push_back(Dictionary::array({name, roundedMilliseconds(moment - moments.front().value)}));
+    JSONArray pair(data.next());
+    pair.next() = name;
+    pair.next() = roundedMilliseconds(moment - moments.front().value);
   }
-  for (auto& [name, stats] : statistics) data.push_back(Dictionary::array({name, std::move(stats)}));
-  return data;
+  for (const auto& [name, stats, write] : statistics) {
+    JSONArray pair(data.next());
+    pair.next() = name;
+    write(pair.next(), stats);
+  }
 }
 
 std::string peerAddressData(const std::string& numericAddress, std::uint16_t port) {

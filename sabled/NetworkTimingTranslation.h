@@ -1,7 +1,7 @@
 #pragma once
 
 #include "SableKit/messages/Shared.pb.h"
-#include "platform/Dictionary.h"
+#include "sabled/JSONWriter.h"
 
 /// The network's part of an end-network-search feedback. The names come from the clients' network
 /// library, which the service knows them by.
@@ -18,11 +18,11 @@ inline constexpr std::string_view kConnectionStopTimeCounts = "ConnectionStopTim
 
 /// Adds "network_timing_data", "connection_reused", "interface" and "peer_address"; the first two
 /// are null where the timing does not tell, the others are left out.
-void writeNetworkTiming(const messages::SBLNetworkTiming& timing, Dictionary& dictionary);
+void writeNetworkTiming(const messages::SBLNetworkTiming& timing, JSONObject& object);
 
-/// The moments as [name, milliseconds since the earliest], then the statistics as [name, object];
+/// Writes the moments as [name, milliseconds since the earliest], then the statistics as [name, object];
 /// null when there are none.
-Dictionary formatNetworkTimingData(const messages::SBLNetworkTiming& timing);
+void formatNetworkTimingData(JSONPlace place, const messages::SBLNetworkTiming& timing);
 
 /// The bytes of a peer address in an entry, laid out as on every client:
 ///

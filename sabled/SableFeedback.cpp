@@ -9,6 +9,7 @@
 #include "SableKit/SBLError.h"
 #include "SableKit/messages/SKSession.pb.h"
 #include "sabled/FeedbackTables.h"
+#include "sabled/JSONWriter.h"
 #include "sabled/ParsedMessage.h"
 
 namespace sable {
@@ -37,15 +38,34 @@ SableFeedback::SableFeedback(std::unique_ptr<FeedbackMessage> feedback, std::int
       userAgent_(std::move(userAgent)) {}
 
 Expected<SableFeedback> SableFeedback::parse(std::string_view bytes) {
-  messages::_SKSableFeedback record;
-  if (!parseMessage(record, bytes)) {
+  SableFeedbackReader reader;
+  auto feedback = reader.read(bytes);
+  if (!feedback) return tl::unexpected(std::move(feedback.error()));
+  return std::move(**feedback);
+}
+
+SableFeedbackReader::SableFeedbackReader() : record_(std::make_unique<messages::_SKSableFeedback>()) {}
+
+SableFeedbackReader::~SableFeedbackReader() = default;
+
+Expected<SableFeedback*> SableFeedbackReader::read(std::string_view bytes) {
+  if (!parseMessage(*record_, bytes))
     return tl::unexpected(makeSBLError(SBLErrorCode::daemonSide, "sable feedback expected"));
+  const auto& payload = record_->payload();
+  auto entry = ofClass_.find(payload.class_name());
+  if (entry == ofClass_.end()) {
+    auto message = FeedbackMessage::parse(payload.class_name(), payload.feedback());
+    if (!message) return tl::unexpected(std::move(message.error()));
+    SableFeedback feedback(std::move(*message), 0, std::nullopt, {});
+    entry = ofClass_.emplace(payload.class_name(), std::move(feedback)).first;
+  } else if (auto assigned = entry->second.feedback_->assign(payload.feedback()); !assigned) {
+    return tl::unexpected(std::move(assigned.error()));
   }
-  auto message = FeedbackMessage::parse(record.payload().class_name(), record.payload().feedback());
-  if (!message) return tl::unexpected(std::move(message.error()));
-  SableFeedback feedback(std::move(*message), record.query_id(), std::nullopt, {}, record.client_query_id());
-  feedback.relTimestamp_ = record.rel_timestamp();
-  return feedback;
+  SableFeedback& feedback = entry->second;
+  feedback.queryId_ = record_->query_id();
+  feedback.clientQueryId_ = record_->client_query_id();
+  feedback.relTimestamp_ = record_->rel_timestamp();
+  return &feedback;
 }
 
 /// Straight into one string: a record object would have to hold the message's bytes, and be made of four
@@ -75,25 +95,37 @@ std::string SableFeedback::data() const {
 }
 
 Dictionary SableFeedback::dictionary() const {
-  Dictionary dictionary = _dictionaryHelper();
-  dictionary["timestamp"] = relTimestamp_;
-  return dictionary;
+  std::string text;
+  writeJSON(text);
+  return *parseJSON(text, text.size());
 }
 
 std::string SableFeedback::description() const {
-  Dictionary dictionary = _dictionaryHelper();
-  dictionary["timestamp"] = feedback_->timestamp() / kNanosecondsPerMillisecond;
-  return compactJSON(dictionary);
+  std::string text;
+  writeJSON(text, feedback_->timestamp() / kNanosecondsPerMillisecond);
+  return text;
 }
 
-Dictionary SableFeedback::_dictionaryHelper() const {
-  Dictionary dictionary = feedback_->dictionary();
-  if (feedback_->requiresQueryId()) {
-    dictionary["query_id"] = queryId_;
-    if (clientQueryId_ != 0) dictionary["client_query_id"] = clientQueryId_;
+void SableFeedback::writeJSON(std::string& text, std::uint64_t timestamp) const {
+  if (auto own = feedback_->ownObject()) {
+    // It may have the record's keys, which then are replaced where they stand.
+    setRecordKeys(*own, timestamp);
+    text += compactJSON(*own);
+    return;
   }
-  dictionary["type"] = eventTypeToString(type());
-  return dictionary;
+  JSONObject object{JSONPlace(text)};
+  feedback_->write(object);
+  setRecordKeys(object, timestamp);
+}
+
+template <class Object>
+void SableFeedback::setRecordKeys(Object& object, std::uint64_t timestamp) const {
+  if (feedback_->requiresQueryId()) {
+    object["query_id"] = queryId_;
+    if (clientQueryId_ != 0) object["client_query_id"] = clientQueryId_;
+  }
+  object["type"] = eventTypeToString(type());
+  object["timestamp"] = timestamp;
 }
 
 int SableFeedback::timeStampComparator(const SableFeedback& one, const SableFeedback& other) {

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <cstdint>
+#include <map>
 #include <memory>
 #include <optional>
 #include <span>
@@ -13,6 +14,10 @@
 #include "sabled/FeedbackMessage.h"
 
 namespace sable {
+
+namespace messages {
+class _SKSableFeedback;
+}  // namespace messages
 
 /// One feedback as it goes through a session: made when a client or the daemon reports it, processed
 /// once, stored, and translated when its session is uploaded. One thread at a time.
@@ -33,7 +38,9 @@ class SableFeedback {
   /// The upload form: the kind's keys, then "query_id" and "client_query_id" where the kind has
   /// them, "type", and "timestamp" = relTimestamp().
   Dictionary dictionary() const;
-  /// The same as JSON text for logs, with the sender's own time stamp in milliseconds.
+  /// The same as compact JSON, behind what `text` holds already.
+  void writeJSON(std::string& text) const { writeJSON(text, relTimestamp_); }
+  /// The same for logs, with the sender's own time stamp in milliseconds.
   std::string description() const;
 
   const FeedbackMessage& feedback() const { return *feedback_; }
@@ -60,7 +67,11 @@ class SableFeedback {
   static std::string_view eventTypeToString(unsigned type);
 
  private:
-  Dictionary _dictionaryHelper() const;
+  friend class SableFeedbackReader;
+
+  void writeJSON(std::string& text, std::uint64_t timestamp) const;
+  template <class Object>
+  void setRecordKeys(Object& object, std::uint64_t timestamp) const;
 
   std::unique_ptr<FeedbackMessage> feedback_;
   std::int64_t queryId_ = 0;
@@ -69,6 +80,21 @@ class SableFeedback {
   std::optional<UUID> userGuid_;
   std::string userAgent_;
   bool isInLedger_ = false;
+};
+
+/// Reads many records one after the other, each in the memory of the last one of its class: it is the
+/// allocation of messages that takes the time.
+class SableFeedbackReader {
+ public:
+  SableFeedbackReader();
+  ~SableFeedbackReader();
+
+  /// As SableFeedback::parse(). The feedback is the reader's, until the next one is read.
+  Expected<SableFeedback*> read(std::string_view bytes);
+
+ private:
+  const std::unique_ptr<messages::_SKSableFeedback> record_;
+  std::map<std::string, SableFeedback, std::less<>> ofClass_;
 };
 
 }  // namespace sable

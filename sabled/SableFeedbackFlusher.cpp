@@ -216,7 +216,7 @@ Expected<SableFeedbackFlusher::Packed> SableFeedbackFlusher::pack(ClientSession&
   if (auto error = stream.streamError(); error || !written)
     return tl::unexpected(std::move(error).value_or(posixError(EIO, file.native())));
   return Packed{stream.dataDigestForStream(), stream.bytesRead(),
-                static_cast<std::int64_t>(session.getSessionFeedbacks().size())};
+                static_cast<std::int64_t>(session.countOfSessionFeedbacks())};
 }
 
 SableFeedbackFlusher::Outcome SableFeedbackFlusher::upload(const ClientSession& session,
@@ -246,7 +246,7 @@ void SableFeedbackFlusher::settle(ClientSession& session, Outcome outcome) {
   assembly_.persistentStorage->deleteSessionWithFileContainer(container);
   if (outcome == Outcome::dropped) {
     ledger::count(assembly_.tally, SBLLedgerEntry::unsent,
-                  static_cast<std::int64_t>(session.getSessionFeedbacks().size()));
+                  static_cast<std::int64_t>(session.countOfSessionFeedbacks()));
   }
 }
 

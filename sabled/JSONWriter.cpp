@@ -1,0 +1,99 @@
+#include "sabled/JSONWriter.h"
+
+#include <fmt/format.h>
+#include <simdjson.h>
+
+#include <algorithm>
+#include <array>
+#include <cmath>
+#include <iterator>
+#include <nlohmann/json.hpp>
+
+namespace sable {
+
+namespace {
+
+bool isPlain(char c) {
+  return static_cast<unsigned char>(c) >= 0x20 && c != '"' && c != '\\';
+}
+
+/// How many bytes at the beginning are ASCII that JSON takes as it is; looks at eight at a time, with
+/// one branch.
+std::size_t lengthOfPlainASCII(std::string_view text) {
+  const auto isSpecial = [](char c) { return static_cast<signed char>(c) < 0x20 || c == '"' || c == '\\'; };
+  constexpr std::size_t kBlock = 8;
+  std::size_t length = 0;
+  for (; text.size() - length >= kBlock; length += kBlock) {
+    bool special = false;
+    for (std::size_t i = 0; i < kBlock; ++i) special |= isSpecial(text[length + i]);
+    if (special) break;
+  }
+  while (length < text.size() && !isSpecial(text[length])) ++length;
+  return length;
+}
+
+void writeEscape(std::string& text, char c) {
+  constexpr std::string_view kEscaped = "\"\\\b\f\n\r\t", kLetters = "\"\\bfnrt";
+  if (const auto at = kEscaped.find(c); at != kEscaped.npos) {
+    text += '\\';
+    text += kLetters[at];
+  } else {
+    fmt::format_to(std::back_inserter(text), "\\u{:04x}", static_cast<unsigned char>(c));
+  }
+}
+
+}  // namespace
+
+void JSONPlace::operator=(double value) {
+  if (!std::isfinite(value)) return *this = nullptr;
+  std::array<char, 64> digits{};
+  // The digits of compactJSON(), of which there is no other way to them than through a tree.
+  text_.append(digits.data(),
+               nlohmann::detail::to_chars(digits.data(), digits.data() + digits.size(), value));
+}
+
+void JSONPlace::operator=(std::string_view value) {
+  const std::size_t ascii = lengthOfPlainASCII(value);
+  if (ascii < value.size() && !simdjson::validate_utf8(value)) return *this = Dictionary(value);
+  text_.append(1, '"').append(value.substr(0, ascii));
+  value.remove_prefix(ascii);
+  while (!value.empty()) {
+    const auto plain = std::ranges::find_if_not(value, isPlain) - value.begin();
+    text_ += value.substr(0, static_cast<std::size_t>(plain));
+    value.remove_prefix(static_cast<std::size_t>(plain));
+    if (value.empty()) break;
+    writeEscape(text_, value.front());
+    value.remove_prefix(1);
+  }
+  text_ += '"';
+}
+
+void JSONPlace::operator=(std::optional<std::string_view> value) {
+  if (value) {
+    *this = *value;
+  } else {
+    *this = nullptr;
+  }
+}
+
+void JSONPlace::writeSigned(std::int64_t value) {
+  text_ += fmt::format_int(value).c_str();
+}
+
+void JSONPlace::writeUnsigned(std::uint64_t value) {
+  text_ += fmt::format_int(value).c_str();
+}
+
+JSONPlace JSONObject::operator[](std::string_view key) {
+  if (text_.back() != '{') text_ += ',';
+  JSONPlace{text_} = key;
+  text_ += ':';
+  return JSONPlace(text_);
+}
+
+JSONPlace JSONArray::next() {
+  if (text_.back() != '[') text_ += ',';
+  return JSONPlace(text_);
+}
+
+}  // namespace sable
