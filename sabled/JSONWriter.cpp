@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <array>
 #include <cmath>
+#include <cstring>
 #include <iterator>
 #include <nlohmann/json.hpp>
 
@@ -17,18 +18,23 @@ bool isPlain(char c) {
   return static_cast<unsigned char>(c) >= 0x20 && c != '"' && c != '\\';
 }
 
-/// How many bytes at the beginning are ASCII that JSON takes as it is; looks at eight at a time, with
-/// one branch.
+/// Whether eight bytes are ASCII that JSON takes as it is. The highest bit of a byte is set where the byte
+/// is not ASCII, or where one of the subtractions goes below 0; what they borrow shows nothing more.
+bool areEightPlainASCII(const char* bytes) {
+  constexpr std::uint64_t kEach = 0x0101010101010101;
+  std::uint64_t word = 0;
+  std::memcpy(&word, bytes, sizeof word);
+  const std::uint64_t special =
+      word | (word - kEach * 0x20) | ((word ^ kEach * '"') - kEach) | ((word ^ kEach * '\\') - kEach);
+  return (special & kEach * 0x80) == 0;
+}
+
+/// How many bytes at the beginning are ASCII that JSON takes as it is.
 std::size_t lengthOfPlainASCII(std::string_view text) {
-  const auto isSpecial = [](char c) { return static_cast<signed char>(c) < 0x20 || c == '"' || c == '\\'; };
-  constexpr std::size_t kBlock = 8;
   std::size_t length = 0;
-  for (; text.size() - length >= kBlock; length += kBlock) {
-    bool special = false;
-    for (std::size_t i = 0; i < kBlock; ++i) special |= isSpecial(text[length + i]);
-    if (special) break;
-  }
-  while (length < text.size() && !isSpecial(text[length])) ++length;
+  while (text.size() - length >= 8 && areEightPlainASCII(text.data() + length)) length += 8;
+  while (length < text.size() && isPlain(text[length]) && static_cast<signed char>(text[length]) >= 0)
+    ++length;
   return length;
 }
 
@@ -55,7 +61,8 @@ void JSONPlace::operator=(double value) {
 void JSONPlace::operator=(std::string_view value) {
   const std::size_t ascii = lengthOfPlainASCII(value);
   if (ascii < value.size() && !simdjson::validate_utf8(value)) return *this = Dictionary(value);
-  text_.append(1, '"').append(value.substr(0, ascii));
+  text_ += '"';
+  text_ += value.substr(0, ascii);
   value.remove_prefix(ascii);
   while (!value.empty()) {
     const auto plain = std::ranges::find_if_not(value, isPlain) - value.begin();
