@@ -25,7 +25,8 @@ class SessionProcessingHelper;
 ///
 ///     made --feedback--> each goes to the session's file at once, and is not kept in memory
 ///          --sessionComplete--> the file is closed and waits for the flusher
-///     read back from the file, with its feedback --getFeedbacksToSend--> the upload's envelope
+///     read back: the file is mapped, and its feedback read when needed --getFeedbacksToSend--> the
+///     upload's envelope
 ///
 /// Used on one queue at a time, its owner's; what `sessionFeedbacks` holds is safe on any.
 class ClientSession final : public FeedbackSession {
