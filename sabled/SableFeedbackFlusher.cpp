@@ -231,7 +231,7 @@ SableFeedbackFlusher::Outcome SableFeedbackFlusher::upload(const ClientSession& 
   if (!task) {
     log().error("Error creating Upload Task. Exception {} occurred for reason {}", task.error().domain,
                 task.error().reason);
-    return task.error().domain == kPOSIXErrorDomain ? Outcome::kept : Outcome::dropped;
+    return task.error().domain == platform::kHTTPErrorDomain ? Outcome::dropped : Outcome::kept;
   }
   setFeedbacksPerTask(*task, packed.count);
   uploads.resume(*task);

@@ -1,7 +1,9 @@
 #include <fmt/core.h>
 #include <gtest/gtest.h>
 #include <poll.h>
+#include <sched.h>
 #include <sys/inotify.h>
+#include <sys/mount.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -259,6 +261,35 @@ TEST(FaultsOfUploads, CostWhatTheServiceRefusesAndNothingElse) {
     EXPECT_EQ(refused, fault.refused ? 1 : 0);
     EXPECT_TRUE(metTheFault);
   }
+}
+
+/// A disk of its own for a folder, which nobody but this process and its children sees.
+bool mountSmallDisk(const std::filesystem::path& folder) {
+  return unshare(CLONE_NEWNS) == 0 && mount(nullptr, "/", nullptr, MS_REC | MS_PRIVATE, nullptr) == 0 &&
+         mount("tmpfs", folder.c_str(), "tmpfs", 0, "size=4m,mode=700") == 0;
+}
+
+TEST(FaultsOfUploads, WithoutRoomForTheUploadTheSessionStaysUntilThereIs) {
+  World world({.startDaemon = false});
+  const auto state = world.folder("state");
+  if (!mountSmallDisk(state)) GTEST_SKIP() << "may not mount";
+  world.startDaemon();
+  const auto caches = world.folder("caches") / "com.kestrel.sabled";
+  waitForChange(caches, [&] { return std::filesystem::exists(caches / "bag.plist"); });
+  (void)world.sablectl({"report", "RKStartSearchFeedback", "input=precious"});
+  ledgerWhen(world, [](const json& now) { return now["waiting"] == 0; });
+  writeFile(state / "filler", std::string(4 << 20, 'x'));
+  EXPECT_EQ(world.sablectl({"dump"}).exitCode, 0);
+  world.waitForLog("Error creating Upload Task");
+  std::filesystem::remove(state / "filler");
+  EXPECT_EQ(world.sablectl({"dump"}).exitCode, 0);
+  const json ledger = expectEverythingSent(world);
+  EXPECT_EQ(ledger["ended"]["unsent"], 0) << ledger.dump(1);
+  std::string texts;
+  for (const json& request : world.requests("/feedback", 1)) texts += request["json"].dump();
+  EXPECT_EQ(occurrences(texts, "precious"), 1u);
+  world.killDaemon();
+  (void)umount2(state.c_str(), MNT_DETACH);
 }
 
 }  // namespace
