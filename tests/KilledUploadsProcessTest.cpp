@@ -27,7 +27,7 @@ using nlohmann::json;
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
 constexpr int kRounds = 4;
 #else
-constexpr int kRounds = 15;
+constexpr int kRounds = 8;
 #endif
 
 /// Tells when a number of things have happened to the files in some folders.
