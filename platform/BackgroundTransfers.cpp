@@ -135,7 +135,10 @@ BackgroundTransfers::Core::Entry& BackgroundTransfers::Core::add(BackgroundTrans
   const Duration shortest = std::min(configuration_.requestTimeout, configuration_.resourceTimeout);
   Entry& entry = entries_[transfer.task.identifier];
   entry.deadline = later(ticks, std::max(configuration_.resourceTimeout - age, shortest));
-  entry.due = age < configuration_.resourceTimeout ? later(ticks, transfer.pause - waited) : ticks;
+  // A power cut stops many devices together: their pauses must not end together when it is over.
+  const Duration left =
+      waited < transfer.pause ? transfer.pause - waited : spreadPause(transfer.pause, chance());
+  entry.due = age < configuration_.resourceTimeout ? later(ticks, left) : ticks;
   entry.windowEnd = transfer.window > Duration{} ? later(ticks, transfer.window - age) : MonotonicTime::max();
   entry.transfer = std::move(transfer);
   entry.transfer.running = false;

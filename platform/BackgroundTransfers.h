@@ -77,7 +77,8 @@ class BackgroundTransferHost {
 /// and who is told. A session without a transfer has no timer; one whose transfers wait for better
 /// conditions looks for them at the notification, and every kConditionsLook. A transfer's age is
 /// measured by the wall clock between two processes, where a clock that went back counts as none, and
-/// every process gives each transfer at least one attempt's time.
+/// every process gives each transfer at least one attempt's time. A pause that has passed between two
+/// processes is followed by a part of it, by chance.
 class BackgroundTransfers final : public HTTPBackgroundSession {
  public:
   /// `center` posts that notification, and kPowerSourceDidChangeNotification. All references outlive the

@@ -40,6 +40,10 @@ Duration retryPauseAsked(Duration asked, int attempts, double chance) {
   return asked + part(std::max(asked / 2, pauseBound(attempts)), chance);
 }
 
+Duration spreadPause(Duration pause, double chance) {
+  return part(pause, chance);
+}
+
 std::optional<Duration> retryAfter(const HTTPResponse& response, WallTime now) {
   if (response.status != 503 && response.status != 429) return std::nullopt;
   const std::string* text = response.headers.find("Retry-After");

@@ -20,6 +20,9 @@ Duration retryPause(int attempts, double chance);
 /// half as much again and at least by the ordinary pause.
 Duration retryPauseAsked(Duration asked, int attempts, double chance);
 
+/// What is left of a pause that has passed while no process ran: any part of it, as `chance` decides.
+Duration spreadPause(Duration pause, double chance);
+
 /// What a 503 or 429 asks for by Retry-After (RFC 9110 section 10.2.3), in seconds or as a date, which
 /// is taken by the service's clock where it tells its Date. Nothing for another response, and for a
 /// field that is neither.

@@ -3,10 +3,10 @@
 
 #include <algorithm>
 #include <cmath>
-#include <random>
 
 #include "platform/TransferRetry.h"
 #include "platform/simulated/SimulatedPlatform.h"
+#include "tests/support/Fleet.h"
 
 namespace sable::platform {
 namespace {
@@ -265,18 +265,22 @@ TEST_F(VirtualTransfers, CancelledAndRefusedOnesLoseNothingElse) {
 }
 
 TEST(TransferRetry, AFleetThatLostTheServiceComesBackSpread) {
-  constexpr int kDevices = 20000;
-  constexpr double kOutage = 4 * 3600;
-  std::mt19937_64 random(1);
-  std::uniform_real_distribution<double> chance(0, 1);
-  std::vector<int> returns(60);
-  for (int device = 0; device < kDevices; ++device) {
-    double time = 0;
-    for (int attempts = 1; time < kOutage; ++attempts)
-      time += toSeconds(retryPause(attempts, chance(random)));
-    ++returns.at(static_cast<std::size_t>((time - kOutage) / 60));
+  test::FleetPlan plan;
+  const auto isSpread = [](const test::FleetHour& hour) { return hour.peak <= 3 * hour.mean; };
+  const auto back = plan.goodTimes + plan.outage;
+  auto minutes = test::requestsPerMinute(plan);
+  const auto start = test::hourFrom(minutes, 0s);
+  const auto second = test::hourFrom(minutes, back + 1h);
+  EXPECT_PRED1(isSpread, start) << start.peak << " of " << start.mean;
+  EXPECT_NEAR(second.mean, plan.devices / 10.0, 1) << "nothing is left over";
+
+  for (const auto powerCut : {0h, 2h}) {
+    plan.powerCut = powerCut;
+    if (powerCut > 0h) minutes = test::requestsPerMinute(plan);
+    const auto hour = test::hourFrom(minutes, back);
+    EXPECT_PRED1(isSpread, hour) << hour.peak << " of " << hour.mean;
+    EXPECT_GT(hour.mean, 4 * plan.devices / 10.0) << "the outage's uploads come";
   }
-  EXPECT_LT(*std::max_element(returns.begin(), returns.end()), 3 * kDevices / 60);
 }
 
 TEST(TransferRetry, AFieldSaysSecondsOrADate) {
