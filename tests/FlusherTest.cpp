@@ -4,6 +4,8 @@
 #include <zlib.h>
 
 #include <cerrno>
+#include <random>
+#include <string_view>
 
 #include "SableKit/SBLFeedbackLedger.h"
 #include "sabled/BackgroundFlusher.h"
@@ -18,6 +20,8 @@
 // What becomes of sessions: the uploads that the service sees, on the whole daemon in virtual time.
 namespace sable::test {
 namespace {
+
+using namespace std::string_view_literals;
 
 using platform::HTTPErrorCode;
 using platform::simulated::RecordedRequest;
@@ -358,6 +362,60 @@ TEST_F(Flusher, ItsBufferAndItsAddresses) {
   EXPECT_EQ(endpoint("https://service.test/a?b=c&d"), "https://service.test/a?v=2");
   EXPECT_EQ(endpoint("https://service.test/a"), "https://service.test/a?v=2");
   EXPECT_FALSE(endpoint("no URL") || endpoint(std::nullopt));
+}
+
+TEST_F(Flusher, AMonthWithOutagesKeepsTheScheduleAndLosesNothing) {
+  std::mt19937 random(7);
+  const auto hours = [&random](int from, int to) {
+    return std::chrono::hours(std::uniform_int_distribution(from, to)(random));
+  };
+  bool down = false;
+  for (const char* path : {"/feedback", "/search", "/bag"}) {
+    device.service.on(path, [&, path](const platform::HTTPRequest&) {
+      platform::simulated::Scripted answer = answering(path == "/bag"sv ? device.bag.dump() : "[]");
+      if (down) answer.error = HTTPErrorCode::cannotConnect;
+      return answer;
+    });
+  }
+  device.start();
+  const auto& runs = device.platform.activityScheduler().record();
+  const auto times = [&runs] { return runs.at("com.kestrel.sabled.flusher.background"); };
+  const auto first = *times().nextRun - device.platform.runtime().now();
+  EXPECT_GE(first, 299s);
+  EXPECT_LE(first, 600s);
+  device.advance(first);
+
+  platform::Duration change = hours(6, 48);
+  auto last = times().lastRun.value();
+  for (platform::Duration now{}; now < 30 * 24h; now += 1h) {
+    if (now >= change) {
+      down = !down && now < 26 * 24h;
+      change = now + (down ? hours(2, 72) : hours(6, 48));
+    }
+    if (hours(0, 2) == 0h) {
+      VirtualClient& client = device.client();
+      for (const char* text : {"w", "we", "wea", "r", "ra", "rain"}) {
+        client.search(text);
+        device.assembly().clientSessionManager->flushSession(nullptr);
+      }
+      client.disconnect();
+    }
+    device.advance(1h);
+    const auto latest = times().lastRun.value();
+    EXPECT_EQ((latest - last) % 600s, 0s) << "no run is late or early";
+    EXPECT_LE(device.platform.runtime().now() - latest, 600s) << "none is left out";
+    last = latest;
+  }
+
+  const auto sent = uploads();
+  for (std::size_t i = 4; i < sent.size(); ++i)
+    EXPECT_GE(sent[i].time - sent[i - 4].time, 50ms) << "more than 4 at once";
+  const auto records = ledger();
+  EXPECT_GT(records[SBLLedgerEntry::uploaded], 1000);
+  EXPECT_EQ(records[SBLLedgerEntry::refused] + records[SBLLedgerEntry::tooOld], 0);
+  EXPECT_EQ(records.waiting() + records.sending(), 0);
+  EXPECT_EQ(records[SBLLedgerEntry::taken], records[SBLLedgerEntry::uploaded] + records.stored());
+  EXPECT_LE(records.stored(), 10) << "of the session that is still open";
 }
 
 }  // namespace
