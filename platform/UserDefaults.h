@@ -31,8 +31,8 @@ class UserDefaults {
   virtual std::optional<Dictionary> array(std::string_view key) const = 0;
   virtual std::optional<Dictionary> dictionary(std::string_view key) const = 0;
 
-  /// A setting of a domain that the user's programs share, such as kLookupDomain, as it is now; nullopt when it is absent or
-  /// no boolean. May block on the disk.
+  /// A setting of a domain that the user's programs share, as kLookupDomain is, and as it is now; nullopt
+  /// when it is absent or no boolean. May block on the disk.
   virtual std::optional<bool> sharedBoolean(std::string_view domain, std::string_view key) const = 0;
 
   /// Writes a value of the daemon's own (below profile and user). Null removes it. Becomes durable
