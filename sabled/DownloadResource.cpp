@@ -40,6 +40,7 @@ std::optional<std::string> urlForCompare(std::string_view text) {
   }
   byName.erase("key");
   std::vector<platform::URLQueryItem> items;
+  items.reserve(byName.size());
   for (auto& [name, item] : byName) items.push_back(std::move(item));
   url->setQueryItems(items);
   return url->string();
