@@ -121,7 +121,7 @@ void SableFlusherRelay::dump(const Tool& tool) {
 }
 
 /// Ends the session of every client; `completion` runs when all have ended.
-void SableFlusherRelay::flushSessions(std::function<void()> completion) {
+void SableFlusherRelay::flushSessions(const std::function<void()>& completion) {
   const auto connections =
       getClientConnections_ ? getClientConnections_() : std::vector<std::shared_ptr<ClientConnection>>();
   if (connections.empty()) return completion();

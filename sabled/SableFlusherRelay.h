@@ -49,7 +49,7 @@ class SableFlusherRelay {
   void listenToFeedback(const Tool& tool);
   void stop(const Tool& tool);
   void dump(const Tool& tool);
-  void flushSessions(std::function<void()> completion);
+  void flushSessions(const std::function<void()>& completion);
   void tellWorkDone(const Tool& tool);
   void forward(const SableFeedback& feedback);
   void _removeDelegate(const Tool& tool);

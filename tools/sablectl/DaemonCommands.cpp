@@ -14,8 +14,6 @@
 namespace sable::sablectl {
 namespace {
 
-using platform::RelayRecord;
-
 constexpr std::size_t kMaximumBagBytes = 64u << 20;
 
 /// Leaves of nested objects as rows of dotted key and value.

@@ -64,7 +64,9 @@ std::string memberText(const Dictionary& object, const char* key) {
 
 /// What goes without saying.
 bool saysNothing(const Dictionary& value) {
-  return value.is_null() || value == false || value == 0 || value == "" || value == "unknown";
+  const auto* text = value.get_ptr<const std::string*>();
+  if (text != nullptr) return text->empty() || *text == "unknown";
+  return value.is_null() || value == false || value == 0;
 }
 
 /// A value in few words.
