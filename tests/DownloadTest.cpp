@@ -408,7 +408,8 @@ TEST_F(Downloads, AnIdentifierIsAFileNameOrNothing) {
   EXPECT_EQ(device.bagFile(), bag);
   for (const std::string& identifier : refused) {
     if (identifier.find('\0') != identifier.npos) continue;  // no string of the wire
-    EXPECT_EQ(handedOut(identifier), "identifier: " + identifier + " exception: no place for a resource of that name");
+    EXPECT_EQ(handedOut(identifier),
+              "identifier: " + identifier + " exception: no place for a resource of that name");
   }
 }
 
