@@ -1,7 +1,5 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <openssl/evp.h>
-#include <zlib.h>
 
 #include <cerrno>
 #include <random>
@@ -14,6 +12,7 @@
 #include "sabled/FileContainer.h"
 #include "sabled/SableFeedbackFlusher.h"
 #include "sabled/SablePersistentStorage.h"
+#include "tests/support/Deflate.h"
 #include "tests/support/Feedback.h"
 #include "tests/support/VirtualDevice.h"
 
@@ -32,33 +31,13 @@ using testing::IsEmpty;
 using testing::Not;
 using testing::UnorderedElementsAreArray;
 
-std::string inflated(const std::string& raw) {
-  z_stream stream{};
-  EXPECT_EQ(inflateInit2(&stream, -MAX_WBITS), Z_OK);
-  std::string text(1u << 20, '\0');
-  stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(raw.data()));
-  stream.avail_in = static_cast<uInt>(raw.size());
-  stream.next_out = reinterpret_cast<Bytef*>(text.data());
-  stream.avail_out = static_cast<uInt>(text.size());
-  EXPECT_EQ(inflate(&stream, Z_FINISH), Z_STREAM_END);
-  text.resize(stream.total_out);
-  inflateEnd(&stream);
-  return text;
-}
-
-std::string sha512(const std::string& bytes) {
-  std::array<unsigned char, 64> digest{};
-  EVP_Digest(bytes.data(), bytes.size(), digest.data(), nullptr, EVP_sha512(), nullptr);
-  std::string text;
-  for (const unsigned char byte : digest) text += fmt::format("{:02x}", byte);
-  return text;
-}
+constexpr std::size_t kMostJSON = 1u << 20;
 
 /// What was searched for in the uploads.
 std::vector<std::string> searchesIn(const std::vector<RecordedRequest>& uploads) {
   std::vector<std::string> inputs;
   for (const auto& upload : uploads) {
-    const json envelope = json::parse(inflated(*upload.request.body));
+    const json envelope = json::parse(inflated(*upload.request.body, kMostJSON));
     for (const json& record : envelope["fb"]) {
       if (record["type"] == "search_start") inputs.push_back(record["input"]);
     }
@@ -130,7 +109,7 @@ TEST_F(Flusher, ASessionIsUploadedAsItsEnvelopeWithTheDigestOfItsText) {
   EXPECT_THAT(url.queryItems(), Contains(platform::URLQueryItem{"v", "2"}));
   EXPECT_EQ(request.url.find("old"), std::string::npos);
   EXPECT_EQ(*request.headers.find("Content-Encoding"), "deflate");
-  const std::string text = inflated(*request.body);
+  const std::string text = inflated(*request.body, kMostJSON);
   EXPECT_EQ(*request.headers.find("X-Kestrel-Digest"), sha512(text));
 
   const json envelope = json::parse(text);

@@ -218,6 +218,18 @@ class FaultyUpload {
   World world;
 };
 
+/// What the service took last is what the device's owner can read.
+void expectShownToTheOwner(const World& world) {
+  const json last = world.sablectlJSON({"uploads"}).back();
+  EXPECT_EQ(last["state"], "ended");
+  EXPECT_EQ(last["can_be_shown"], true);
+  const auto shown =
+      json::parse(world.sablectl({"--json", "uploads", "--show", last["id"].dump()}).output, nullptr, false);
+  EXPECT_TRUE(std::ranges::any_of(world.requests("/feedback", 1), [&](const json& request) {
+    return request["status"] == last["status"] && request.value("json", json()) == shown;
+  })) << shown;
+}
+
 TEST(FaultsOfUploads, CostWhatTheServiceRefusesAndNothingElse) {
   const struct Fault {
     const char* name;
@@ -231,7 +243,7 @@ TEST(FaultsOfUploads, CostWhatTheServiceRefusesAndNothingElse) {
       {"a slow reader", {"slow-body=1000*1"}, 200, false, false},
       {"a slow answer", {"latency=300*1"}, 200, false, false},
       {"unavailable for a second", {"status=503*1", "retry-after=1*1"}, 503, false, true},
-      {"reset amid the body", {"reset-body=100*1"}, 400, false, true},
+      {"reset amid the body", {"reset-body=100*1"}, 400, false, false},
       {"reset instead of an answer", {"reset*1"}, 200, false, true},
       {"an answer cut short", {"truncate=1*1"}, 200, false, true},
   };
@@ -262,6 +274,7 @@ TEST(FaultsOfUploads, CostWhatTheServiceRefusesAndNothingElse) {
     EXPECT_EQ(precious, 1);
     EXPECT_EQ(refused, fault.refused ? 1 : 0);
     EXPECT_TRUE(metTheFault);
+    expectShownToTheOwner(upload.world);
   }
 }
 
