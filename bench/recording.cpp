@@ -143,7 +143,12 @@ class Recorder {
   /// Returns when all are in the file; says how many a second that is.
   double record(Feedbacks batch) {
     return rate(batch.size(), [&] {
-      for (auto& feedback : batch) assembly.clientSessionManager->addSableFeedback(std::move(feedback));
+      const auto added = assembly.runtime.semaphore(0);
+      client_->async([&] {
+        for (auto& feedback : batch) assembly.clientSessionManager->addSableFeedback(std::move(feedback));
+        added->signal();
+      });
+      added->wait(sable::platform::MonotonicTime::max());
       awaitFile();
     });
   }
@@ -172,6 +177,11 @@ class Recorder {
 
  public:
   sable::Assembly assembly;
+
+ private:
+  /// The daemon's callers, too, are on threads of the pool.
+  const std::shared_ptr<sable::platform::SerialQueue> client_ =
+      assembly.runtime.serialQueue("com.kestrel.sabled.bench");
 };
 
 /// Records a second of the same bytes with one `write` each.

@@ -13,7 +13,7 @@ class Function;
 
 /// A callable that is moved, never copied, so that it can own what it answers with (a reply, a
 /// transaction). C++23 brings std::move_only_function; until then these few lines stand in.
-/// Callables of up to four words are kept in place, larger ones on the heap.
+/// Callables of up to six words are kept in place, as three shared pointers are; larger ones on the heap.
 template <class Result, class... Args>
 class Function<Result(Args...)> {
  public:
@@ -60,12 +60,12 @@ class Function<Result(Args...)> {
     void (*destroy)(void*) noexcept;
   };
 
-  static constexpr std::size_t kCapacity = 4 * sizeof(void*);
+  static constexpr std::size_t kCapacity = 6 * sizeof(void*);
 
   template <class Callable>
   static constexpr bool fits =
       sizeof(Callable) <= kCapacity &&
-      alignof(Callable) <= alignof(std::max_align_t) && std::is_nothrow_move_constructible_v<Callable>;
+      alignof(Callable) <= alignof(void*) && std::is_nothrow_move_constructible_v<Callable>;
 
   template <class Callable>
   static constexpr Operations inPlace{[](void* self, Args&&... args) -> Result {
@@ -95,7 +95,7 @@ class Function<Result(Args...)> {
     if (operations_ != nullptr) std::exchange(operations_, nullptr)->destroy(&storage_);
   }
 
-  alignas(std::max_align_t) std::byte storage_[kCapacity];
+  alignas(void*) std::byte storage_[kCapacity];
   const Operations* operations_ = nullptr;
 };
 

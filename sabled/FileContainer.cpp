@@ -3,7 +3,6 @@
 #include <simdjson.h>
 
 #include <algorithm>
-#include <array>
 #include <cerrno>
 #include <cstring>
 #include <exception>
@@ -121,7 +120,7 @@ void FileContainer::writeFeedback(std::shared_ptr<const SableFeedback> feedback,
 void FileContainer::addFeedback(const SableFeedback& feedback, platform::Function<void()> done) {
   if (!fileHandle_) return ledger::count(assembly_.tally, endOfLaterRecords_);
   const bool isFirst = buffer_.empty();
-  if (_archiveData(feedback.data())) {
+  if (_archiveFeedback(feedback)) {
     ++bufferedFeedbacks_;
     if (done) written_.push_back(std::move(done));
     if (buffer_.size() >= kMaximumBufferBytes) write();
@@ -132,24 +131,41 @@ void FileContainer::addFeedback(const SableFeedback& feedback, platform::Functio
   }
 }
 
-/// Puts a record behind those that are to be written. One that the file has no room for closes it.
 bool FileContainer::_archiveData(std::string_view bytes) {
+  const std::size_t start = beginRecord();
+  buffer_.append(bytes);
+  return endRecord(start);
+}
+
+bool FileContainer::_archiveFeedback(const SableFeedback& feedback) {
+  const std::size_t start = beginRecord();
+  feedback.appendData(buffer_);
+  return endRecord(start);
+}
+
+/// Puts a record behind those that are to be written: its bytes follow in the buffer.
+std::size_t FileContainer::beginRecord() {
   queue_->assertIsCurrent();
-  const std::uint64_t length = bytes.size();
-  std::array<char, kArchivedLengthBytes> prefix{};
-  std::memcpy(prefix.data(), &length, sizeof length);
-  if (!hasRoomFor(prefix.size() + length)) {
+  buffer_.append(kArchivedLengthBytes, '\0');
+  return buffer_.size() - kArchivedLengthBytes;
+}
+
+/// The record that begins at `start` is all there. One that the file has no room for closes it.
+bool FileContainer::endRecord(std::size_t start) {
+  if (!hasRoomFor(start)) {
+    buffer_.resize(start);
     _closeFile();
     return false;
   }
+  const std::uint64_t length = buffer_.size() - start - kArchivedLengthBytes;
+  std::memcpy(&buffer_[start], &length, sizeof length);
   if (!transaction_) transaction_ = assembly_.platform.transactions().open("archiveObject");
-  buffer_.append(prefix.data(), prefix.size()).append(bytes);
   return true;
 }
 
-bool FileContainer::hasRoomFor(std::uint64_t bytes) {
+bool FileContainer::hasRoomFor(std::size_t start) {
   // A file that would just be full counts as too long.
-  const std::uint64_t offset = fileSize_ + buffer_.size();
+  const std::uint64_t offset = fileSize_ + start, bytes = buffer_.size() - start;
   if (offset + bytes < maxFileSize_) return true;
   endOfLaterRecords_ = SBLLedgerEntry::sizeLimit;
   assembly_.tally.add("com.kestrel.sabled.filesizeexceeded", 1);

@@ -83,7 +83,10 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
 
  private:
   bool _archiveData(std::string_view bytes);
-  bool hasRoomFor(std::uint64_t bytes);
+  bool _archiveFeedback(const SableFeedback& feedback);
+  std::size_t beginRecord();
+  bool endRecord(std::size_t start);
+  bool hasRoomFor(std::size_t start);
   void addFeedback(const SableFeedback& feedback, platform::Function<void()> done);
   bool write();
   std::shared_ptr<ClientSession> readFile();

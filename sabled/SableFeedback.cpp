@@ -70,7 +70,7 @@ Expected<SableFeedback*> SableFeedbackReader::read(std::string_view bytes) {
 
 /// Straight into one string: a record object would have to hold the message's bytes, and be made of four
 /// allocations, for every feedback.
-std::string SableFeedback::data() const {
+void SableFeedback::appendData(std::string& bytes) const {
   using Record = messages::_SKSableFeedback;
   using Payload = messages::_SKFeedbackPayload;
   using Wire = google::protobuf::internal::WireFormatLite;
@@ -79,10 +79,11 @@ std::string SableFeedback::data() const {
   const std::string_view name = feedback_->className();
   const std::size_t messageSize = message.ByteSizeLong();
   const std::size_t payloadSize = lengthBytes(name.size()) + lengthBytes(messageSize);
-  std::string bytes(lengthBytes(payloadSize) + 3 * kTagBytes + Wire::SInt64Size(queryId_) +
-                        Wire::UInt64Size(clientQueryId_) + Wire::UInt64Size(relTimestamp_),
-                    '\0');
-  auto* to = reinterpret_cast<std::uint8_t*>(bytes.data());
+  const std::size_t start = bytes.size();
+  bytes.append(lengthBytes(payloadSize) + 3 * kTagBytes + Wire::SInt64Size(queryId_) +
+                   Wire::UInt64Size(clientQueryId_) + Wire::UInt64Size(relTimestamp_),
+               '\0');
+  auto* to = reinterpret_cast<std::uint8_t*>(bytes.data()) + start;
   to = writeLength(Record::kPayloadFieldNumber, payloadSize, to);
   to = writeLength(Payload::kClassNameFieldNumber, name.size(), to);
   to = std::copy(name.begin(), name.end(), to);
@@ -91,6 +92,11 @@ std::string SableFeedback::data() const {
   to = Wire::WriteSInt64ToArray(Record::kQueryIdFieldNumber, queryId_, to);
   to = Wire::WriteUInt64ToArray(Record::kClientQueryIdFieldNumber, clientQueryId_, to);
   Wire::WriteUInt64ToArray(Record::kRelTimestampFieldNumber, relTimestamp_, to);
+}
+
+std::string SableFeedback::data() const {
+  std::string bytes;
+  appendData(bytes);
   return bytes;
 }
 

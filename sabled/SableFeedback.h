@@ -34,6 +34,7 @@ class SableFeedback {
 
   /// The record in a session file: a `_SKSableFeedback`.
   std::string data() const;
+  void appendData(std::string& bytes) const;
 
   /// The upload form: the kind's keys, then "query_id" and "client_query_id" where the kind has
   /// them, "type", and "timestamp" = relTimestamp().

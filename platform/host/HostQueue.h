@@ -46,7 +46,7 @@ class HostQueue final : public SerialQueue, public std::enable_shared_from_this<
   };
   using Lock = std::unique_lock<std::mutex>;
 
-  void runFirst(Lock& lock);
+  int runSome(Lock& lock);
   void drain();
   void release(Lock& lock);
   void schedule(Lock& lock);
