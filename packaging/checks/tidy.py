@@ -19,6 +19,10 @@ import sys
 
 ROOT = pathlib.Path(__file__).resolve().parents[2]
 STAMPS = ROOT / "build/tidy"
+# What g++ accepts is settled by the build; here only clang-tidy's own checks are errors. The analyzer follows a
+# third of the states that it would, which saves a third of the time.
+ARGUMENTS = ["--quiet", "--extra-arg=-Wno-unknown-warning-option", "--extra-arg=-Wno-error",
+             *("--extra-arg=" + word for word in "-Xclang -analyzer-config -Xclang max-nodes=75000".split())]
 PRODUCT = ("sabled", "SableKit", "platform", "tools")
 
 
@@ -56,10 +60,8 @@ def key(command, headers, common):
 
 
 def tidy(command, build):
-    # What g++ accepts is settled by the build; here only clang-tidy's own checks are errors.
-    arguments = ["clang-tidy", "--quiet", "-p", build, "--extra-arg=-Wno-unknown-warning-option",
-                 "--extra-arg=-Wno-error", command["file"]]
-    run = subprocess.run(arguments, stdout=subprocess.PIPE, stderr=subprocess.DEVNULL, text=True)
+    run = subprocess.run(["clang-tidy", *ARGUMENTS, "-p", build, command["file"]],
+                         stdout=subprocess.PIPE, stderr=subprocess.DEVNULL, text=True)
     return run.returncode == 0, run.stdout
 
 
@@ -67,7 +69,8 @@ def main(build):
     commands = [c for c in json.loads(pathlib.Path(build, "compile_commands.json").read_text())
                 if os.path.relpath(c["file"], ROOT).split("/")[0] in PRODUCT]
     version = subprocess.run(["clang-tidy", "--version"], capture_output=True, text=True, check=True).stdout
-    common = version + "".join(path.read_text() for path in (ROOT / ".clang-tidy", ROOT / "tools/.clang-tidy"))
+    settings = "".join(path.read_text() for path in (ROOT / ".clang-tidy", ROOT / "tools/.clang-tidy"))
+    common = version + " ".join(ARGUMENTS) + settings
     headers = recorded_headers(build)
     STAMPS.mkdir(parents=True, exist_ok=True)
     due = {key(c, headers.get(object_of(c), []), common): c for c in commands}
