@@ -25,9 +25,9 @@ void sign(std::string_view list) {
   Registry registry;
   const auto signature = processWhitelist(list, registry);
   constexpr std::size_t kLongest = (8 + kBlobDigestBytes + kMaximumBitmapBytes + 2) / 3 * 4;
-  if (signature && (signature->size() % 4 != 0 || signature->size() < 16 || signature->size() > kLongest)) {
-    std::abort();
-  }
+  if (!signature) return;
+  const std::size_t size = signature->text.size();
+  if (size % 4 != 0 || size < 16 || size > kLongest || signature->applications.empty()) std::abort();
 }
 
 /// The list's inner text alone, which hardly any change of an escaped one leaves whole.

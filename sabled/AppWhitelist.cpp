@@ -7,7 +7,7 @@
 #include <algorithm>
 #include <charconv>
 #include <cmath>
-#include <unordered_map>
+#include <map>
 #include <vector>
 
 #include "platform/ApplicationRegistry.h"
@@ -54,23 +54,20 @@ std::optional<double> encodingId(const element& entry) {
   return id;
 }
 
-/// The numbers of the installed applications that are in `apps`.
-std::vector<double> installedIds(const object& apps, platform::ApplicationRegistry& registry) {
-  const std::vector<platform::InstalledApplication> installed = registry.installedApplications();
-  std::unordered_map<std::string_view, std::optional<double>> idByIdentifier;
-  for (const auto& application : installed) {
+/// The installed applications that are in `apps`, with their numbers.
+std::map<std::string, std::optional<double>, std::less<>> installedIds(
+    const object& apps, platform::ApplicationRegistry& registry) {
+  std::map<std::string, std::optional<double>, std::less<>> idByIdentifier;
+  for (platform::InstalledApplication& application : registry.installedApplications()) {
     if (application.bundleIdentifier.empty() || application.bundleVersion.empty()) continue;
-    idByIdentifier.try_emplace(application.bundleIdentifier);
+    idByIdentifier.try_emplace(std::move(application.bundleIdentifier));
   }
   for (const auto [identifier, entry] : apps) {
     const auto found = idByIdentifier.find(identifier);
     if (found != idByIdentifier.end()) found->second = encodingId(entry);
   }
-  std::vector<double> ids;
-  for (const auto& [identifier, id] : idByIdentifier) {
-    if (id) ids.push_back(*id);
-  }
-  return ids;
+  std::erase_if(idByIdentifier, [](const auto& application) { return !application.second; });
+  return idByIdentifier;
 }
 
 std::vector<std::uint8_t> bitmapOf(const std::vector<double>& ids) {
@@ -108,8 +105,8 @@ std::string base64(const std::vector<std::uint8_t>& bytes) {
 
 }  // namespace
 
-std::optional<std::string> processWhitelist(std::string_view stream,
-                                            platform::ApplicationRegistry& registry) {
+std::optional<AppWhitelistSignature> processWhitelist(std::string_view stream,
+                                                      platform::ApplicationRegistry& registry) {
   if (stream.size() > kMaximumWhitelistBytes) return malformed("too long");
   simdjson::dom::parser outerParser, innerParser;
   const auto outer = parseObject(outerParser, stream);
@@ -124,7 +121,12 @@ std::optional<std::string> processWhitelist(std::string_view stream,
   object apps;
   if (!version || (*inner)["apps"].get(apps) != simdjson::SUCCESS) return malformed("no version or no apps");
 
-  const std::vector<double> ids = installedIds(apps, registry);
+  std::vector<double> ids;
+  std::vector<std::string> applications;
+  for (const auto& [identifier, id] : installedIds(apps, registry)) {
+    applications.push_back(identifier);
+    ids.push_back(*id);
+  }
   if (ids.empty()) return std::nullopt;
   const bool allFit =
       std::ranges::all_of(ids, [](double id) { return id >= 0 && id <= kHighestId && std::floor(id) == id; });
@@ -132,7 +134,9 @@ std::optional<std::string> processWhitelist(std::string_view stream,
   const std::vector<std::uint8_t> bitmap = bitmapOf(ids);
   std::vector<std::uint8_t> blob;
   const bool compressed = rle_compress(bitmap, blob);
-  return makeSignature(static_cast<std::uint16_t>(bitmap.size()), blob, compressed, *version);
+  auto signature = makeSignature(static_cast<std::uint16_t>(bitmap.size()), blob, compressed, *version);
+  if (!signature) return std::nullopt;
+  return AppWhitelistSignature{std::move(*signature), std::move(applications)};
 }
 
 std::optional<std::string> makeSignature(std::uint16_t bitmapLength, std::span<const std::uint8_t> blob,

@@ -17,6 +17,7 @@ namespace sable {
 namespace {
 
 constexpr std::string_view kSignatureKey = "SBLAppWhitelistSignature";
+constexpr std::string_view kApplicationsKey = "SBLAppWhitelistApplications";
 /// Applications come and go in bursts: only the last change of one counts.
 constexpr platform::Duration kDelayAfterChange = std::chrono::seconds(60);
 
@@ -26,6 +27,16 @@ const platform::LogHandle& log() {
   return SableLogForCategory(SableLoggingCategorySable);
 }
 
+std::optional<AppWhitelistSignature> savedSignature(const platform::UserDefaults& defaults) {
+  auto text = defaults.string(kSignatureKey);
+  if (!text) return std::nullopt;
+  AppWhitelistSignature signature{std::move(*text), {}};
+  for (const Dictionary& application : defaults.array(kApplicationsKey).value_or(Dictionary::array())) {
+    if (application.is_string()) signature.applications.push_back(application.get<std::string>());
+  }
+  return signature;
+}
+
 }  // namespace
 
 AppWhitelistController::AppWhitelistController(Assembly& assembly)
@@ -33,7 +44,7 @@ AppWhitelistController::AppWhitelistController(Assembly& assembly)
       backgroundQueue_(assembly.runtime.serialQueue("com.kestrel.sabled.appWhitelist",
                                                     platform::QualityOfService::background)),
       signatureQueue_(assembly.runtime.concurrentQueue("com.kestrel.sabled.appWhitelistSignature")),
-      whitelistSignature_(assembly.userDefaults.string(kSignatureKey)) {
+      whitelistSignature_(savedSignature(assembly.userDefaults)) {
   registerToken_ = assembly_.notificationCenter.observe(
       std::string(platform::kApplicationsDidChangeNotification),
       [this](const platform::Notification&) { backgroundQueue_->async([this] { armTimer(); }); });
@@ -49,7 +60,16 @@ AppWhitelistController::AppWhitelistController(Assembly& assembly)
 AppWhitelistController::~AppWhitelistController() = default;
 
 std::optional<std::string> AppWhitelistController::whitelistSignature() const {
-  return signatureQueue_->sync([this] { return whitelistSignature_; });
+  return signatureQueue_->sync([this]() -> std::optional<std::string> {
+    if (!whitelistSignature_) return std::nullopt;
+    return whitelistSignature_->text;
+  });
+}
+
+std::vector<std::string> AppWhitelistController::signedApplications() const {
+  return signatureQueue_->sync([this] {
+    return whitelistSignature_ ? whitelistSignature_->applications : std::vector<std::string>();
+  });
 }
 
 void AppWhitelistController::armTimer() {
@@ -70,12 +90,14 @@ void AppWhitelistController::_generateWhitelistSignature() {
   if (generating_.exchange(true)) return;
   const auto transaction = assembly_.platform.transactions().open("appWhitelist");
   auto signature = _generate();
-  assembly_.userDefaults.set(kSignatureKey, signature ? Dictionary(*signature) : Dictionary());
+  assembly_.userDefaults.set(kSignatureKey, signature ? Dictionary(signature->text) : Dictionary());
+  assembly_.userDefaults.set(kApplicationsKey,
+                             signature ? Dictionary(signature->applications) : Dictionary());
   signatureQueue_->barrierSync([&] { whitelistSignature_ = std::move(signature); });
   generating_ = false;
 }
 
-std::optional<std::string> AppWhitelistController::_generate() {
+std::optional<AppWhitelistSignature> AppWhitelistController::_generate() {
   log().standard("generating app whitelist");
   if (assembly_.downloadManager == nullptr) return std::nullopt;
   platform::FileAttributes attributes;
@@ -94,7 +116,7 @@ std::optional<std::string> AppWhitelistController::_generate() {
     return std::nullopt;
   }
   auto signature = processWhitelist(*bytes, assembly_.platform.applicationRegistry());
-  log().standard("installed app signature: {}", signature.value_or("(null)"));
+  log().standard("installed app signature: {}", signature ? signature->text : "(null)");
   return signature;
 }
 

@@ -7,6 +7,7 @@
 
 #include "platform/NotificationCenter.h"
 #include "platform/Runtime.h"
+#include "sabled/AppWhitelist.h"
 
 namespace sable {
 
@@ -15,8 +16,8 @@ class Assembly;
 /// Keeps the signature of those installed applications that the service's allow-list has, which goes
 /// with requests. It is worked out at the start when none was saved, when a new allow-list has come,
 /// and 60 s after the last change of the installed applications; it is saved as the setting
-/// "SBLAppWhitelistSignature". No signature is a result as well, and takes the saved one away. Any
-/// thread.
+/// "SBLAppWhitelistSignature", and the applications that it tells of, for the device's owner, as
+/// "SBLAppWhitelistApplications". No signature is a result as well, and takes both away. Any thread.
 class AppWhitelistController {
  public:
   explicit AppWhitelistController(Assembly& assembly);
@@ -25,11 +26,14 @@ class AppWhitelistController {
   /// The last result; never waits for the next one.
   std::optional<std::string> whitelistSignature() const;
 
+  /// The identifiers of the applications that the last result tells of; they are never sent.
+  std::vector<std::string> signedApplications() const;
+
  private:
   void armTimer();
   void _handleNewWhitelistFile(const platform::Notification& notification);
   void _generateWhitelistSignature();
-  std::optional<std::string> _generate();
+  std::optional<AppWhitelistSignature> _generate();
 
   Assembly& assembly_;
   const std::shared_ptr<platform::SerialQueue> backgroundQueue_;
@@ -37,8 +41,8 @@ class AppWhitelistController {
 
   std::atomic<bool> generating_{false};
 
-  platform::Timer timer_;                          ///< on backgroundQueue_
-  std::optional<std::string> whitelistSignature_;  ///< on signatureQueue_
+  platform::Timer timer_;                                    ///< on backgroundQueue_
+  std::optional<AppWhitelistSignature> whitelistSignature_;  ///< on signatureQueue_
 
   platform::NotificationCenter::Token registerToken_, newFileToken_;
 };

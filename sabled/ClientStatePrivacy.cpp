@@ -1,5 +1,6 @@
 #include "SableKit/SBLBag.h"
 #include "platform/ManagedConfiguration.h"
+#include "sabled/AppWhitelistController.h"
 #include "sabled/Assembly.h"
 #include "sabled/ClientStateQuery.h"
 #include "sabled/PrivacyReport.h"
@@ -39,6 +40,9 @@ void ClientState::describePrivacy(const SBLRequest& input, PrivacyReport& report
   const auto guid = guidController_->current();
   report.userGuid = guid.guid;
   report.userGuidRotatesIn = platform::toSeconds(guid.expires - assembly_.runtime.now());
+  if (assembly_.appWhitelistController != nullptr) {
+    report.signedApplications = assembly_.appWhitelistController->signedApplications();
+  }
   report.diagnosticsAllowed = assembly_.platform.managedConfiguration().diagnosticsSubmissionAllowed();
   describeQueries(input, report);
   describeOwnRequests(report);

@@ -115,6 +115,7 @@ std::string PrivacyReport::json() const {
                        {{"value", userGuid.string()},
                         {"age", lifetime - userGuidRotatesIn},
                         {"rotates_in", userGuidRotatesIn}}},
+                      {"signed_applications", signedApplications},
                       {"diagnostics_allowed", diagnosticsAllowed}});
 }
 

@@ -29,7 +29,8 @@ struct PrivacyReport {
   std::vector<Request> requests;      ///< that would be sent, if asked for
   std::vector<Unasked> unasked;       ///< that would not
   UUID userGuid;
-  double userGuidRotatesIn = 0;  ///< seconds
+  double userGuidRotatesIn = 0;                 ///< seconds
+  std::vector<std::string> signedApplications;  ///< that the signature of installed ones tells of
   bool diagnosticsAllowed = false;
 
   /// The JSON text that diagnostics show; docs/relay.md describes it.

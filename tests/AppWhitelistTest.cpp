@@ -5,6 +5,7 @@
 
 #include "platform/simulated/SimulatedPlatform.h"
 #include "sabled/AppWhitelist.h"
+#include "sabled/AppWhitelistController.h"
 #include "sabled/DownloadManager.h"
 #include "sabled/RunLengthCode.h"
 #include "sabled/SableBagController.h"
@@ -32,7 +33,8 @@ std::string signatureOf(std::string_view list, const std::vector<std::string>& i
   std::vector<InstalledApplication> applications;
   for (const std::string& identifier : installed) applications.push_back({identifier, "1.0"});
   device.applicationRegistry().change(std::move(applications));
-  return processWhitelist(list, device.applicationRegistry()).value_or(std::string(kNone));
+  const auto signature = processWhitelist(list, device.applicationRegistry());
+  return signature ? signature->text : std::string(kNone);
 }
 
 std::vector<std::string> numbers(int first, int last) {
@@ -87,7 +89,10 @@ TEST(AppWhitelist, ANumberIsBoundedByTheSixteenBitsOfTheLength) {
 TEST(AppWhitelist, OnlyAnIdentifierWithAVersionAndANumberCounts) {
   platform::simulated::SimulatedPlatform device;
   device.applicationRegistry().change({{"", "1.0"}, {"1", ""}, {"3", "1.0"}});
-  EXPECT_EQ(processWhitelist(whitelist({"1", "3"}), device.applicationRegistry()), "iPMT1wobAAGpG9apEA==");
+  const auto signature = processWhitelist(whitelist({"1", "3"}), device.applicationRegistry());
+  ASSERT_NE(signature, std::nullopt);
+  EXPECT_EQ(signature->text, "iPMT1wobAAGpG9apEA==");
+  EXPECT_EQ(signature->applications, std::vector<std::string>{"3"});
 
   const auto listOf = [](const char* entries) {
     const std::string inner = fmt::format(R"({{"version":"0a1b","apps":{{{}}}}})", entries);
@@ -149,6 +154,7 @@ struct AppWhitelistControllerTest : testing::Test {
   std::optional<std::string> saved() {
     return device.platform.userDefaults().string("SBLAppWhitelistSignature");
   }
+  std::vector<std::string> told() { return device.assembly().appWhitelistController->signedApplications(); }
   /// The service offers this list, and the device downloads it.
   void publish(const std::string& list) {
     device.service.on("/resources", answering(list));
@@ -191,6 +197,8 @@ TEST_F(AppWhitelistControllerTest, AListThatArrivesMakesASignatureForRequests) {
   EXPECT_EQ(generations(), 2u);
   EXPECT_EQ(device.platform.transactions().openCount("appWhitelist"), 0u);
   EXPECT_EQ(saved(), kOneAndThree);
+  EXPECT_EQ(told(), (std::vector<std::string>{"1", "3"}));
+  EXPECT_EQ(device.platform.userDefaults().array("SBLAppWhitelistApplications"), (Dictionary{"1", "3"}));
   EXPECT_EQ(sent(), kOneAndThree);
   EXPECT_EQ(sent<SBLLookupRequest>(), kOneAndThree);
   EXPECT_EQ(sent<SBLCardRequest>("/card"), kOneAndThree);
@@ -208,6 +216,7 @@ TEST_F(AppWhitelistControllerTest, AListThatArrivesMakesASignatureForRequests) {
 
   publish("[\"org.example.Mail\"]");
   EXPECT_EQ(saved(), std::nullopt);
+  EXPECT_EQ(told(), std::vector<std::string>());
   EXPECT_EQ(sent(), "");
   EXPECT_EQ(device.log.count(platform::LogLevel::error, "Sable"), 1u) << "that there is no list yet is none";
 }

@@ -188,6 +188,8 @@ TEST_F(PrivacyTest, WhatItTellsOfEachKindOfRequestIsWhatIsSent) {
   device.platform.userDefaults().setByUser("SBLDebugParameters", "cc=XX");
   device.platform.accountStore().values.managed = true;
   device.platform.mapsService().sessions = {{"maps-session", {}}};
+  device.platform.userDefaults().set("SBLAppWhitelistSignature", "signature");
+  device.platform.userDefaults().set("SBLAppWhitelistApplications", {"org.example.Mail"});
   device.platform.locationService().authorize(platform::LocationAuthorization::always);
   start("Rover/1");
   device.platform.locationService().deliver({51.507351, -0.127758, 5, device.platform.runtime().now()});
@@ -218,6 +220,8 @@ TEST_F(PrivacyTest, WhatItTellsOfEachKindOfRequestIsWhatIsSent) {
   EXPECT_TRUE(told(report, "search").contains("mode=managed"));
   EXPECT_TRUE(told(report, "card").contains("latlng=51.500000,-0.100000"));
   EXPECT_TRUE(told(report, "upload").contains("du_enabled=1"));
+  EXPECT_TRUE(told(report, "search").contains("X-Kestrel-Whitelisted-App-Signature=signature"));
+  EXPECT_EQ(report["signed_applications"], json{"org.example.Mail"}) << "as it was saved";
 
   device.advance(14min);
   client = &device.client("com.kestrel.rover", "Rover/1");

@@ -155,13 +155,18 @@ Answer Search::lookUp(const Request& request) const {
   for (const auto& form : baseForms(query)) {
     if (hits.empty()) hits = index_.lookUp(form);
   }
-  if (hits.empty()) {
+  const bool isMeant = !hits.empty();
+  if (!isMeant) {
     if (const auto completion = index_.complete(Corpus::dictionary, query)) {
       hits = index_.find(Corpus::dictionary, completion->text);
     }
   }
-  return Answer::json(
-      {{"query", typed}, {"status", "OK"}, {"results", results(Corpus::dictionary, hits, 0)}});
+  Json found = results(Corpus::dictionary, hits, 0);
+  if (!isMeant && request.item("ltype") == "hint") {
+    // Nobody asked for a hint: what only begins like this had better stand in the text.
+    for (Json& result : found) result["lookup_instructions"] = {{"completion", result["title"]}};
+  }
+  return Answer::json({{"query", typed}, {"status", "OK"}, {"results", std::move(found)}});
 }
 
 Answer Search::more(const Request& request) const {

@@ -20,7 +20,7 @@ class Search {
   /// With an item "ltype" the same as lookUp.
   Answer search(const Request& request) const;
   /// {"query", "results": [...]}: the meanings of the word q or of what it is a form of, else what begins
-  /// with it.
+  /// with it; for a hint with "lookup_instructions" that the text it was taken from has all of that.
   Answer lookUp(const Request& request) const;
   /// GET /more?q=&set=&offset=: {"query", "set", "offset", "results", "more_results_url" where there is
   /// more}.

@@ -84,6 +84,11 @@ std::string identifierLine(const Dictionary& guid) {
                      seconds("rotates_in"));
 }
 
+/// What the signature says, for those who cannot read it.
+std::string signatureLine(const Names& applications) {
+  return fmt::format("The signature of installed applications tells of {}.", fmt::join(applications, ", "));
+}
+
 std::string deepLinkLine(const Dictionary& report) {
   return member(report, "diagnostics_allowed") == true
              ? "Diagnostics are allowed: of deep links that applications drop, a few a day are reported, "
@@ -98,10 +103,13 @@ std::vector<std::string> privacyLines(const Output& output, const Dictionary& re
   addRequests(output, lines, member(report, "requests"));
   addValues(output, lines, member(report, "values"));
   addUnsent(output, lines, member(report, "not_sent"));
-  lines.insert(lines.end(),
-               {"", identifierLine(member(report, "user_guid")), deepLinkLine(report),
-                "Queries also carry what was typed and what their client adds to them. Images and "
-                "warm-ups carry none of this."});
+  lines.insert(lines.end(), {"", identifierLine(member(report, "user_guid")), deepLinkLine(report)});
+  if (const Names applications = namesOf(member(report, "signed_applications")); !applications.empty()) {
+    lines.push_back(signatureLine(applications));
+  }
+  lines.push_back(
+      "Queries also carry what was typed and what their client adds to them. Images and warm-ups carry none "
+      "of this.");
   return lines;
 }
 
