@@ -40,9 +40,14 @@ std::optional<std::string> HostInputModes::preference(int number) const {
 
 std::vector<std::string> HostInputModes::defaultEnabledModes() const {
   const std::string locale = facts_.localeIdentifier();
-  std::string mode = languageTag(locale);
-  std::ranges::replace(mode, '-', '_');
-  return {mode.append("@sw=").append(layoutOf(locale))};
+  const std::lock_guard lock(mutex_);
+  if (locale_ != locale || defaultMode_.empty()) {
+    locale_ = locale;
+    defaultMode_ = languageTag(locale);
+    std::ranges::replace(defaultMode_, '-', '_');
+    defaultMode_.append("@sw=").append(layoutOf(locale));
+  }
+  return {defaultMode_};
 }
 
 bool HostManagedConfiguration::diagnosticsSubmissionAllowed() const {

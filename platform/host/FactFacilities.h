@@ -22,6 +22,10 @@ class HostInputModes final : public InputModes {
 
  private:
   const HostFacts& facts_;
+
+  // Asked for with every keystroke.
+  mutable std::mutex mutex_;
+  mutable std::string locale_, defaultMode_;
 };
 
 /// The locale's region.

@@ -64,12 +64,13 @@ struct HostPlatform::Facilities {
 
   TOMLUserDefaults& settings() { return userDefaults.get(folders, runtime, runtime.reactor(), fileManager); }
   HostLocationService& location() { return locationService.get(runtime, hostFacts(), notificationCenter); }
-  HostFacts& hostFacts() { return facts.get(folders, HostSources{}, runtime.reactor(), notificationCenter); }
+  HostFacts& hostFacts() { return facts.get(folders, sources, runtime.reactor(), notificationCenter); }
 
   HostHTTPSessions::Transfers transfers();
 
   const std::filesystem::path socketPath;
   const Folders folders = Folders::fromEnvironment();
+  const HostSources sources;
   HostRuntime runtime;
   HostProcess process{runtime.reactor()};
   HostFileManager fileManager{folders};

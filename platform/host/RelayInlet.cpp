@@ -40,8 +40,6 @@ int RelayInlet::detach() {
 }
 
 int RelayInlet::admit(std::size_t& messages) {
-  // Whoever typed waits for an answer before he goes on: a second look would cost more than it finds.
-  if (std::exchange(lookedToTheEnd_, false)) return 0;
   if (begun_ && fixed_.empty() && messageLeft_ == 0) {
     const int result = look(messages);
     if (result < 0 || messages > 0) return result;
@@ -77,7 +75,6 @@ int RelayInlet::look(std::size_t& messages) {
     ++messages;
   }
   if (messages == 0) return count;
-  lookedToTheEnd_ = rest.empty();
   if (isAttached()) return count;
   if (::dup3(socket_, input_, O_CLOEXEC) < 0) return -errno;
   toBus_ = Descriptor();

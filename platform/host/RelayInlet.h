@@ -55,7 +55,6 @@ class RelayInlet {
   std::string line_;    // of the handshake, that has not come whole
   std::string fixed_;   // bytes of a message's fixed part that has not come whole
   std::size_t messageLeft_ = 0;
-  bool lookedToTheEnd_ = false;  // of what had come when it was let read
 };
 
 }  // namespace sable::platform::host
