@@ -87,13 +87,23 @@ TEST_F(ApplicationRegistryTest, AnEntryIsAnApplicationWithTheVersionOfItsMetadat
   writeFile(systems("applications/unknown.desktop"), kApplication);
   writeFile(systems("applications/unreleased.desktop"), kApplication);
   writeFile(systems("metainfo/unreleased.metainfo.xml"), metadata("unreleased", "<releases/>"));
+  constexpr std::string_view kElsewhere = "<releases type=\"external\"/>";
+  writeFile(systems("applications/external.desktop"), kApplication);
+  writeFile(systems("metainfo/external.metainfo.xml"), metadata("external", kElsewhere));
+  writeFile(systems("metainfo/releases/external.releases.xml"), kReleases);
+  writeFile(systems("applications/outside.desktop"), kApplication);
+  writeFile(systems("metainfo/outside.metainfo.xml"),
+            metadata("../outside", "<launchable type=\"desktop-id\">outside.desktop</launchable>" +
+                                       std::string(kElsewhere)));
+  writeFile(systems("metainfo/outside.releases.xml"), kReleases);
   writeFile(systems("applications/broken.desktop"), kApplication);
   writeFile(systems("metainfo/broken.metainfo.xml"), "<component><id>broken</id><releases>");
   open();
   EXPECT_THAT(versions(),
               UnorderedElementsAre(Pair("org.example.Mail", "3.2"), Pair("editor", "3.2"), Pair("old", "3.2"),
                                    Pair("vendor-deep-tool", "3.2"), Pair("portable", "7"),
-                                   Pair("unknown", ""), Pair("unreleased", ""), Pair("broken", "")));
+                                   Pair("external", "3.2"), Pair("outside", ""), Pair("unknown", ""),
+                                   Pair("unreleased", ""), Pair("broken", "")));
 }
 
 TEST_F(ApplicationRegistryTest, WhatIsHiddenOrWithoutItsProgramIsNotInstalled) {

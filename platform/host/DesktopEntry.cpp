@@ -24,6 +24,11 @@ void take(DesktopEntry& entry, std::string_view key, std::string_view value) {
   if (key == "X-AppImage-Version") entry.appVersion = value;
 }
 
+/// The first release of a list is the newest.
+std::string newestOf(const pugi::xml_node& releases) {
+  return releases.child("release").attribute("version").value();
+}
+
 }  // namespace
 
 DesktopEntry parseDesktopEntry(std::string_view text) {
@@ -62,14 +67,23 @@ AppStreamComponent parseAppStream(std::string_view text) {
     if (launchable.attribute("type").value() != std::string_view("desktop-id")) continue;
     found.desktopIds.emplace_back(trimmed(launchable.child_value()));
   }
-  // Without a launchable the component is named after the desktop entry, with or without its suffix.
-  if (std::string id(trimmed(component.child_value("id"))); found.desktopIds.empty() && !id.empty()) {
-    if (!id.ends_with(kSuffix)) id += kSuffix;
-    found.desktopIds.push_back(std::move(id));
+  const std::string name(trimmed(component.child_value("id")));
+  const pugi::xml_node releases = component.child("releases");
+  if (releases.attribute("type").value() == std::string_view("external") && name.find('/') == name.npos) {
+    found.releasesFile = name + ".releases.xml";
+  } else {
+    found.version = newestOf(releases);
   }
-  // The first release of the list is the newest.
-  found.version = component.child("releases").child("release").attribute("version").value();
+  // Without a launchable the component is named after the desktop entry, with or without its suffix.
+  if (found.desktopIds.empty() && !name.empty()) {
+    found.desktopIds.push_back(name.ends_with(kSuffix) ? name : name + std::string(kSuffix));
+  }
   return found;
+}
+
+std::string newestRelease(std::string_view text) {
+  pugi::xml_document document;
+  return document.load_buffer(text.data(), text.size()) ? newestOf(document.child("releases")) : "";
 }
 
 }  // namespace sable::platform::host

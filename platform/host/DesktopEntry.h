@@ -27,9 +27,14 @@ std::map<std::string, std::filesystem::path> desktopFilesIn(const std::filesyste
 struct AppStreamComponent {
   std::vector<std::string> desktopIds;  ///< of the entries that start it
   std::string version;                  ///< of the newest release; empty when none is told
+  std::string releasesFile;  ///< in the folder "releases" beside it, that tells it instead; or empty
 };
 
 /// Without ids when the text is no such file.
 AppStreamComponent parseAppStream(std::string_view text);
+
+/// The version of the newest release in such a file of releases (AppStream 1.0, "Release information"); empty
+/// when none is told.
+std::string newestRelease(std::string_view text);
 
 }  // namespace sable::platform::host

@@ -86,7 +86,11 @@ HostApplicationRegistry::Versions HostApplicationRegistry::versionsByDesktopId()
       for (std::filesystem::directory_iterator at(folder / metadata, error), end; !error && at != end;
            at.increment(error)) {
         if (at->path().extension() != ".xml") continue;
-        const AppStreamComponent component = parseAppStream(textOf(at->path(), kMaximumMetadataBytes));
+        AppStreamComponent component = parseAppStream(textOf(at->path(), kMaximumMetadataBytes));
+        if (!component.releasesFile.empty()) {
+          const Path releases = folder / metadata / "releases" / component.releasesFile;
+          component.version = newestRelease(textOf(releases, kMaximumMetadataBytes));
+        }
         if (component.version.empty()) continue;
         for (const std::string& id : component.desktopIds) versions.try_emplace(id, component.version);
       }
