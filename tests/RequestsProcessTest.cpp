@@ -160,6 +160,15 @@ TEST_F(Requests, ALookupTellsWhereItComesFrom) {
                                      {"X-Kestrel-UserGuid", "GUID"}}));
 }
 
+TEST_F(Requests, TheServiceSaysWhatTextAHintFits) {
+  const auto firstResult = [&](const char* selection) {
+    const json answer = world_.sablectlJSON({"lookup", "new yo", "--selection", selection});
+    return answer["reply"]["data"].at(0)["results"].at(0);
+  };
+  EXPECT_EQ(firstResult("2")["lookup_instructions"], (json{{"completion", "New York"}}));
+  EXPECT_FALSE(firstResult("1").contains("lookup_instructions")) << "that was asked for";
+}
+
 TEST_F(Requests, MoreResultsAndCardsKeepTheItemsOfTheirUrl) {
   const json more = only("/more", {"more", world_.serviceURL() + "/more?q=weather&offset=10&locale=de"});
   EXPECT_EQ(items(more), (Pairs{{"esl", "en-GB"},

@@ -166,7 +166,7 @@ Answer Search::lookUp(const Request& request) const {
     // Nobody asked for a hint: what only begins like this had better stand in the text.
     for (Json& result : found) result["lookup_instructions"] = {{"completion", result["title"]}};
   }
-  return Answer::json({{"query", typed}, {"status", "OK"}, {"results", std::move(found)}});
+  return Answer::json(Json::array({{{"query", typed}, {"status", "OK"}, {"results", std::move(found)}}}));
 }
 
 Answer Search::more(const Request& request) const {

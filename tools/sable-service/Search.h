@@ -19,8 +19,9 @@ class Search {
   /// of q; with qtype=zkw suggestions for no text at all; where nothing is found one set with no results.
   /// With an item "ltype" the same as lookUp.
   Answer search(const Request& request) const;
-  /// {"query", "results": [...]}: the meanings of the word q or of what it is a form of, else what begins
-  /// with it; for a hint with "lookup_instructions" that the text it was taken from has all of that.
+  /// An array of one result set {"query", "results": [...]}: the meanings of the word q or of what it is a
+  /// form of, else what begins with it; for a hint with "lookup_instructions" that the text it was taken from
+  /// has all of that.
   Answer lookUp(const Request& request) const;
   /// GET /more?q=&set=&offset=: {"query", "set", "offset", "results", "more_results_url" where there is
   /// more}.
