@@ -53,8 +53,11 @@ struct BackgroundActivitiesManager::State {
                                              platform::QualityOfService::background)),
         feedbackFlusher(std::make_unique<SableFeedbackFlusher>(all, kFeedbacks)) {}
 
+  using Containers = std::vector<std::shared_ptr<FileContainer>>;
+
   void _flusherActivity();
-  void flushFile(const std::shared_ptr<FileContainer>& container, SableFeedbackFlusher& flusher);
+  void flushFiles(const Containers& containers, SableFeedbackFlusher& flusher);
+  std::shared_ptr<FileContainer> holdFirst(Containers::const_iterator& rest, Containers::const_iterator end);
   std::shared_ptr<ClientSession> _readFeedbackFromDisk(const std::shared_ptr<FileContainer>& container);
   void flushToWire(SableFeedbackFlusher& flusher);
   void adoptEarlierRuns();
@@ -122,22 +125,41 @@ void BackgroundActivitiesManager::insertFlushActivity(int) {
 void BackgroundActivitiesManager::State::_flusherActivity() {
   queueFlusher->assertIsCurrent();
   const auto transaction = assembly.platform.transactions().open("_flusherActivity");
-  for (const auto& container : assembly.persistentStorage->getAvailableSessionHandles())
-    flushFile(container, *feedbackFlusher);
+  flushFiles(assembly.persistentStorage->getAvailableSessionHandles(), *feedbackFlusher);
   if (!assembly.crowdsourcingFeedbackFlusher) return;
-  for (const auto& container : assembly.persistentStorage->getAvailableCrowdsourcingHandles())
-    flushFile(container, *assembly.crowdsourcingFeedbackFlusher);
+  flushFiles(assembly.persistentStorage->getAvailableCrowdsourcingHandles(),
+             *assembly.crowdsourcingFeedbackFlusher);
   flushToWire(*assembly.crowdsourcingFeedbackFlusher);
 }
 
-/// One session at a time is in memory. What cannot be read is dropped: it will not be readable later.
-void BackgroundActivitiesManager::State::flushFile(const std::shared_ptr<FileContainer>& container,
-                                                   SableFeedbackFlusher& flusher) {
-  if (!assembly.persistentStorage->holdSessionWithFileContainer(container)) return;
-  auto session = _readFeedbackFromDisk(container);
-  if (!session) return assembly.persistentStorage->deleteSessionWithFileContainer(container);
-  flusher.flushSyncFromArray({std::move(session)});
-  flushToWire(flusher);
+/// One session at a time is packed; the next is read meanwhile. What cannot be read is dropped: it will not
+/// be readable later.
+void BackgroundActivitiesManager::State::flushFiles(const Containers& containers,
+                                                    SableFeedbackFlusher& flusher) {
+  auto rest = containers.begin();
+  auto held = holdFirst(rest, containers.end());
+  while (held) {
+    const auto container = std::move(held);
+    auto session = _readFeedbackFromDisk(container);
+    held = holdFirst(rest, containers.end());
+    if (held) held->readAhead();
+    if (session) {
+      flusher.flushSyncFromArray({std::move(session)});
+      flushToWire(flusher);
+    } else {
+      assembly.persistentStorage->deleteSessionWithFileContainer(container);
+    }
+  }
+}
+
+/// The first of the rest that can be held, or null.
+std::shared_ptr<FileContainer> BackgroundActivitiesManager::State::holdFirst(Containers::const_iterator& rest,
+                                                                             Containers::const_iterator end) {
+  while (rest != end) {
+    const auto& container = *rest++;
+    if (assembly.persistentStorage->holdSessionWithFileContainer(container)) return container;
+  }
+  return nullptr;
 }
 
 std::shared_ptr<ClientSession> BackgroundActivitiesManager::State::_readFeedbackFromDisk(

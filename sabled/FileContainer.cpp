@@ -238,7 +238,14 @@ void FileContainer::_setHandedOver() {
 }
 
 std::shared_ptr<ClientSession> FileContainer::read() {
-  return queue_->sync([this] { return readFile(); });
+  return queue_->sync([this] {
+    auto ahead = std::exchange(ahead_, std::nullopt);
+    return ahead ? *std::move(ahead) : readFile();
+  });
+}
+
+void FileContainer::readAhead() {
+  queue_->async([self = shared_from_this()] { self->ahead_ = self->readFile(); });
 }
 
 std::shared_ptr<ClientSession> FileContainer::readFile() {

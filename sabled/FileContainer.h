@@ -63,6 +63,8 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
   /// The session with its feedback; null when the file is none that this daemon can use, which is
   /// logged. The session keeps the file open, and readable though it be deleted. Waits for the disk.
   std::shared_ptr<ClientSession> read();
+  /// Lets the storage begin with what the next read() returns.
+  void readAhead();
 
   // For the storage, on its queue.
   /// Renames the file to `prefix` and a UUID, so that the next process, too, knows it for the one that was
@@ -112,6 +114,7 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
   std::uint64_t records_ = 0, readRecords_ = 0;         ///< feedback in the file; as far as it was read
   SBLLedgerEntry endOfLaterRecords_ = SBLLedgerEntry::unwritten;  ///< of those that find the file closed
   SBLLedgerEntry end_ = SBLLedgerEntry::damaged;  ///< of those in the file, by the last read()
+  std::optional<std::shared_ptr<ClientSession>> ahead_;
 };
 
 /// The feedback records in a session file, as FileContainer::countRecords().
