@@ -1,9 +1,7 @@
-#include <dirent.h>
 #include <fcntl.h>
 #include <fmt/format.h>
 #include <gtest/gtest.h>
 #include <sys/resource.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
 #include <systemd/sd-bus.h>
 #include <unistd.h>
@@ -16,47 +14,27 @@
 #include "platform/host/HostRuntime.h"
 #include "platform/host/UnixSocket.h"
 #include "platform/simulated/SimulatedLog.h"
+#include "tests/support/RawPeer.h"
 
 // What strangers do to a HostRelay: other D-Bus libraries, raw bytes, peers that do not read.
 namespace sable::platform::host {
 namespace {
 
+using test::RawPeer;
+using test::WireBytes;
+using test::WireCall;
+
 constexpr RelayMethod kMethods[] = {
     {"Echo", "ay", "ay"}, {"Keep", "", ""}, {"Describe", "a{sv}", "s"}, {"Fetch", "t", "ay"}};
 constexpr RelayInterface kInterface{"com.kestrel.Test", "/com/kestrel/test", kMethods};
 
-std::size_t openDescriptors() {
-  std::size_t count = 0;
-  DIR* folder = opendir("/proc/self/fd");
-  while (readdir(folder) != nullptr) ++count;
-  closedir(folder);
-  return count;
-}
-
-std::string readAll(int socket) {
-  std::string bytes;
-  char buffer[4096];
-  for (ssize_t size = 0; (size = read(socket, buffer, sizeof buffer)) > 0;) {
-    bytes.append(buffer, static_cast<std::size_t>(size));
-  }
-  return bytes;
-}
-
-/// A call of Echo with an empty array, little endian, ready to be spoilt.
-std::string echoCall() {
-  const auto field = [](char code, char type, const std::string& value) {
-    std::string bytes{code, 1, type, 0};
-    bytes += std::string{static_cast<char>(value.size()), 0, 0, 0} + value + '\0';
-    while (bytes.size() % 8 != 0) bytes += '\0';
-    return bytes;
-  };
-  std::string fields = field(1, 'o', "/com/kestrel/test") + field(3, 's', "Echo");
-  fields += std::string(
-      "\x08\x01g\0\x02"
-      "ay\0",
-      8);
-  return std::string("l\1\0\1\4\0\0\0\1\0\0\0", 12) + static_cast<char>(fields.size()) +
-         std::string(3, '\0') + fields + std::string(4, '\0');
+/// A call of Echo, ready to be spoilt.
+WireCall echo(std::size_t size = 0) {
+  return {.path = "/com/kestrel/test",
+          .interface = "com.kestrel.Test",
+          .member = "Echo",
+          .signature = "ay",
+          .body = WireBytes().word(static_cast<std::uint32_t>(size)).raw(std::string(size, 'p')).bytes()};
 }
 
 class HostRelayTest : public ::testing::Test {
@@ -108,20 +86,6 @@ class HostRelayTest : public ::testing::Test {
   }
 
   std::string path() const { return *pathOf(listener_->endpoint()); }
-  Descriptor connectRaw() { return std::move(*connectTo(path())); }
-  /// Past authentication, without waiting for the server's lines.
-  Descriptor authenticated() {
-    Descriptor socket = connectRaw();
-    write(socket, std::string("\0AUTH EXTERNAL\r\nDATA\r\nBEGIN\r\n", 29));
-    return socket;
-  }
-  static void write(const Descriptor& socket, std::string_view bytes) {
-    while (!bytes.empty()) {
-      const ssize_t size = ::send(socket.number(), bytes.data(), bytes.size(), MSG_NOSIGNAL);
-      if (size <= 0) return;
-      bytes.remove_prefix(static_cast<std::size_t>(size));
-    }
-  }
   bool waitForEnd() { return ended_->wait(runtime_.ticks() + std::chrono::seconds(60)); }
 
   sd_bus* connectBus() {
@@ -215,54 +179,36 @@ TEST_F(HostRelayTest, NarrowIntegersAreWidenedAndUnknownTypesLeftOut) {
   sd_bus_flush_close_unref(bus);
 }
 
-TEST_F(HostRelayTest, MalformedBytesCostTheirSenderHisConnectionOnly) {
+TEST_F(HostRelayTest, TheLogSaysWhyMalformedBytesEndedTheirConnection) {
   start();
-  const std::string good = echoCall();
+  const std::string good = echo().bytes();
   const auto spoilt = [&](std::size_t at, char byte) {
     std::string bytes = good;
     bytes[at] = byte;
     return bytes;
   };
   {
-    const Descriptor socket = authenticated();
-    write(socket, good);
-    shutdown(socket.number(), SHUT_WR);
-    EXPECT_NE(readAll(socket.number()).find("ay"), std::string::npos);
-    EXPECT_TRUE(waitForEnd());
-    EXPECT_EQ(log_.count("closed"), 0u);
+    RawPeer peer(path());
+    peer.authenticate();
+    peer.send(good);
+    EXPECT_NE(peer.receive().find("ay"), std::string::npos);
   }
-  struct Case {
-    std::string bytes;
-    std::string reason;
-  };
+  EXPECT_TRUE(waitForEnd());
+  EXPECT_EQ(log_.count("closed"), 0u);
   const std::string notDBus = "it sent what is no D-Bus message";
-  for (const auto& [bytes, reason] : std::initializer_list<Case>{
-           {spoilt(0, 'x'), notDBus},
-           {spoilt(good.size() - 4, 100), notDBus},
-           {"no D-Bus at all, not even close to it", notDBus},
-           {spoilt(7, 0x20), "its message is too large"},
-           {spoilt(3, 9), notDBus},
-           {spoilt(16, 77), notDBus},
-       }) {
+  for (const auto& [bytes, reason] : {std::pair{spoilt(0, 'x'), notDBus},
+                                      {spoilt(good.size() - 4, 100), notDBus},
+                                      {"no D-Bus at all, not even close to it", notDBus},
+                                      {spoilt(7, 0x20), "its message is too large"},
+                                      {spoilt(3, 9), notDBus},
+                                      {spoilt(16, 77), notDBus}}) {
     log_.clear();
-    const Descriptor socket = authenticated();
-    write(socket, bytes);
-    EXPECT_EQ(readAll(socket.number()).find("ay"), std::string::npos);
+    RawPeer peer(path());
+    peer.authenticate();
+    peer.send(bytes);
+    EXPECT_EQ(peer.receive(), "hung up");
     EXPECT_TRUE(waitForEnd());
     EXPECT_EQ(log_.count("closed: " + reason), 1u) << reason;
-  }
-  EXPECT_TRUE(stillServes());
-}
-
-TEST_F(HostRelayTest, HalfAHandshakeIsEndedInTime) {
-  configuration_.quotas.handshake = std::chrono::milliseconds(20);
-  start();
-  for (const std::string& bytes :
-       {std::string(), std::string("\0AUTH EXTERNAL\r\n", 16), std::string("GET / HTTP/1.1")}) {
-    const Descriptor socket = connectRaw();
-    write(socket, bytes);
-    readAll(socket.number());
-    EXPECT_TRUE(waitForEnd());
   }
   EXPECT_TRUE(stillServes());
 }
@@ -299,18 +245,12 @@ TEST_F(HostRelayTest, APeerThatDoesNotReadIsCutOffButALargeReplyIsNot) {
             "ay");
   sd_bus_flush_close_unref(reader);
   EXPECT_TRUE(waitForEnd());
-  const Descriptor socket = authenticated();
-  std::string call = echoCall();
-  const std::string payload(60'000, 'p');
-  call.replace(4, 4, std::string("\x64\xEA\0\0", 4));  // the body is its length and 60,000 bytes
-  call.replace(call.size() - 4, 4, std::string("\x60\xEA\0\0", 4));
-  call += payload;
-  std::thread writer([&] {
-    for (int i = 0; i < 2000 && ::send(socket.number(), call.data(), call.size(), MSG_NOSIGNAL) > 0; ++i)
-      continue;
-  });
+  RawPeer peer(path());
+  peer.authenticate();
+  const std::string call = echo(60'000).bytes();
+  int calls = 0;
+  while (peer.send(call)) ASSERT_LT(++calls, 2000);
   EXPECT_TRUE(waitForEnd());
-  writer.join();
   EXPECT_EQ(log_.count("closed: it does not read what it asked for"), 1u);
   EXPECT_TRUE(stillServes());
 }
@@ -335,12 +275,16 @@ TEST_F(HostRelayTest, AMessagePastTheLimitEndsItsConnection) {
 }
 
 TEST_F(HostRelayTest, ConnectingAndLeavingLeavesNothingBehind) {
+  const auto openDescriptors = [] {
+    return std::distance(std::filesystem::directory_iterator("/proc/self/fd"), {});
+  };
   start();
   ASSERT_TRUE(stillServes());
-  const std::size_t before = openDescriptors();
+  const auto before = openDescriptors();
   for (int i = 0; i < 500; ++i) {
-    const Descriptor socket = i % 2 == 0 ? connectRaw() : authenticated();
-    if (i % 3 == 0) write(socket, echoCall().substr(0, 50));
+    RawPeer peer(path());
+    if (i % 2 == 0) peer.authenticate();
+    if (i % 3 == 0) peer.send(echo().bytes().substr(0, 50));
   }
   for (int i = 0; i < 500; ++i) ASSERT_TRUE(waitForEnd());
   {
@@ -365,12 +309,12 @@ TEST_F(HostRelayTest, ALackOfDescriptorsLosesNobody) {
     hogs.push_back(std::move(hog));
   }
   hogs.pop_back();
-  const Descriptor late = connectRaw();
+  RawPeer late(path());
   while (log_.count("cannot accept") == 0) std::this_thread::yield();
   hogs.clear();
-  write(late, std::string("\0AUTH EXTERNAL\r\nDATA\r\nBEGIN\r\n", 29) + echoCall());
-  shutdown(late.number(), SHUT_WR);
-  EXPECT_NE(readAll(late.number()).find("ay"), std::string::npos);
+  late.authenticate();
+  late.send(echo().bytes());
+  EXPECT_NE(late.receive().find("ay"), std::string::npos);
   EXPECT_EQ(log_.count("cannot accept"), 1u);
   setrlimit(RLIMIT_NOFILE, &limit);
 }
