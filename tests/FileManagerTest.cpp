@@ -4,7 +4,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <cerrno>
 #include <csignal>
 #include <memory>
@@ -28,6 +27,19 @@ std::int64_t errorOf(const auto& result) {
 mode_t modeOf(const std::filesystem::path& path) {
   struct stat status {};
   return lstat(path.c_str(), &status) == 0 ? status.st_mode & 07777 : 0;
+}
+
+/// What `work` returns on a disk that has room for files of so many bytes only.
+auto withRoomFor(rlim_t bytes, const auto& work) {
+  const auto ignored = std::signal(SIGXFSZ, SIG_IGN);
+  rlimit old{};
+  getrlimit(RLIMIT_FSIZE, &old);
+  const rlimit small{bytes, old.rlim_max};
+  setrlimit(RLIMIT_FSIZE, &small);
+  auto result = work();
+  setrlimit(RLIMIT_FSIZE, &old);
+  std::signal(SIGXFSZ, ignored);
+  return result;
 }
 
 /// What every file manager promises.
@@ -136,10 +148,12 @@ TEST_F(HostFileManagerTest, FilesAndFoldersAreForTheirOwnerOnly) {
   const mode_t before = umask(0);
   ASSERT_TRUE(files.createDirectory(folder / "a/b"));
   ASSERT_TRUE(files.writeAtomically(folder / "a/b/file", "x"));
+  ASSERT_TRUE(files.createFile(folder / "made"));
   umask(before);
   EXPECT_EQ(modeOf(folder / "a"), 0700u);
   EXPECT_EQ(modeOf(folder / "a/b"), 0700u);
   EXPECT_EQ(modeOf(folder / "a/b/file"), 0600u);
+  EXPECT_EQ(modeOf(folder / "made"), 0600u);
 
   writeFile(folder / "open", "old");
   ASSERT_EQ(chmod((folder / "open").c_str(), 0666), 0);
@@ -147,20 +161,8 @@ TEST_F(HostFileManagerTest, FilesAndFoldersAreForTheirOwnerOnly) {
   EXPECT_EQ(modeOf(folder / "open"), 0600u);
 }
 
-TEST_F(HostFileManagerTest, ReadsRegularFilesOnlyAndNeverWaits) {
-  writeFile(folder / "target", "secret");
-  ASSERT_EQ(symlink("target", (folder / "link").c_str()), 0);
-  ASSERT_EQ(mkfifo((folder / "fifo").c_str(), 0600), 0);
-  EXPECT_EQ(errorOf(files.read(folder / "link", 100)), ELOOP);
-  EXPECT_EQ(errorOf(files.read(folder / "fifo", 100)), EINVAL);
-  EXPECT_EQ(errorOf(files.read("/dev/null", 100)), EINVAL);
-}
-
-TEST_F(HostFileManagerTest, WhatIsNoRegularFileIsNeitherMadeNorAppendedTo) {
-  const mode_t before = umask(0);
-  ASSERT_TRUE(files.createFile(folder / "file"));
-  umask(before);
-  EXPECT_EQ(modeOf(folder / "file"), 0600u);
+TEST_F(HostFileManagerTest, WhatIsNoRegularFileIsNeitherReadNorMadeNorAppendedTo) {
+  writeFile(folder / "file", "untouched");
   ASSERT_EQ(symlink("absent", (folder / "dangling").c_str()), 0);
   ASSERT_EQ(symlink("file", (folder / "link").c_str()), 0);
   ASSERT_EQ(mkfifo((folder / "fifo").c_str(), 0600), 0);
@@ -173,6 +175,13 @@ TEST_F(HostFileManagerTest, WhatIsNoRegularFileIsNeitherMadeNorAppendedTo) {
   EXPECT_FALSE(std::filesystem::exists(folder / "absent"));
   EXPECT_EQ(errorOf(files.openForAppending(folder / "link")), ELOOP);
   EXPECT_EQ(errorOf(files.attributes(folder / "fifo")), EINVAL);
+  EXPECT_EQ(errorOf(files.read(folder / "link", 100)), ELOOP);
+  EXPECT_EQ(errorOf(files.read(folder / "fifo", 100)), EINVAL);
+  EXPECT_EQ(errorOf(files.read("/dev/null", 100)), EINVAL);
+
+  ASSERT_TRUE(files.writeAtomically(folder / "link", "new")) << "a link is replaced, not followed";
+  EXPECT_EQ(readFile(folder / "file"), "untouched");
+  EXPECT_EQ(*files.read(folder / "link", 100), "new");
 }
 
 TEST_F(HostFileManagerTest, AMappedFileCannotBeCutUnderItsReader) {
@@ -197,15 +206,7 @@ TEST_F(HostFileManagerTest, AMappedFileCannotBeCutUnderItsReader) {
 TEST_F(HostFileManagerTest, ADiskThatIsFullTakesWhatItCanAndSaysSo) {
   ASSERT_TRUE(files.createFile(folder / "file"));
   const auto file = *files.openForAppending(folder / "file");
-  const auto ignored = std::signal(SIGXFSZ, SIG_IGN);
-  rlimit old{};
-  getrlimit(RLIMIT_FSIZE, &old);
-  const rlimit small{10, old.rlim_max};
-  setrlimit(RLIMIT_FSIZE, &small);
-  const auto appended = file->append("12345678", "abcd");
-  setrlimit(RLIMIT_FSIZE, &old);
-  std::signal(SIGXFSZ, ignored);
-  EXPECT_EQ(errorOf(appended), EFBIG);
+  EXPECT_EQ(errorOf(withRoomFor(10, [&] { return file->append("12345678", "abcd"); })), EFBIG);
   EXPECT_EQ(readFile(folder / "file"), "12345678ab");
 }
 
@@ -215,14 +216,6 @@ TEST_F(HostFileManagerTest, ACopyIsAsOldAsWhatItWasCopiedFrom) {
   const WallTime created = files.attributes(folder / "file")->creationDate;
   std::filesystem::last_write_time(folder / "file", start);
   EXPECT_NEAR(toSeconds(created - files.attributes(folder / "file")->creationDate), 3600, 60);
-}
-
-TEST_F(HostFileManagerTest, ALinkInThePlaceOfAFileIsReplacedNotFollowed) {
-  writeFile(folder / "target", "untouched");
-  ASSERT_EQ(symlink("target", (folder / "link").c_str()), 0);
-  ASSERT_TRUE(files.writeAtomically(folder / "link", "new"));
-  EXPECT_EQ(readFile(folder / "target"), "untouched");
-  EXPECT_EQ(*files.read(folder / "link", 100), "new");
 }
 
 TEST_F(HostFileManagerTest, FoldersAreReachedThroughOwnLinksButNotThroughAStrangers) {
@@ -248,6 +241,10 @@ TEST_F(HostFileManagerTest, WhatAKilledWriterLeftIsUsedAgain) {
   ASSERT_TRUE(files.writeAtomically(folder / "file", "new"));
   EXPECT_EQ(readFile(folder / "file"), "new");
   EXPECT_FALSE(std::filesystem::exists(folder / ".file.new"));
+
+  std::filesystem::create_directory(folder / "folder");
+  EXPECT_EQ(errorOf(files.writeAtomically(folder / "folder", "x")), EISDIR);
+  EXPECT_FALSE(std::filesystem::exists(folder / ".folder.new")) << "a failed write leaves nothing";
 }
 
 TEST_F(HostFileManagerTest, ReadersSeeOneOfTheTextsWholeWhileSeveralWrite) {
@@ -272,14 +269,6 @@ TEST_F(HostFileManagerTest, ReadersSeeOneOfTheTextsWholeWhileSeveralWrite) {
   EXPECT_FALSE(std::filesystem::exists(folder / ".file.new"));
 }
 
-TEST_F(HostFileManagerTest, AFailedWriteLeavesTheOldFileAndNoRest) {
-  writeFile(folder / "closed/file", "old");
-  std::filesystem::create_directory(folder / "closed/folder");
-  EXPECT_EQ(errorOf(files.writeAtomically(folder / "closed/folder", "x")), EISDIR);
-  EXPECT_FALSE(std::filesystem::exists(folder / "closed/.folder.new"));
-  EXPECT_EQ(errorOf(files.writeAtomically(folder / "missing/file", "x")), ENOENT);
-}
-
 /// A folder on another file system than the temporary one; empty where this host has no such.
 struct OtherFileSystem {
   OtherFileSystem() {
@@ -302,14 +291,8 @@ TEST_F(HostFileManagerTest, AFileFromAnotherFileSystemArrivesWholeOrNotAtAll) {
   const std::string bytes(200'000, 'n');
   writeFile(folder / "file", "old");
   writeFile(other.path / "arrived", bytes);
-  const auto ignored = std::signal(SIGXFSZ, SIG_IGN);
-  rlimit old{};
-  getrlimit(RLIMIT_FSIZE, &old);
-  const rlimit small{100'000, old.rlim_max};
-  setrlimit(RLIMIT_FSIZE, &small);
-  const auto failed = files.replaceItem(folder / "file", other.path / "arrived");
-  setrlimit(RLIMIT_FSIZE, &old);
-  std::signal(SIGXFSZ, ignored);
+  const auto failed =
+      withRoomFor(100'000, [&] { return files.replaceItem(folder / "file", other.path / "arrived"); });
   EXPECT_EQ(errorOf(failed), EFBIG) << "the disk was full half-way";
   EXPECT_EQ(readFile(folder / "file"), "old");
   EXPECT_FALSE(std::filesystem::exists(folder / ".file.new"));

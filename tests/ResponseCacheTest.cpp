@@ -1,6 +1,5 @@
 #include <gtest/gtest.h>
 #include <sqlite3.h>
-#include <sys/stat.h>
 
 #include <fstream>
 
@@ -10,6 +9,7 @@
 #include "platform/simulated/SimulatedLog.h"
 #include "platform/simulated/SimulatedRuntime.h"
 #include "tests/support/LoopbackServer.h"
+#include "tests/support/TemporaryFolder.h"
 
 namespace sable::platform::host {
 namespace {
@@ -38,43 +38,36 @@ HTTPRequest get(const Fields& fields = {}) {
 
 TEST(CacheRules, WhatMayBeStored) {
   const Fields fresh{{"Cache-Control", "max-age=60"}};
+  for (const int status : {200, 203, 404, 410})
+    EXPECT_TRUE(isStorable(get(), status, headers(fresh))) << status;
+  for (const int status : {204, 206, 301, 302, 304, 500})
+    EXPECT_FALSE(isStorable(get(), status, headers(fresh))) << status;
   const struct {
-    int status;
     Fields request, response;
     bool storable;
   } rows[] = {
-      {200, {}, {}, false},
-      {200, {}, fresh, true},
-      {203, {}, fresh, true},
-      {301, {}, fresh, false},
-      {404, {}, fresh, true},
-      {410, {}, fresh, true},
-      {204, {}, fresh, false},
-      {206, {}, fresh, false},
-      {302, {}, fresh, false},
-      {304, {}, fresh, false},
-      {500, {}, fresh, false},
-      {200, {}, {{"cache-control", "PRIVATE, Max-Age=\"60\""}}, true},
-      {200, {}, {{"Cache-Control", "max-age=0"}}, false},
-      {200, {}, {{"Cache-Control", "max-age=-1"}}, false},
-      {200, {}, {{"Cache-Control", "max-age=1x"}}, false},
-      {200, {}, {{"Cache-Control", "max-age=60"}, {"Cache-Control", "max-age=0"}}, false},
-      {200, {}, {{"Cache-Control", "max-age=99999999999999999999"}}, true},
-      {200, {}, {{"Cache-Control", "x=\"no-store, a\\\"\", max-age=1"}}, true},
-      {200, {}, {{"Cache-Control", "max-age=60"}, {"Cache-Control", "no-store"}}, false},
-      {200, {{"Cache-Control", "no-store"}}, fresh, false},
-      {200, {}, {{"Cache-Control", "max-age=60, no-cache"}}, false},
-      {200, {}, {{"Cache-Control", "no-cache"}, {"ETag", "\"1\""}}, true},
-      {200, {}, {{"Last-Modified", kDateText}}, true},
-      {200, {}, {{"Date", kDateText}, {"Expires", kMinuteLater}}, true},
-      {200, {}, {{"Date", kDateText}, {"Expires", kDateText}}, false},
-      {200, {}, {{"Expires", "0"}}, false},
-      {200, {}, {{"ETag", "\"1\""}, {"Vary", "Accept, *"}}, false},
-      {200, {}, {{"ETag", "\"1\""}, {"Vary", "Accept"}}, true},
+      {{}, {}, false},
+      {{}, {{"cache-control", "PRIVATE, Max-Age=\"60\""}}, true},
+      {{}, {{"Cache-Control", "max-age=0"}}, false},
+      {{}, {{"Cache-Control", "max-age=-1"}}, false},
+      {{}, {{"Cache-Control", "max-age=1x"}}, false},
+      {{}, {{"Cache-Control", "max-age=60"}, {"Cache-Control", "max-age=0"}}, false},
+      {{}, {{"Cache-Control", "max-age=99999999999999999999"}}, true},
+      {{}, {{"Cache-Control", "x=\"no-store, a\\\"\", max-age=1"}}, true},
+      {{}, {{"Cache-Control", "max-age=60"}, {"Cache-Control", "no-store"}}, false},
+      {{{"Cache-Control", "no-store"}}, fresh, false},
+      {{}, {{"Cache-Control", "max-age=60, no-cache"}}, false},
+      {{}, {{"Cache-Control", "no-cache"}, {"ETag", "\"1\""}}, true},
+      {{}, {{"Last-Modified", kDateText}}, true},
+      {{}, {{"Date", kDateText}, {"Expires", kMinuteLater}}, true},
+      {{}, {{"Date", kDateText}, {"Expires", kDateText}}, false},
+      {{}, {{"Expires", "0"}}, false},
+      {{}, {{"ETag", "\"1\""}, {"Vary", "Accept, *"}}, false},
+      {{}, {{"ETag", "\"1\""}, {"Vary", "Accept"}}, true},
   };
   for (const auto& row : rows) {
-    EXPECT_EQ(isStorable(get(row.request), row.status, headers(row.response)), row.storable)
-        << row.status << ' ' << headers(row.request).description() << headers(row.response).description();
+    EXPECT_EQ(isStorable(get(row.request), 200, headers(row.response)), row.storable)
+        << headers(row.request).description() << headers(row.response).description();
   }
 }
 
@@ -126,54 +119,31 @@ TEST(CacheRules, VariantsAnswerTheirOwnRequests) {
 }
 
 TEST(CacheRules, AValidationRenewsHeadersAndTimes) {
-  const StoredResponse stored{"http://h/",
-                              200,
-                              headers({{"Date", kDateText},
-                                       {"Age", "9"},
-                                       {"ETag", "1"},
-                                       {"X", "a"},
-                                       {"X", "b"},
-                                       {"Content-Length", "2"}}),
-                              {},
-                              makeData("hi"),
-                              kDate,
-                              kDate};
+  const auto old = headers(
+      {{"Date", kDateText}, {"Age", "9"}, {"ETag", "1"}, {"X", "a"}, {"X", "b"}, {"Content-Length", "2"}});
+  const StoredResponse stored{"http://h/", 200, old, {}, makeData("hi"), kDate, kDate};
   HTTPHeaders conditions;
   addConditions(stored, conditions);
   EXPECT_EQ(conditions.fields(), (Fields{{"If-None-Match", "1"}}));
   const auto later = kDate + hours(1);
-  const auto renewed = validated(
-      stored, headers({{"X", "c"}, {"X", "d"}, {"Content-Length", "0"}, {"Cache-Control", "max-age=60"}}),
-      later, later);
-  EXPECT_EQ(
-      renewed.headers.fields(),
-      (Fields{
-          {"ETag", "1"}, {"Content-Length", "2"}, {"X", "c"}, {"X", "d"}, {"Cache-Control", "max-age=60"}}));
+  const Fields answered{{"X", "c"}, {"X", "d"}, {"Content-Length", "0"}, {"Cache-Control", "max-age=60"}};
+  const auto renewed = validated(stored, headers(answered), later, later);
+  const Fields expected{
+      {"ETag", "1"}, {"Content-Length", "2"}, {"X", "c"}, {"X", "d"}, {"Cache-Control", "max-age=60"}};
+  EXPECT_EQ(renewed.headers.fields(), expected);
   EXPECT_EQ(*renewed.body, "hi");
   EXPECT_EQ(reuse(renewed, get(), later + seconds(59)), Reuse::asItIs);
 }
 
 class CacheInAFolder : public ::testing::Test {
  protected:
-  CacheInAFolder() {
-    std::string pattern = ::testing::TempDir() + "cacheXXXXXX";
-    folder_ = ::mkdtemp(pattern.data());
-    file_ = folder_ / "http" / "cache.db";
-  }
-  ~CacheInAFolder() override { std::filesystem::remove_all(folder_); }
-
   std::shared_ptr<ResponseCache> cache(std::size_t memory, std::size_t disk) {
     return std::make_shared<ResponseCache>(runtime_, runtime_.serialQueue("owner"), file_, memory, disk);
   }
 
   static StoredResponse response(const std::string& url, std::string body) {
-    return {url,
-            200,
-            headers({{"ETag", "1"}, {"X", ""}}),
-            headers({{"Y", "y"}}),
-            makeData(std::move(body)),
-            kDate,
-            kDate + seconds(1)};
+    const auto own = headers({{"ETag", "1"}, {"X", ""}}), varied = headers({{"Y", "y"}});
+    return {url, 200, own, varied, makeData(std::move(body)), kDate, kDate + seconds(1)};
   }
 
   std::optional<std::string> bodyOf(ResponseCache& cache, const std::string& url) {
@@ -188,7 +158,8 @@ class CacheInAFolder : public ::testing::Test {
     return body;
   }
 
-  std::filesystem::path folder_, file_;
+  const TemporaryFolder folder_;
+  const std::filesystem::path file_ = folder_ / "http/cache.db";
   simulated::SimulatedRuntime runtime_;
 };
 
@@ -204,11 +175,9 @@ TEST_F(CacheInAFolder, ResponsesOutliveTheProcess) {
     first->store(response("a", std::string("4\0x", 3)));
   }
   runtime_.run();
-  struct stat status {};
-  ASSERT_EQ(::stat(file_.c_str(), &status), 0);
-  EXPECT_EQ(status.st_mode & 0777u, 0600u);
-  ASSERT_EQ(::stat(file_.parent_path().c_str(), &status), 0);
-  EXPECT_EQ(status.st_mode & 0777u, 0700u);
+  const auto mode = [](const auto& path) { return std::filesystem::status(path).permissions(); };
+  EXPECT_EQ(mode(file_), std::filesystem::perms(0600));
+  EXPECT_EQ(mode(file_.parent_path()), std::filesystem::perms(0700));
 
   const auto second = cache(1000, 10000);
   EXPECT_EQ(bodyOf(*second, "a"), std::string("4\0x", 3));
@@ -250,7 +219,7 @@ TEST_F(CacheInAFolder, TheLeastRecentlyUsedGoFirst) {
 }
 
 TEST_F(CacheInAFolder, AFileThatIsNoCacheIsReplacedOnce) {
-  const auto garbage = [&] { std::ofstream(file_) << std::string(5000, 'g'); };
+  const auto garbage = [&] { writeFile(file_, std::string(5000, 'g')); };
   const auto foreign = [&] {
     sqlite3* database = nullptr;
     ASSERT_EQ(sqlite3_open(file_.c_str(), &database), SQLITE_OK);
@@ -264,8 +233,7 @@ TEST_F(CacheInAFolder, AFileThatIsNoCacheIsReplacedOnce) {
     file.seekp(4096);
     file << std::string(12000, '\xff');
   };
-  for (const std::function<void()>& spoil :
-       {std::function<void()>(garbage), std::function<void()>(foreign), std::function<void()>(damaged)}) {
+  for (const auto& spoil : std::initializer_list<std::function<void()>>{garbage, foreign, damaged}) {
     std::filesystem::remove_all(file_.parent_path());
     std::filesystem::create_directory(file_.parent_path());
     spoil();
@@ -285,7 +253,7 @@ TEST_F(CacheInAFolder, AFileThatIsNoCacheIsReplacedOnce) {
 }
 
 TEST_F(CacheInAFolder, WithoutAFileMemoryStillServes) {
-  std::ofstream(folder_ / "http") << "in the way";
+  writeFile(folder_ / "http", "in the way");
   const simulated::SimulatedLog log;
   const auto cache = this->cache(1000, 1000);
   cache->store(response("a", "1"));
@@ -301,7 +269,7 @@ TEST_F(CacheInAFolder, ASessionAsksTheServerOnlyForWhatItMust) {
   HostRuntime runtime(2);
   tests::LoopbackServer server(runtime);
   NotificationCenter center;
-  HostHTTPSessions sessions(runtime, folder_, {center, nullptr, {}});
+  HostHTTPSessions sessions(runtime, folder_.path(), {center, nullptr, {}});
   HTTPSessionConfiguration configuration;
   configuration.label = "cached";
   configuration.allowsCache = true;
@@ -315,13 +283,11 @@ TEST_F(CacheInAFolder, ASessionAsksTheServerOnlyForWhatItMust) {
     request.cachePolicy = policy;
     HTTPResult result;
     const auto done = runtime.semaphore(0);
-    session
-        ->dataTask(std::move(request),
-                   [&](HTTPResult got) {
-                     result = std::move(got);
-                     done->signal();
-                   })
-        ->resume();
+    const auto task = session->dataTask(std::move(request), [&](HTTPResult got) {
+      result = std::move(got);
+      done->signal();
+    });
+    task->resume();
     EXPECT_TRUE(done->wait(MonotonicTime::max()));
     EXPECT_FALSE(result.error);
     return result;
