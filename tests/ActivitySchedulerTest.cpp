@@ -25,6 +25,7 @@ using RunningActivity = std::shared_ptr<Activity>;
 
 constexpr const char* kName = "com.kestrel.test";
 constexpr ActivityCriteria kEveryTenMinutes{300s, 600s, 300s, true, true};
+constexpr ActivityCriteria kWithoutGrace{300s, 600s, 0s, true, true};
 
 TEST(FirstRunTest, HonoursDelayIntervalAndGrace) {
   const WallTime now = wallTimeFromSecondsSince1970(1.8e9);
@@ -89,13 +90,11 @@ TEST_F(ActivitySchedulerTest, DevicesThatStartTogetherDoNotRunTogether) {
 }
 
 TEST_F(ActivitySchedulerTest, ARestartNeitherSkipsNorDoublesARun) {
-  ActivityCriteria exact = kEveryTenMinutes;
-  exact.gracePeriod = {};
-  add(exact);
+  add(kWithoutGrace);
   runtime.advance(400s);  // ran at 300 s
   scheduler.unregister(kName);
   runtime.advance(100s);
-  add(exact);
+  add(kWithoutGrace);
   runtime.advance(399s);
   EXPECT_EQ(runs, std::vector<Duration>{300s});
   runtime.advance(1s);
@@ -103,7 +102,7 @@ TEST_F(ActivitySchedulerTest, ARestartNeitherSkipsNorDoublesARun) {
 
   scheduler.unregister(kName);
   runtime.jumpWallClock(-24h);
-  add(exact);  // its last run seems to lie in the future
+  add(kWithoutGrace);  // its last run seems to lie in the future
   runtime.advance(300s);
   EXPECT_EQ(runs.back(), 1200s);
 }
@@ -147,9 +146,7 @@ TEST_F(ActivitySchedulerTest, WorkThatNeedsPowerWaitsForIt) {
 
 TEST_F(ActivitySchedulerTest, ARunIsOpenUntilItIsDoneAndNeverTwiceAtOnce) {
   std::vector<RunningActivity> open;
-  ActivityCriteria exact = kEveryTenMinutes;
-  exact.gracePeriod = {};
-  add(exact, [&](const RunningActivity& activity) {
+  add(kWithoutGrace, [&](const RunningActivity& activity) {
     EXPECT_EQ(activity->state(), run);
     EXPECT_FALSE(activity->setState(checkIn));
     EXPECT_TRUE(activity->setState(continueRunning));
@@ -166,7 +163,7 @@ TEST_F(ActivitySchedulerTest, ARunIsOpenUntilItIsDoneAndNeverTwiceAtOnce) {
   EXPECT_EQ(runs, (std::vector<Duration>{300s, 2h})) << "the run that came due meanwhile begins at once";
 
   scheduler.unregister(kName);  // while its second run is open
-  add(exact);
+  add(kWithoutGrace);
   runtime.advance(1h);
   EXPECT_EQ(runs.size(), 2u);
   open.clear();  // nobody can end it any more
@@ -200,6 +197,9 @@ struct HostActivitySchedulerTest : testing::Test {
   host::HostFacts facts{folders, sources, reactor, center};
   int runs = 0;
 
+  void supply(const char* name, const char* attribute, const char* value) {
+    writeFile(sources.root / "sys/class/power_supply" / name / attribute, value);
+  }
   /// A process that lives for so long.
   void live(Duration life, bool allowBattery) {
     host::HostActivityScheduler scheduler(runtime, center, facts, files, folders.activityRuns());
@@ -240,9 +240,6 @@ TEST_F(HostActivitySchedulerTest, ReadsOnlyTimesFromItsFile) {
 }
 
 TEST_F(HostActivitySchedulerTest, KnowsItsBatteryByTheKernel) {
-  const auto supply = [&](const char* name, const char* attribute, const char* value) {
-    writeFile(sources.root / "sys/class/power_supply" / name / attribute, value);
-  };
   EXPECT_FALSE(host::runsOnBattery(sources.root));
   supply("BAT0", "type", "Battery\n");
   supply("BAT0", "status", "Discharging\n");
@@ -260,15 +257,14 @@ TEST_F(HostActivitySchedulerTest, KnowsItsBatteryByTheKernel) {
 }
 
 TEST_F(HostActivitySchedulerTest, WaitsForPowerThatTheKernelDoesNotAnnounceAndTheFactsDo) {
-  const auto mains = sources.root / "sys/class/power_supply/AC";
-  writeFile(mains.parent_path() / "BAT0/type", "Battery\n");
-  writeFile(mains.parent_path() / "BAT0/status", "Discharging\n");
+  supply("BAT0", "type", "Battery\n");
+  supply("BAT0", "status", "Discharging\n");
   host::HostActivityScheduler scheduler(runtime, center, facts, files, folders.activityRuns());
   scheduler.registerActivity(kName, {60s, 24h, {}, true, false}, [this](const auto&) { ++runs; });
   runtime.advance(1h);
   EXPECT_EQ(runs, 0);
-  writeFile(mains / "type", "Mains\n");
-  writeFile(mains / "online", "1\n");
+  supply("AC", "type", "Mains\n");
+  supply("AC", "online", "1\n");
   runtime.advance(kActivityRetryPause);
   EXPECT_EQ(runs, 1);
 

@@ -75,21 +75,19 @@ TEST_F(FactsTest, AChangeIsPostedForTheFacilitiesItChangesOnly) {
   EXPECT_EQ(change("product_name = \"X\""), Names{});
   EXPECT_EQ(change("managed_account = true"), Names{"AccountStoreDidChange"});
   EXPECT_EQ(change("managed_account = true # still"), Names{});
-  EXPECT_EQ(change("managed_account = true\ndiagnostics_allowed = true"),
-            Names{"EffectiveSettingsDidChange"});
-  EXPECT_EQ(change("managed_account = true\ndiagnostics_allowed = true\nmusic_subscription_status = 3"),
-            Names{"MusicSubscriptionStatusDidChange"});
+  const std::string allowed = "managed_account = true\ndiagnostics_allowed = true\n";
+  EXPECT_EQ(change(allowed), Names{"EffectiveSettingsDidChange"});
+  EXPECT_EQ(change(allowed + "music_subscription_status = 3"), Names{"MusicSubscriptionStatusDidChange"});
   EXPECT_EQ(
-      change("managed_account = true\ndiagnostics_allowed = true\nstorefront = \"1\"\n[[subscriptions]]\n"
-             "provider = \"a\"\nmodified = 2026-01-01"),
+      change(allowed + "storefront = \"1\"\n[[subscriptions]]\nprovider = \"a\"\nmodified = 2026-01-01"),
       (Names{"MusicSubscriptionStatusDidChange", "StoreFrontDidChange", "SubscriptionRegistryDidUpdate"}));
-  change("managed_account = true\ndiagnostics_allowed = true");
+  change(allowed);
   EXPECT_EQ(change("country_code = \"DE\""), (Names{"EffectiveSettingsDidChange", "AccountStoreDidChange"}));
   EXPECT_EQ(change("locale = \"de_AT\""), (Names{"CurrentLocaleDidChange", "CountryCodeDidChange"}));
-  EXPECT_EQ(change("locale = \"de_AT\"\nhour_cycle_24 = false"), Names{"CurrentLocaleDidChange"});
-  EXPECT_EQ(change("locale = \"de_AT\"\nhour_cycle_24 = false\ntime_zone = \"UTC\""), Names{});
-  EXPECT_EQ(change("locale = \"de_AT\"\nhour_cycle_24 = false\ntime_zone = \"Europe/Rome\""),
-            Names{"SystemTimeZoneDidChange"});
+  const std::string locale = "locale = \"de_AT\"\nhour_cycle_24 = false\n";
+  EXPECT_EQ(change(locale), Names{"CurrentLocaleDidChange"});
+  EXPECT_EQ(change(locale + "time_zone = \"UTC\""), Names{});
+  EXPECT_EQ(change(locale + "time_zone = \"Europe/Rome\""), Names{"SystemTimeZoneDidChange"});
   posted.clear();
   std::filesystem::remove(folders.userFacts());
   reactor.run();

@@ -252,30 +252,6 @@ TEST(SimulatedRuntimeTest, ASeedIsARun) {
   EXPECT_NE(interleaving(7).substr(0, 20), interleaving(8).substr(0, 20));
 }
 
-TEST(SimulatedRuntimeTest, TimeMovesOnlyWhenNothingIsReady) {
-  SimulatedRuntime runtime;
-  const auto queue = runtime.serialQueue("time");
-  const MonotonicTime start = runtime.ticks();
-  const WallTime wall = runtime.now();
-  std::vector<Duration> rings;
-  std::function<void()> ring = [&] {
-    rings.push_back(runtime.ticks() - start);
-    queue->after(20min, [&] { ring(); }).detach();
-  };
-  queue->async([&] { ring(); });
-  runtime.run();
-  EXPECT_EQ(rings, std::vector<Duration>{0s});
-  runtime.advance(50min);
-  EXPECT_EQ(rings, (std::vector<Duration>{0s, 20min, 40min}));
-  EXPECT_EQ(runtime.ticks() - start, 50min);
-  runtime.jumpWallClock(-24h);
-  EXPECT_EQ(runtime.now(), wall + 50min - 24h);
-  EXPECT_TRUE(runtime.runUntil([&] { return rings.size() == 6; }, 48h));
-  EXPECT_EQ(runtime.ticks() - start, 100min);
-  EXPECT_FALSE(runtime.runUntil([&] { return rings.size() == 9; }, 30min));
-  EXPECT_EQ(runtime.ticks() - start, 130min);
-}
-
 TEST(SimulatedRuntimeTest, WhatCanNeverEndStopsTheProcess) {
   SimulatedRuntime runtime;
   const auto queue = runtime.serialQueue("stuck");
