@@ -217,24 +217,24 @@ TEST_F(HostRelayTest, CallsInFlightAreCountedExactly) {
   configuration_.quotas.callsInFlight = 4;
   keep_ = 4;
   start();
-  sd_bus* bus = connectBus();
-  const auto call = [bus](int times) {
-    for (int i = 0; i < times; ++i) {
-      sd_bus_call_method_async(
-          bus, nullptr, nullptr, "/com/kestrel/test", "com.kestrel.Test", "Keep",
-          [](sd_bus_message*, void*, sd_bus_error*) { return 0; }, nullptr, "");
-    }
-  };
-  for (int round = 0; round < 3; ++round) call(4);
-  EXPECT_EQ(ask(bus, "/com/kestrel/test", "com.kestrel.Test", "Echo", "ay", 0), "ay");
+  WireCall keep = echo();
+  keep.member = "Keep";
+  keep.signature = keep.body = "";
+  RawPeer peer(path());
+  peer.authenticate();
+  for (int i = 0; i < 12; ++i) peer.send(keep.bytes());
+  peer.send(echo().bytes());
+  std::string said = peer.receive();
+  while (said.find("ay") == std::string::npos && said != "hung up" && said != "silence")
+    said = peer.receive();
+  ASSERT_NE(said.find("ay"), std::string::npos) << said;
   {
     const std::lock_guard lock(mutex_);
     keep_ = 0;
   }
-  call(5);
+  for (int i = 0; i < 5; ++i) peer.send(keep.bytes());
   EXPECT_TRUE(waitForEnd());
   EXPECT_EQ(log_.count("closed: it has too many calls in flight"), 1u);
-  sd_bus_close_unref(bus);
 }
 
 TEST_F(HostRelayTest, APeerThatDoesNotReadIsCutOffButALargeReplyIsNot) {
@@ -258,20 +258,14 @@ TEST_F(HostRelayTest, APeerThatDoesNotReadIsCutOffButALargeReplyIsNot) {
 TEST_F(HostRelayTest, AMessagePastTheLimitEndsItsConnection) {
   configuration_.quotas.messageBytes = 50'000;
   start();
-  sd_bus* bus = connectBus();
-  for (const std::size_t size : {std::size_t{49'000}, std::size_t{50'001}}) {
-    const std::string body(size, 'b');
-    sd_bus_message* call = nullptr;
-    sd_bus_message_new_method_call(bus, &call, nullptr, "/com/kestrel/test", "com.kestrel.Test", "Echo");
-    sd_bus_message_append_array(call, 'y', body.data(), body.size());
-    sd_bus_message* reply = nullptr;
-    EXPECT_EQ(sd_bus_call(bus, call, 0, nullptr, &reply) >= 0, size < 50'000);
-    sd_bus_message_unref(call);
-    sd_bus_message_unref(reply);
+  for (const auto& [size, outcome] : {std::pair(49'000, "ay"), {50'001, "hung up"}}) {
+    RawPeer peer(path());
+    peer.authenticate();
+    peer.send(echo(size).bytes());
+    EXPECT_NE(peer.receive().find(outcome), std::string::npos) << size;
   }
-  EXPECT_TRUE(waitForEnd());
+  EXPECT_TRUE(waitForEnd() && waitForEnd());
   EXPECT_EQ(log_.count("closed: its message is too large"), 1u);
-  sd_bus_close_unref(bus);
 }
 
 TEST_F(HostRelayTest, ConnectingAndLeavingLeavesNothingBehind) {
