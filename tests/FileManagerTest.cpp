@@ -304,54 +304,36 @@ TEST_F(HostFileManagerTest, AFileFromAnotherFileSystemArrivesWholeOrNotAtAll) {
 }
 
 TEST(FoldersTest, TheFirstVariableThatIsSetDecides) {
-  struct Case {
-    std::map<std::string, std::string> variables;
-    std::string runtime, caches, state, config, profile;
-  };
-  const std::string run = "/run/user/" + std::to_string(getuid());
-  const std::string etc = "/etc/com.kestrel.sabled/defaults.toml";
-  const Case cases[] = {
-      {{{"HOME", "/h"}},
-       run + "/com.kestrel.sabled",
-       "/h/.cache/com.kestrel.sabled",
-       "/h/.local/state/com.kestrel.sabled",
-       "/h/.config/com.kestrel.sabled",
-       etc},
-      {{{"HOME", "/h"},
-        {"XDG_RUNTIME_DIR", "/r"},
-        {"XDG_CACHE_HOME", "/c"},
-        {"XDG_STATE_HOME", "/s"},
-        {"XDG_CONFIG_HOME", "relative"}},
-       "/r/com.kestrel.sabled",
-       "/c/com.kestrel.sabled",
-       "/s/com.kestrel.sabled",
-       "/h/.config/com.kestrel.sabled",
-       etc},
-      {{{"HOME", "/h"},
-        {"XDG_RUNTIME_DIR", "/r"},
-        {"SABLED_RUNTIME_DIR", "/R"},
-        {"SABLED_CACHES_DIR", "/C"},
-        {"SABLED_STATE_DIR", "/S"},
-        {"SABLED_CONFIG_DIR", "/F"},
-        {"SABLED_PROFILE", "/P.toml"}},
-       "/R",
-       "/C/com.kestrel.sabled",
-       "/S",
-       "/F",
-       "/P.toml"},
-  };
-  for (const Case& each : cases) {
-    const auto folders = host::Folders::fromEnvironment([&](const char* name) -> std::optional<std::string> {
-      const auto found = each.variables.find(name);
-      return found == each.variables.end() ? std::nullopt : std::optional(found->second);
+  const auto foldersOf = [](const std::map<std::string, std::string>& variables) {
+    return host::Folders::fromEnvironment([&](const char* name) -> std::optional<std::string> {
+      const auto found = variables.find(name);
+      return found == variables.end() ? std::nullopt : std::optional(found->second);
     });
-    EXPECT_EQ(folders.runtime, each.runtime);
-    EXPECT_EQ(folders.socket(), each.runtime + "/relay.sock");
-    EXPECT_EQ(folders.caches, each.caches);
-    EXPECT_EQ(folders.state, each.state);
-    EXPECT_EQ(folders.config, each.config);
-    EXPECT_EQ(folders.profileSettings, each.profile);
-  }
+  };
+  const auto byHome = foldersOf({{"HOME", "/h"}});
+  EXPECT_EQ(byHome.runtime, "/run/user/" + std::to_string(getuid()) + "/com.kestrel.sabled");
+  EXPECT_EQ(byHome.caches, "/h/.cache/com.kestrel.sabled");
+  EXPECT_EQ(byHome.state, "/h/.local/state/com.kestrel.sabled");
+  EXPECT_EQ(byHome.config, "/h/.config/com.kestrel.sabled");
+  EXPECT_EQ(byHome.profileSettings, "/etc/com.kestrel.sabled/defaults.toml");
+  std::map<std::string, std::string> variables{{"HOME", "/h"},
+                                               {"XDG_RUNTIME_DIR", "/r"},
+                                               {"XDG_CACHE_HOME", "/c"},
+                                               {"XDG_STATE_HOME", "/s"},
+                                               {"XDG_CONFIG_HOME", "relative"}};
+  const auto byDesktop = foldersOf(variables);
+  EXPECT_EQ(byDesktop.socket(), "/r/com.kestrel.sabled/relay.sock");
+  EXPECT_EQ(byDesktop.caches, "/c/com.kestrel.sabled");
+  EXPECT_EQ(byDesktop.state, "/s/com.kestrel.sabled");
+  EXPECT_EQ(byDesktop.config, "/h/.config/com.kestrel.sabled");
+  for (const char* name : {"RUNTIME_DIR", "CACHES_DIR", "STATE_DIR", "CONFIG_DIR", "PROFILE"})
+    variables[std::string("SABLED_") + name] = std::string("/own/") + name;
+  const auto own = foldersOf(variables);
+  EXPECT_EQ(own.socket(), "/own/RUNTIME_DIR/relay.sock");
+  EXPECT_EQ(own.caches, "/own/CACHES_DIR/com.kestrel.sabled");
+  EXPECT_EQ(own.state, "/own/STATE_DIR");
+  EXPECT_EQ(own.config, "/own/CONFIG_DIR");
+  EXPECT_EQ(own.profileSettings, "/own/PROFILE");
 }
 
 }  // namespace

@@ -88,32 +88,27 @@ TEST_F(HostSession, ResponsesArriveWhole) {
 TEST_F(HostSession, RequestsLeaveAsTheyWereMade) {
   server_.on("/a/../r", LoopbackServer::ok(""));
   const auto session = this->session();
-  const std::string common = "Host: 127.0.0.1:" + std::to_string(server_.port()) + "\r\n";
-  const std::string accepts = "Accept: */*\r\nAccept-Encoding: deflate, gzip, br, zstd\r\n";
+  const std::string host = "Host: 127.0.0.1:" + std::to_string(server_.port()) + "\r\n";
+  const std::string encodings = "Accept-Encoding: deflate, gzip, br, zstd\r\n";
+  const std::string usual = host + "Accept: */*\r\n" + encodings;
+  using Fields = std::vector<std::pair<std::string, std::string>>;
+  const Fields odd{{"X-Empty", ""}, {"X-Blank", "  "}, {"User-Agent", "a b"}, {"X", "1"}, {"X", "2"}};
+  const Fields json{{"Content-Type", "application/json"}};
   const struct {
     std::string method;
     Data body;
-    std::vector<std::pair<std::string, std::string>> headers;
+    Fields headers;
     std::string expected;
   } rows[] = {
-      {"GET", nullptr, {}, common + accepts + "\r\n"},
-      {"GET",
-       nullptr,
-       {{"X-Empty", ""}, {"X-Blank", "  "}, {"User-Agent", "a b"}, {"X", "1"}, {"X", "2"}},
-       common + accepts + "X-Empty:\r\nX-Blank:\r\nUser-Agent: a b\r\nX: 1\r\nX: 2\r\n\r\n"},
-      {"GET",
-       nullptr,
-       {{"Accept", "text/json"}},
-       common + "Accept-Encoding: deflate, gzip, br, zstd\r\nAccept: text/json\r\n\r\n"},
-      {"POST", makeData("body"), {}, common + accepts + "Content-Length: 4\r\n\r\nbody"},
-      {"POST", nullptr, {}, common + accepts + "Content-Length: 0\r\n\r\n"},
-      {"POST",
-       makeData("{}"),
-       {{"Content-Type", "application/json"}},
-       common + accepts + "Content-Type: application/json\r\nContent-Length: 2\r\n\r\n{}"},
-      {"PUT", makeData("x"), {}, common + accepts + "Content-Length: 1\r\n\r\nx"},
-      {"DELETE", nullptr, {}, common + accepts + "\r\n"},
-      {"HEAD", nullptr, {}, common + accepts + "\r\n"},
+      {"GET", nullptr, {}, usual + "\r\n"},
+      {"GET", nullptr, odd, usual + "X-Empty:\r\nX-Blank:\r\nUser-Agent: a b\r\nX: 1\r\nX: 2\r\n\r\n"},
+      {"GET", nullptr, {{"Accept", "text/json"}}, host + encodings + "Accept: text/json\r\n\r\n"},
+      {"POST", makeData("body"), {}, usual + "Content-Length: 4\r\n\r\nbody"},
+      {"POST", nullptr, {}, usual + "Content-Length: 0\r\n\r\n"},
+      {"POST", makeData("{}"), json, usual + "Content-Type: application/json\r\nContent-Length: 2\r\n\r\n{}"},
+      {"PUT", makeData("x"), {}, usual + "Content-Length: 1\r\n\r\nx"},
+      {"DELETE", nullptr, {}, usual + "\r\n"},
+      {"HEAD", nullptr, {}, usual + "\r\n"},
   };
   for (const auto& row : rows) {
     HTTPRequest request = this->request("/a/../r?q=%2b+;#f", row.method);

@@ -81,9 +81,13 @@ class HostTransfers : public ::testing::Test {
     session_ = sessions_->backgroundSession(configuration_, listener_);
   }
 
-  Expected<std::int64_t> upload(const std::string& path, const std::string& body, std::string token = "") {
+  HTTPRequest request(const std::string& path) const {
     HTTPRequest request;
     request.url = server_.url(path);
+    return request;
+  }
+  Expected<std::int64_t> upload(const std::string& path, const std::string& body, std::string token = "") {
+    HTTPRequest request = this->request(path);
     request.method = "POST";
     request.headers.add("X-Digest", "abc");
     writeFile(folder_ / "body", body);
@@ -93,9 +97,7 @@ class HostTransfers : public ::testing::Test {
     return identifier;
   }
   void download(const std::string& path) {
-    HTTPRequest request;
-    request.url = server_.url(path);
-    const auto identifier = session_->downloadTask(request, path, 1h);
+    const auto identifier = session_->downloadTask(request(path), path, 1h);
     ASSERT_TRUE(identifier) << identifier.error().description();
     session_->resume(*identifier);
   }
@@ -207,8 +209,6 @@ TEST_F(HostTransfers, AFullDiskRefusesTheNewAndKeepsTheOld) {
   server_.on("/a", LoopbackServer::Reply{"", Then::stall});
   launch();
   ASSERT_TRUE(upload("/a", "first"));
-  HTTPRequest request;
-  request.url = server_.url("/a");
   writeFile(folder_ / "large", std::string(200000, 'x'));
   std::signal(SIGXFSZ, SIG_IGN);
   rlimit unlimited{};
@@ -216,7 +216,7 @@ TEST_F(HostTransfers, AFullDiskRefusesTheNewAndKeepsTheOld) {
   for (const rlim_t room : {100000, 1}) {  // the second is not enough for the database either
     const rlimit full{room, unlimited.rlim_max};
     ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &full), 0);
-    const auto refused = session_->uploadTask(request, folder_ / "large", "", "");
+    const auto refused = session_->uploadTask(request("/a"), folder_ / "large", "", "");
     ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &unlimited), 0);
     EXPECT_FALSE(refused) << room;
   }
