@@ -65,17 +65,6 @@ struct ActivitySchedulerTest : testing::Test {
   }
 };
 
-TEST_F(ActivitySchedulerTest, RunsInTimeThenAnIntervalApart) {
-  add(kEveryTenMinutes);
-  runtime.advance(300s - 1ns);
-  EXPECT_TRUE(runs.empty());
-  runtime.advance(3300s + 1ns);
-  ASSERT_GE(runs.size(), 5u);
-  EXPECT_GE(runs[0], 300s);
-  EXPECT_LE(runs[0], 600s);
-  for (std::size_t i = 1; i < runs.size(); ++i) EXPECT_EQ(runs[i] - runs[i - 1], 600s);
-}
-
 TEST_F(ActivitySchedulerTest, DevicesThatStartTogetherDoNotRunTogether) {
   std::set<Duration> first;
   for (std::uint64_t seed = 1; seed <= 20; ++seed) {
