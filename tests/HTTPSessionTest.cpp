@@ -372,6 +372,41 @@ TEST_F(HostSession, IdleConnectionsAreClosedAndReplaced) {
   EXPECT_EQ(*load(*patient, request("/ok")).data, "x");
 }
 
+TEST(ScriptedSession, LimitsAndCancellingEndATaskOnce) {
+  simulated::SimulatedPlatform platform;
+  simulated::Scripted large, slow;
+  large.body = "12345";
+  slow.latency = std::chrono::seconds(10);
+  platform.httpSessions().service().on("/large", large);
+  platform.httpSessions().service().on("/slow", slow);
+  HTTPSessionConfiguration configuration;
+  configuration.maximumResponseBytes = 4;
+  const auto session = platform.httpSessions().session(configuration);
+  std::vector<HTTPResult> results;
+  const auto start = [&](const char* url) {
+    HTTPRequest request;
+    request.url = url;
+    request.timeout = 10;
+    auto task =
+        session->dataTask(std::move(request), [&](HTTPResult got) { results.push_back(std::move(got)); });
+    task->resume();
+    return task;
+  };
+  start("http://h/slow")->cancel();
+  for (const char* url : {"http://h/large", "http://h/slow", "h/", "ftp://h/"}) {
+    const auto task = start(url);
+    task->resume();
+    platform.runtime().advance(std::chrono::seconds(10));
+    task->cancel();
+    platform.runtime().run();
+  }
+  using enum HTTPErrorCode;
+  std::vector<HTTPErrorCode> codes;
+  for (const HTTPResult& result : results) codes.push_back(HTTPErrorCode{result.error.value().code});
+  EXPECT_EQ(codes, (std::vector{cancelled, responseTooLarge, timedOut, badURL, notAllowed}));
+  EXPECT_EQ(*results[1].data, "1234");
+}
+
 TEST(ServiceProxy, AConfiguredOneCarriesTasks) {
   simulated::SimulatedPlatform platform;
   const auto session = platform.httpSessions().session({});
