@@ -38,6 +38,12 @@ std::size_t lengthOfPlainASCII(std::string_view text) {
   return length;
 }
 
+void writeQuoted(std::string& text, std::string_view plain) {
+  const std::size_t start = text.size() + 1;
+  text.append(plain.size() + 2, '"');
+  plain.copy(&text[start], plain.size());
+}
+
 void writeEscape(std::string& text, char c) {
   constexpr std::string_view kEscaped = "\"\\\b\f\n\r\t", kLetters = "\"\\bfnrt";
   if (const auto at = kEscaped.find(c); at != kEscaped.npos) {
@@ -60,7 +66,8 @@ void JSONPlace::operator=(double value) {
 
 void JSONPlace::operator=(std::string_view value) {
   const std::size_t ascii = lengthOfPlainASCII(value);
-  if (ascii < value.size() && !simdjson::validate_utf8(value)) return *this = Dictionary(value);
+  if (ascii == value.size()) return writeQuoted(text_, value);
+  if (!simdjson::validate_utf8(value)) return *this = Dictionary(value);
   text_ += '"';
   text_ += value.substr(0, ascii);
   value.remove_prefix(ascii);
