@@ -1,13 +1,9 @@
 #include <gtest/gtest.h>
 
-#include "SableKit/SBLBag.h"
 #include "SableKit/SBLConstants.h"
 #include "SableKit/SBLRelayCoding.h"
 #include "SableKit/SBLRelayInterfaces.h"
-#include "platform/PropertyList.h"
-#include "sabled/ClientState.h"
 #include "sabled/ClientStateManager.h"
-#include "sabled/SableBagController.h"
 #include "sabled/SableService.h"
 #include "tests/support/VirtualDevice.h"
 
@@ -16,15 +12,7 @@ namespace sable::test {
 namespace {
 
 using platform::HTTPErrorCode;
-using platform::HTTPRequest;
 using platform::simulated::Scripted;
-
-SBLSearchRequest searchFor(std::string text, std::uint64_t queryId) {
-  SBLSearchRequest request;
-  request.queryId = queryId;
-  request.queryString = std::move(text);
-  return request;
-}
 
 class Daemon : public testing::Test {
  protected:
@@ -41,10 +29,10 @@ TEST_F(Daemon, AClientIsConfiguredAndGetsTheBag) {
   EXPECT_EQ(client.bags()[0].raw["version"], "1");
   EXPECT_EQ(client.bags()[0].userAgent, "Sabled/1.0 (SableBook1,1; Sable OS 1A1) Beacon/1");
   EXPECT_FALSE(client.bags()[0].error);
+  VirtualClient& composed = device.client("com.kestrel.rover", "Sabled/1.0 (X; Y 1) Rover/2");
+  EXPECT_EQ(composed.bags().at(0).userAgent, "Sabled/1.0 (X; Y 1) Rover/2") << "not composed again";
 
-  device.bag["version"] = "2";
-  device.assembly().bagController->forceFetchBag({{"bag", 2}});
-  device.advance(1s);
+  device.publishBag();
   ASSERT_EQ(client.bags().size(), 2u) << "a new bag is pushed to whoever is there";
   EXPECT_EQ(client.bags()[1].raw["version"], "2");
 }
@@ -72,9 +60,8 @@ TEST_F(Daemon, AClientThatRefusesItsBagIsToldOfInTheLogAndOneThatNeverAnswersIsN
     call.reply.forget();
   });
   configure(*silent);
-  device.bag["version"] = "2";
-  device.assembly().bagController->forceFetchBag({{"bag", 2}});
-  device.advance(61s);
+  device.publishBag();
+  device.advance(60s);
   EXPECT_EQ(bags, 2) << "waiting for one answer keeps no bag back";
   EXPECT_EQ(device.log.count("remote proxy error"), 2u) << "again the first client's";
 }
@@ -89,12 +76,6 @@ TEST_F(Daemon, AFailedConfigurationClosesTheConnectionWithoutAnAnswer) {
   EXPECT_EQ(device.log.count("invalid configuration, closing connection"), 2u);
   EXPECT_EQ(device.log.count("configuration requires identifier and agent"), 1u);
   EXPECT_TRUE(device.daemon().service().getClientConnections().empty());
-}
-
-TEST_F(Daemon, AnAgentThatIsAlreadyComposedIsNotComposedAgain) {
-  device.start();
-  VirtualClient& client = device.client("com.kestrel.rover", "Sabled/1.0 (X; Y 1) Rover/2");
-  EXPECT_EQ(client.bags().at(0).userAgent, "Sabled/1.0 (X; Y 1) Rover/2");
 }
 
 TEST_F(Daemon, ASilentConnectionIsClosedAfterSixtySecondsAndACallPostponesThat) {
@@ -170,27 +151,6 @@ TEST_F(Daemon, TheEleventhEndpointConnectionIsRefusedUntilAPlaceIsFree) {
 
 // The road of a query
 
-TEST_F(Daemon, ASearchIsAnsweredWithTheServicesBytes) {
-  device.platform.mapsService().sessions = {{"id-1", "entity-1"}};
-  device.start();
-  SBLSearchRequest request = searchFor("wea", 1);
-  request.scale = 3;
-  request.verboseReply = true;
-  const Answer answer = device.client().ask(request);
-  EXPECT_EQ(answer.queryId, 1u);
-  ASSERT_TRUE(answer.reply);
-  EXPECT_FALSE(answer.error);
-  EXPECT_EQ(answer.data(), R"([{"query":"weather","completion_score":0.5,"status":"OK"}])");
-  EXPECT_EQ(answer.reply->scale, 3);
-  EXPECT_EQ(answer.reply->geoSessionEntityString, "entity-1");
-  EXPECT_EQ(answer.reply->httpResponse->status, 200);
-  EXPECT_NE(answer.reply->httpRequest->url.find("q=wea"), std::string::npos);
-  EXPECT_EQ(*answer.reply->httpRequest->headers.find("X-Kestrel-UI-Scale"), "3.0");
-  EXPECT_EQ(device.counter("searches"), 1);
-  EXPECT_EQ(device.counter("beacon.keystrokes"), 1);
-  EXPECT_EQ(device.counter("beacon.fedapicall.serverstatus.200"), 1);
-}
-
 TEST_F(Daemon, TheGatesAnswerWithNothing) {
   device.bag["minimum_query_length"] = 3;
   device.bag["agents"] = {{"rover", {{"enabled", false}}}};
@@ -260,28 +220,7 @@ TEST_F(Daemon, OnlyTheNewestSearchIsAnsweredWithResults) {
   EXPECT_EQ(device.sent("/search"), 2u) << "stale searches do not reach the service";
 }
 
-TEST_F(Daemon, WhateverTheServiceSaysReachesTheClient) {
-  device.start();
-  VirtualClient& client = device.client();
-  device.service.on("/search", answering("<html>no</html>", 503));
-  const Answer html = client.search("wea");
-  EXPECT_EQ(html.data(), "<html>no</html>");
-  ASSERT_TRUE(html.error);
-  EXPECT_EQ(html.error->domain, "JSONErrorDomain");
-  EXPECT_EQ(device.counter("beacon.fedapicall.serverstatus.503"), 1);
-
-  device.service.on("/search", answering("[]", 418));
-  EXPECT_FALSE(client.search("weat").error);
-
-  device.service.failNext(1, HTTPErrorCode::connectionLost);
-  const Answer broken = client.search("weath");
-  EXPECT_FALSE(broken.reply);
-  ASSERT_TRUE(broken.error);
-  EXPECT_EQ(broken.error->domain, platform::kHTTPErrorDomain);
-  EXPECT_EQ(device.sent("/search"), 3u) << "a search is sent once";
-}
-
-TEST_F(Daemon, LookupsAreTriedAgainUntilTheirPageNoLongerWaits) {
+TEST_F(Daemon, LookupsAreTriedAgainUntilTheirPageNoLongerWaitsAndSearchesAreNot) {
   device.start();
   VirtualClient& client = device.client();
   device.service.failNext(2, HTTPErrorCode::cannotConnect);
@@ -294,6 +233,13 @@ TEST_F(Daemon, LookupsAreTriedAgainUntilTheirPageNoLongerWaits) {
   device.service.on("/search", slow);
   EXPECT_TRUE(client.ask(SBLLookupRequest{}).error);
   EXPECT_EQ(device.sent("/search"), 4u) << "after the deadline nothing is sent again";
+
+  slow.error = HTTPErrorCode::connectionLost;
+  device.service.on("/search", slow);
+  const Answer broken = client.search("weath");
+  EXPECT_FALSE(broken.reply);
+  EXPECT_EQ(broken.error->domain, platform::kHTTPErrorDomain);
+  EXPECT_EQ(device.sent("/search"), 5u);
 }
 
 TEST_F(Daemon, MoreResultsAndCardsAreServedOnTheEndpointAndNothingElseIs) {
@@ -327,42 +273,17 @@ TEST_F(Daemon, MoreResultsAndCardsAreServedOnTheEndpointAndNothingElseIs) {
 TEST_F(Daemon, AMessagesClientNeverGoesThroughThePrivacyProxy) {
   device.bag["bramble"] = {{"proxy", "http://proxy.test:8080"}, {"enabled", true}};
   device.start();
+  const auto sent = [&] { return device.service.requests("/search").back(); };
   device.client("com.kestrel.messages", "Messages/1").search("wea");
-  EXPECT_EQ(device.service.requests("/search").back().proxyURL, "");
-  EXPECT_FALSE(device.service.requests("/search").back().request.proxied);
-  device.client("com.kestrel.beacon", "Beacon/1").search("wea");
-  EXPECT_EQ(device.service.requests("/search").back().proxyURL, "http://proxy.test:8080");
-  device.client("com.kestrel.beacon", "Beacon/1").ask(SBLZeroKeywordRequest{});
-  EXPECT_EQ(device.service.requests("/search").back().proxyURL, "")
-      << "zero keyword says nothing worth hiding";
+  EXPECT_EQ(sent().proxyURL, "");
+  EXPECT_FALSE(sent().request.proxied);
+  device.client().search("wea");
+  EXPECT_EQ(sent().proxyURL, "http://proxy.test:8080");
+  device.client().ask(SBLZeroKeywordRequest{});
+  EXPECT_EQ(sent().proxyURL, "") << "zero keyword says nothing worth hiding";
   device.platform.userDefaults().setByUser("SBLUseBramble", false);
   device.client("com.kestrel.vox", "Vox/1").search("wea");
-  EXPECT_EQ(device.service.requests("/search").back().proxyURL, "");
-}
-
-TEST_F(Daemon, AConnectionIsWarmedAtMostOnceInThirtySeconds) {
-  device.start();
-  const auto state = device.assembly().clientStateManager->stateForClientIdentifier("com.kestrel.beacon");
-  state->warm();
-  state->warm();
-  device.advance(29s);
-  state->warm();
-  EXPECT_EQ(device.sent("/warm"), 1u);
-  device.advance(2s);
-  state->warm();
-  EXPECT_EQ(device.sent("/warm"), 2u);
-}
-
-TEST_F(Daemon, AnswersVouchForTheHostsOfTheirImages) {
-  device.bag["image_urls"] = {{"logo", "https://bag.test/logo.png"}};
-  device.start();
-  device.service.on("/search",
-                    answering(R"([{"query": "q", "results": [{"image": {"url": "https://a.test/1"}},
-      {"images": [{"id": "logo"}, {"url": "nonsense"}]}]}])"));
-  device.client().search("wea");
-  device.run();
-  EXPECT_EQ(device.assembly().clientStateManager->validImageHosts(),
-            (std::set<std::string>{"a.test", "bag.test"}));
+  EXPECT_EQ(sent().proxyURL, "");
 }
 
 }  // namespace

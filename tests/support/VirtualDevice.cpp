@@ -5,6 +5,7 @@
 #include "SableKit/SBLConstants.h"
 #include "SableKit/SBLRelayCoding.h"
 #include "SableKit/SBLRelayInterfaces.h"
+#include "sabled/SableBagController.h"
 
 namespace sable::test {
 
@@ -21,22 +22,28 @@ Scripted answering(std::string body, int status) {
   return answer;
 }
 
+SBLSearchRequest searchFor(std::string text, std::uint64_t queryId) {
+  SBLSearchRequest request;
+  request.queryId = queryId;
+  request.queryString = std::move(text);
+  return request;
+}
+
+std::string sentValue(const HTTPRequest& request, std::string_view name) {
+  if (const std::string* header = request.headers.find(name)) return *header;
+  for (const auto& item : platform::URL::parse(request.url)->queryItems()) {
+    if (item.name == name) return item.value.value_or("");
+  }
+  return "-";
+}
+
 namespace {
 
 constexpr platform::Duration kPatience = 30s;
 
-std::string queryOf(const HTTPRequest& request) {
-  const auto url = platform::URL::parse(request.url);
-  for (const auto& item : url->queryItems()) {
-    if (item.name == "q") return item.value.value_or("");
-  }
-  return {};
-}
-
 Scripted completing(const HTTPRequest& request) {
-  const std::string query = queryOf(request);
-  return answering(
-      json::array({{{"query", query + "ther"}, {"completion_score", 0.5}, {"status", "OK"}}}).dump());
+  const std::string query = sentValue(request, "q") + "ther";
+  return answering(json::array({{{"query", query}, {"completion_score", 0.5}, {"status", "OK"}}}).dump());
 }
 
 }  // namespace
@@ -88,10 +95,7 @@ Answer VirtualClient::ask(SBLAnyRequest request) {
 }
 
 Answer VirtualClient::search(std::string text) {
-  SBLSearchRequest request;
-  request.queryId = ++queryId_;
-  request.queryString = std::move(text);
-  return ask(std::move(request));
+  return ask(searchFor(std::move(text), ++queryId_));
 }
 
 VirtualDevice::VirtualDevice(std::uint64_t seed) : platform(seed) {
@@ -118,6 +122,13 @@ void VirtualDevice::start() {
   if (const auto started = daemon_->start(); !started)
     throw std::runtime_error(started.error().description());
   advance(200ms);
+}
+
+void VirtualDevice::publishBag() {
+  const int version = std::stoi(bag["version"].get<std::string>()) + 1;
+  bag["version"] = std::to_string(version);
+  assembly().bagController->forceFetchBag({{"bag", version}});
+  advance(1s);
 }
 
 void VirtualDevice::killDaemon() {

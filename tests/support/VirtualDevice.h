@@ -25,6 +25,9 @@ class VirtualDevice;
 
 /// An answer for the scripted service to give.
 platform::simulated::Scripted answering(std::string body, int status = 200);
+SBLSearchRequest searchFor(std::string text, std::uint64_t queryId = 1);
+/// What a request says in the header or the query item of a name; "-" without it.
+std::string sentValue(const platform::HTTPRequest& request, std::string_view name);
 
 /// Holds an answer from the moment it is there.
 using PendingAnswer = std::shared_ptr<std::optional<Answer>>;
@@ -90,6 +93,8 @@ class VirtualDevice {
   platform::simulated::ScriptedService& service = platform.httpSessions().service();
   /// What /bag answers; change it at any time.
   json bag;
+  /// Gives the bag the next version, and has the daemon fetch it.
+  void publishBag();
 
   SableDaemon& daemon() { return *daemon_; }
   Assembly& assembly() { return daemon_->assembly(); }
