@@ -158,6 +158,10 @@ TEST_F(Images, AreKeyedByURLOrElseByIdentifier) {
   EXPECT_TRUE(device.log.contains("mapping image url http://img.test/1 to 26 bytes of data"));
   EXPECT_TRUE(device.log.contains("mapping image id logo to 30 bytes of data"));
   EXPECT_EQ(device.sent("/far"), 0u) << "the bag alone vouches for nobody";
+  device.service.on("/search", answering(R"([{"results": [{"images": [{"id": "far"}, {"url": "no"}]}]}])"));
+  device.client().search("far");
+  device.run();
+  EXPECT_THAT(load({{std::nullopt, "far"}}), ElementsAre(Pair("far", "bytes of https://far.test/far")));
 
   EXPECT_THAT(load({{"http://img.test/1", "logo"}}), ElementsAre(Pair("http://img.test/1", testing::_)));
   EXPECT_THAT(load({}), IsEmpty());
@@ -373,7 +377,6 @@ TEST_F(Images, AClientThatLeavesWhileItWaitsFreesItsPlace) {
   startVouchingFor({"img.test"});
   device.service.on("/silent", after(1h, answering("")));
   for (int round = 0; round < 3; ++round) {
-    std::vector<std::shared_ptr<SBLClient>> clients;
     std::vector<std::shared_ptr<platform::RelayConnection>> open;
     const auto endpoint = *device.client().endpoint();
     for (int i = 0; i < 10; ++i) {

@@ -7,8 +7,6 @@
 #include "sabled/ClientStateManager.h"
 #include "sabled/QueryCache.h"
 #include "sabled/QueryCacheDecision.h"
-#include "sabled/SableBagController.h"
-#include "sabled/SableUserGUIDController.h"
 #include "tests/support/VirtualDevice.h"
 
 // The query cache by itself, and how searches of the whole daemon are answered from it.
@@ -19,14 +17,6 @@ using platform::LogLevel;
 
 std::string sets(std::initializer_list<json> list) {
   return json(list).dump();
-}
-
-SBLSearchRequest searchFor(std::string text, double scale = 0, std::uint64_t queryId = 1) {
-  SBLSearchRequest request;
-  request.queryId = queryId;
-  request.queryString = std::move(text);
-  request.scale = scale;
-  return request;
 }
 
 class QueryCaching : public testing::Test {
@@ -51,8 +41,10 @@ class QueryCaching : public testing::Test {
     platform.runtime().run();
   }
   /// The query of the entry that answers; "" when none does.
-  std::string answer(std::string text, double scale = 0) {
-    const auto found = cache.getRequest(searchFor(std::move(text), scale));
+  std::string answer(std::string text, double scale = 0, QueryCacheDecision* decision = nullptr) {
+    SBLSearchRequest request = searchFor(std::move(text));
+    request.scale = scale;
+    const auto found = cache.getRequest(request, decision);
     return found == nullptr ? "" : found->query;
   }
   void raiseMemoryPressure() {
@@ -60,6 +52,7 @@ class QueryCaching : public testing::Test {
     platform.runtime().run();
   }
 
+  static constexpr std::size_t kHalf = 1'048'576 - 1024;  ///< of the cache's budget, in bytes
   platform::simulated::SimulatedLog log;
   platform::simulated::SimulatedPlatform platform;
   Assembly assembly{platform};
@@ -89,49 +82,36 @@ TEST_F(QueryCaching, TheChoiceFollowsItsRules) {
   struct Case {
     const char* says;
     std::vector<Given> entries;
-    SBLSearchRequest request;
     std::string chosen;
     std::vector<std::string_view> outcomes;
+    double scale = 0;
   };
   const std::vector<Case> cases = {
       {"the shorter completion, whatever the scores",
        {{"we", "weather", 0.1}, {"we", "weather radar", 0.9}},
-       searchFor("wea"),
        "weather",
        {"chosen", "longer completion"}},
       {"of equal lengths the higher score",
        {{"we", "weather", 0.5}, {"we", "wealthy", 0.9}, {"we", "weasels", 0.9}},
-       searchFor("wea"),
        "wealthy",
        {"chosen", "no higher score", "no higher score"}},
       {"which may come last",
        {{"we", "wealthy", 0.5}, {"we", "weather", 0.9}, {"we", "wear it out", 1}},
-       searchFor("wea"),
        "weather",
        {"no higher score", "longer completion", "chosen"}},
       {"no score above 0: the first",
        {{"we", "weather", 0}, {"we", "wealthy", -1}},
-       searchFor("wea"),
        "wealthy",
        {"chosen", "no higher score"}},
       {"the scale that is asked for",
        {{"we", "wealthy", 0, 0, "3.0"}, {"we", "weather", 0, 0, "2.0"}, {"we", "weaving", 0}},
-       searchFor("wea", 2),
        "weather",
-       {"other scale", "chosen", "other scale"}},
-      {"any scale where none is given",
-       {{"we", "weather", 0, 0, "2.0"}},
-       searchFor("wea", 0),
-       "weather",
-       {"chosen"}},
-      {"no scale that a float cannot hold",
-       {{"we", "weather", 0, 0, "2.0"}},
-       searchFor("wea", 1e300),
-       "",
-       {"other scale"}},
+       {"other scale", "chosen", "other scale"},
+       2},
+      {"any scale where none is given", {{"we", "weather", 0, 0, "2.0"}}, "weather", {"chosen"}},
+      {"no scale that a float cannot hold", {{"we", "weather", 0, 0, "2.0"}}, "", {"other scale"}, 1e300},
       {"nothing that is out of date or made for more",
        {{"we", "wealthy", 0, -1}, {"weat", "weather"}},
-       searchFor("wea"),
        "",
        {"expired", "input longer"}},
   };
@@ -140,13 +120,11 @@ TEST_F(QueryCaching, TheChoiceFollowsItsRules) {
     for (const Given& given : row.entries) cache.set(entry(given));
     platform.runtime().run();
     QueryCacheDecision decision;
-    const auto found = cache.getRequest(row.request, &decision);
-    EXPECT_EQ(found == nullptr ? "" : found->query, row.chosen) << row.says;
+    EXPECT_EQ(answer("wea", row.scale, &decision), row.chosen) << row.says;
     std::vector<std::string_view> outcomes;
     for (const auto& [candidate, outcome] : decision.rows) outcomes.push_back(queryCacheOutcomeText(outcome));
     EXPECT_EQ(outcomes, row.outcomes) << row.says;
-    EXPECT_EQ(answer(row.request.queryString, row.request.scale), row.chosen)
-        << "the same without asking why";
+    EXPECT_EQ(answer("wea", row.scale), row.chosen) << "the same without asking why";
   }
   EXPECT_TRUE(log.contains("prefix: wealthy input: we score: 0.900000"));
   EXPECT_FALSE(log.contains("prefix: wear it out")) << "only those of the best length are candidates";
@@ -181,7 +159,6 @@ TEST_F(QueryCaching, WhatIsNoEntryIsNotKept) {
 }
 
 TEST_F(QueryCaching, AFullCacheIsFlushedWhole) {
-  constexpr std::size_t kHalf = 1'048'576 - 1024;
   keep({{"a", "aa", 0, 0, "", kHalf}, {"b", "bb", 0, 0, "", kHalf - 1}});
   EXPECT_EQ(cache.count(), 2u) << "one byte below the budget";
   EXPECT_FALSE(log.contains("!!! exceeded max cost, flushing cache !!!"));
@@ -199,7 +176,6 @@ TEST_F(QueryCaching, AFullCacheIsFlushedWhole) {
 }
 
 TEST_F(QueryCaching, ExpiredEntriesStayChargedButAnEmptyCacheListensToNothing) {
-  constexpr std::size_t kHalf = 1'048'576 - 1024;
   keep({{"a", "aa", 0, 1, "", kHalf}});
   platform.runtime().advance(2s);
   EXPECT_EQ(answer("a"), "");
@@ -244,7 +220,7 @@ TEST_F(QueryCaching, ACacheMayGoWhileWorkIsOnItsWay) {
   auto other = std::make_unique<QueryCache>(assembly);
   other->set(entry({"we", "weather"}));
   platform.runtime().run();
-  platform.notificationCenter().post({kSBLUserGUIDChangeNotification, nullptr, {}});
+  platform.notificationCenter().post({"SBLUserGUIDChangeNotification", nullptr, {}});
   platform.memoryPressure().fireCritical();
   other->set(entry({"wi", "wind"}));
   other.reset();
@@ -273,7 +249,8 @@ TEST_F(CachedSearches, TypingAQueryAsksTheServiceOnce) {
   VirtualClient& client = device.client();
   const std::string text = "weather oslo";
   for (std::size_t length = 1; length <= text.size(); ++length) {
-    SBLSearchRequest request = searchFor(text.substr(0, length), 2, length);
+    SBLSearchRequest request = searchFor(text.substr(0, length), length);
+    request.scale = 2;
     request.verboseReply = true;
     const auto start = device.platform.runtime().ticks();
     const Answer answer = client.ask(request);
@@ -284,6 +261,7 @@ TEST_F(CachedSearches, TypingAQueryAsksTheServiceOnce) {
     EXPECT_EQ(answer.reply->httpRequest.has_value(), first);
     EXPECT_EQ(answer.reply->httpResponse.has_value(), first);
     EXPECT_EQ(device.platform.runtime().ticks() - start, first ? 80ms : 0ms) << length;
+    EXPECT_EQ(answer.queryId, length);
   }
   EXPECT_EQ(device.sent("/search"), 1u);
   EXPECT_EQ(device.counter("searches"), 1);
@@ -291,20 +269,23 @@ TEST_F(CachedSearches, TypingAQueryAsksTheServiceOnce) {
   EXPECT_EQ(device.counter("beacon.keystrokes"), 12);
   EXPECT_TRUE(device.log.contains("query cache ON for com.kestrel.beacon"));
 
-  client.ask(searchFor("weather o", 3, 20));
+  SBLSearchRequest larger = searchFor("weather o", 20);
+  larger.scale = 3;
+  EXPECT_EQ(client.ask(larger).reply->scale, 3);
+  EXPECT_EQ(sentValue(device.service.requests("/search").back().request, "X-Kestrel-UI-Scale"), "3.0");
   EXPECT_EQ(device.sent("/search"), 2u) << "on a screen of another scale";
 }
 
 TEST_F(CachedSearches, ForcedQueryItemsGoToTheServiceAndTheirAnswersAreKept) {
   device.start();
   VirtualClient& client = device.client();
-  SBLSearchRequest forced = searchFor("wea", 0, 1);
+  SBLSearchRequest forced = searchFor("wea", 1);
   forced.queryItems = {{"debug", "1"}};
   client.ask(forced);
   forced.queryId = 2;
   client.ask(forced);
   EXPECT_EQ(device.sent("/search"), 2u);
-  client.ask(searchFor("weath", 0, 3));
+  client.ask(searchFor("weath", 3));
   EXPECT_EQ(device.sent("/search"), 2u);
   EXPECT_EQ(hits(), 1u);
 }
@@ -344,9 +325,7 @@ TEST_F(CachedSearches, GatesStandBeforeTheCache) {
   VirtualClient& client = device.client();
   client.search("we");
   device.bag["enabled"] = false;
-  device.bag["version"] = "2";
-  device.assembly().bagController->forceFetchBag({{"bag", 2}});
-  device.advance(1s);
+  device.publishBag();
   EXPECT_FALSE(client.search("weth").reply);
   EXPECT_EQ(cacheOf("com.kestrel.beacon").count(), 1u);
   EXPECT_EQ(hits(), 0u);
@@ -360,26 +339,6 @@ TEST_F(CachedSearches, AnotherUserAgentEmptiesTheCacheAndTheSameOneKeepsIt) {
   device.client("com.kestrel.beacon", "Beacon/2").search("weth");
   EXPECT_EQ(device.sent("/search"), 2u);
   EXPECT_EQ(cacheOf("com.kestrel.beacon").count(), 1u);
-}
-
-TEST_F(CachedSearches, ANewUserGUIDEmptiesEveryCache) {
-  device.start();
-  device.client("com.kestrel.beacon").search("we");
-  device.client("com.kestrel.rover").search("we");
-  device.assembly().guidController->reset();
-  device.run();
-  EXPECT_EQ(cacheOf("com.kestrel.beacon").count(), 0u);
-  EXPECT_EQ(cacheOf("com.kestrel.rover").count(), 0u);
-}
-
-TEST_F(CachedSearches, ASettingTurnsItOff) {
-  device.platform.userDefaults().setByUser("SBLNoQueryCache", true);
-  device.start();
-  VirtualClient& client = device.client();
-  client.search("we");
-  client.search("wet");
-  EXPECT_EQ(device.sent("/search"), 2u);
-  EXPECT_TRUE(device.log.contains("query cache OFF for com.kestrel.beacon"));
 }
 
 }  // namespace
