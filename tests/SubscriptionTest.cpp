@@ -2,7 +2,6 @@
 
 #include "platform/host/HostSubscriptionRegistry.h"
 #include "sabled/SBLNetworkRequestFactory.h"
-#include "sabled/SableBagController.h"
 #include "tests/support/ManualReactor.h"
 #include "tests/support/TemporaryFolder.h"
 #include "tests/support/VirtualDevice.h"
@@ -29,21 +28,14 @@ struct SubscriptionTest : testing::Test {
     device.advance(2s);
   }
   void changeBag() {
-    device.bag["version"] = std::to_string(std::stoi(device.bag["version"].get<std::string>()) + 1);
-    device.assembly().bagController->forceFetchBag(
-        {{"bag", std::stoi(device.bag["version"].get<std::string>())}});
-    device.advance(2s);
+    device.publishBag();
+    device.advance(1s);
   }
-  /// What a search says: a header's or a query item's value, "-" without it.
+  /// What a search says.
   std::string told(std::string_view name = "X-Kestrel-Subscriptions") {
     device.advance(2s);
     client->search("q" + std::to_string(++searches));
-    const platform::HTTPRequest request = device.service.requests("/search").back().request;
-    if (const std::string* header = request.headers.find(name)) return *header;
-    for (const auto& item : platform::URL::parse(request.url)->queryItems()) {
-      if (item.name == name) return item.value.value_or("");
-    }
-    return "-";
+    return sentValue(device.service.requests("/search").back().request, name);
   }
   Subscription subscription(std::string provider, platform::Duration age, std::string domain = "") {
     return {std::move(provider), std::move(domain), "premium", device.platform.runtime().now() - age};
