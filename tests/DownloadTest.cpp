@@ -13,7 +13,6 @@
 #include "sabled/DownloadManager.h"
 #include "sabled/FileContainer.h"
 #include "sabled/SBLNetworkRequestFactory.h"
-#include "sabled/SableBagController.h"
 #include "sabled/SablePersistentStorage.h"
 #include "tests/support/VirtualDevice.h"
 
@@ -31,6 +30,7 @@ using Strings = std::vector<std::string>;
 
 constexpr const char* kNotes = "https://service.test/resources/notes?version=3";
 constexpr const char* kWeekly = "lookup_hints_weekly";
+const json kBoth{{"notes", kNotes}, {"other", "https://service.test/resources/other?version=2"}};
 
 class Downloads : public testing::Test {
  protected:
@@ -49,14 +49,9 @@ class Downloads : public testing::Test {
       device.bag[identifier] = url;
     }
   }
-  void newBag() {
-    device.bag["version"] = std::to_string(++version);
-    device.assembly().bagController->forceFetchBag({{"bag", version}});
-    device.advance(1s);
-  }
   void newBag(const json& resources) {
     offer(resources);
-    newBag();
+    device.publishBag();
   }
   void startAndWatch() {
     device.start();
@@ -84,15 +79,18 @@ class Downloads : public testing::Test {
     reports();
   }
 
+  /// From now on files are "late", and half a minute on their way.
+  void answerSlowly() {
+    Scripted slow = answering("late");
+    slow.latency = 30s;
+    device.service.on("/resources", slow);
+  }
+
   static std::filesystem::path path(const std::string& identifier) {
     return "/home/user/.cache/com.kestrel.sabled/" + identifier;
   }
   std::string file(const std::string& identifier) {
     return device.platform.fileManager().read(path(identifier), 1000).value_or("(none)");
-  }
-  static std::string header(const RecordedRequest& request, std::string_view name) {
-    const std::string* value = request.request.headers.find(name);
-    return value == nullptr ? "(none)" : *value;
   }
   std::vector<RecordedRequest> requests() { return device.service.requests("/resources"); }
   /// "identifier reason: reason" of each download that began.
@@ -147,7 +145,6 @@ class Downloads : public testing::Test {
   }
 
   VirtualDevice device;
-  int version = 1;
   Strings posted;
   std::vector<platform::NotificationCenter::Token> observations;
 };
@@ -159,10 +156,10 @@ TEST_F(Downloads, ANewResourceComesAMinuteAfterItsBag) {
   EXPECT_EQ(described()[0]["state"], "delayed");
   device.advance(2s);
   ASSERT_EQ(requests().size(), 1u);
-  const auto request = requests()[0];
-  EXPECT_EQ(request.request.url, "https://service.test/resources/notes?key=tandem4371&version=3");
-  EXPECT_EQ(header(request, "X-Kestrel-Download-Identifier"), "notes");
-  EXPECT_EQ(header(request, "If-None-Match"), "(none)") << "there is none to compare with";
+  const auto request = requests()[0].request;
+  EXPECT_EQ(request.url, "https://service.test/resources/notes?key=tandem4371&version=3");
+  EXPECT_EQ(sentValue(request, "X-Kestrel-Download-Identifier"), "notes");
+  EXPECT_EQ(sentValue(request, "If-None-Match"), "-") << "there is none to compare with";
   EXPECT_THAT(begun(), ElementsAre("notes reason: update"));
   EXPECT_EQ(file("notes"), "text");
   EXPECT_THAT(posted, ElementsAre("completed notes " + path("notes").string()));
@@ -181,21 +178,21 @@ TEST_F(Downloads, ABagDecidesByUrlAndFileWhatIsFetched) {
     bool lose;
     Strings begun;
   };
-  const std::string file = "https://service.test/resources/notes";
+  const std::string url = "https://service.test/resources/notes";
   startWithFiles();
   for (const Row& row :
-       {Row{"the same", kNotes, false, {}}, Row{"another API key", file + "?key=other&version=3", false, {}},
+       {Row{"the same", kNotes, false, {}}, Row{"another API key", url + "?key=other&version=3", false, {}},
         Row{"the same without its file", kNotes, true, {"notes reason: missing"}},
-        Row{"another version", file + "?version=4", false, {"notes reason: update"}},
-        Row{"an item more", file + "?version=4&a=b%2Fc", false, {"notes reason: update"}},
-        Row{"in another order", file + "?a=b/c&version=4", false, {}}}) {
+        Row{"another version", url + "?version=4", false, {"notes reason: update"}},
+        Row{"an item more", url + "?version=4&a=b%2Fc", false, {"notes reason: update"}},
+        Row{"in another order", url + "?a=b/c&version=4", false, {}}}) {
     forget();
     EXPECT_EQ(row.lose && !device.platform.fileManager().remove(path("notes")), false);
     newBag({{"notes", row.url}});
     device.advance(70s);
     EXPECT_EQ(begun(), row.begun) << row.what;
     EXPECT_EQ(requests().size(), row.begun.size()) << row.what;
-    EXPECT_EQ(Downloads::file("notes"), "text") << row.what;
+    EXPECT_EQ(file("notes"), "text") << row.what;
   }
 }
 
@@ -205,7 +202,7 @@ TEST_F(Downloads, TheServiceHearsWhichVersionIsHeldAndMayLeaveItAtThat) {
   newBag({{"notes", "https://service.test/resources/notes?version=4"}});
   device.advance(70s);
   ASSERT_EQ(requests().size(), 1u);
-  EXPECT_EQ(header(requests()[0], "If-None-Match"), "3");
+  EXPECT_EQ(sentValue(requests()[0].request, "If-None-Match"), "3");
   EXPECT_EQ(file("notes"), "text");
   EXPECT_THAT(posted, IsEmpty());
   EXPECT_THAT(reports(), IsEmpty());
@@ -224,20 +221,14 @@ TEST_F(Downloads, HintsForLookupsAreAskedForWithEveryBagByTheVersionOfTheirRedir
 
   device.service.on("/resources", answering("", 304));
   for (int i = 0; i < 2; ++i) {
-    newBag();
+    device.publishBag();
     device.advance(70s);
     EXPECT_THAT(begun(), ElementsAre(std::string(kWeekly) + " reason: lookup"));
     ASSERT_EQ(requests().size(), 1u);
-    EXPECT_EQ(header(requests()[0], "If-None-Match"), "2026-11-23-7-weekly");
+    EXPECT_EQ(sentValue(requests()[0].request, "If-None-Match"), "2026-11-23-7-weekly");
     EXPECT_EQ(file(kWeekly), "hints");
     forget();
   }
-  device.platform.userDefaults().setShared("com.kestrel.lookup.shared", "LookupSuggestionsDisabled", true);
-  newBag();
-  device.advance(70s);
-  EXPECT_TRUE(device.log.contains(std::string(kWeekly) + " is disabled, not downloading"));
-  EXPECT_THAT(requests(), IsEmpty());
-  EXPECT_EQ(file(kWeekly), "hints");
 }
 
 TEST_F(Downloads, HintsForLookupsAreFetchedAnewWhenSearchesComeFromAnotherTown) {
@@ -254,11 +245,12 @@ TEST_F(Downloads, HintsForLookupsAreFetchedAnewWhenSearchesComeFromAnotherTown) 
   offer({{"notes", kNotes}, {kWeekly, "https://service.test/resources/weekly?version=1"}});
   device.start();
   searchAt(51.5);
-  newBag();
+  device.publishBag();
   device.advance(70s);
   const std::string_view place = "X-Kestrel-FuzzedLatLong";
-  EXPECT_EQ(header(device.service.requests("/resources/weekly").back(), place), "51.500000,0.000000");
-  EXPECT_EQ(header(device.service.requests("/resources/notes").back(), place), "(none)");
+  EXPECT_EQ(sentValue(device.service.requests("/resources/weekly").back().request, place),
+            "51.500000,0.000000");
+  EXPECT_EQ(sentValue(device.service.requests("/resources/notes").back().request, place), "-");
 
   forget();
   searchAt(51.9);
@@ -267,11 +259,11 @@ TEST_F(Downloads, HintsForLookupsAreFetchedAnewWhenSearchesComeFromAnotherTown) 
   EXPECT_FALSE(manager().resourceForKey(kWeekly)) << "56 km away";
   EXPECT_TRUE(manager().resourceForKey("notes"));
   EXPECT_EQ(file(kWeekly), "text");
-  newBag();
+  device.publishBag();
   device.advance(70s);
   ASSERT_EQ(requests().size(), 1u);
-  EXPECT_EQ(header(requests()[0], "If-None-Match"), "(none)");
-  EXPECT_EQ(header(requests()[0], "X-Kestrel-FuzzedLatLong"), "52.000000,0.000000");
+  EXPECT_EQ(sentValue(requests()[0].request, "If-None-Match"), "-");
+  EXPECT_EQ(sentValue(requests()[0].request, "X-Kestrel-FuzzedLatLong"), "52.000000,0.000000");
 }
 
 TEST_F(Downloads, WhatFailsIsReportedOnceAndLeavesTheFileAsItWas) {
@@ -288,7 +280,8 @@ TEST_F(Downloads, WhatFailsIsReportedOnceAndLeavesTheFileAsItWas) {
                          Row{tooLarge, "download error HTTPErrorDomain 8", "download task error"}}) {
     forget();
     device.service.on("/resources", row.answer);
-    newBag({{"notes", "https://service.test/resources/notes?version=" + std::to_string(version)}});
+    newBag({{"notes",
+             "https://service.test/resources/notes?version=" + device.bag["version"].get<std::string>()}});
     device.advance(70s);
     EXPECT_EQ(requests().size(), 1u);
     EXPECT_THAT(reports(), ElementsAre(row.reported));
@@ -313,18 +306,16 @@ TEST_F(Downloads, AFileThatCannotBePutIntoItsPlaceIsLogged) {
 }
 
 TEST_F(Downloads, ANewBagTakesBackWhatTheOldOneAskedFor) {
-  Scripted slow = answering("late");
-  slow.latency = 30s;
-  device.service.on("/resources", slow);
+  answerSlowly();
   startAndWatch();
   device.advance(30s);
-  newBag();
+  device.publishBag();
   device.advance(40s);
   EXPECT_THAT(requests(), IsEmpty()) << "the minute begins anew";
   device.advance(25s);
   EXPECT_EQ(requests().size(), 1u);
   EXPECT_EQ(described()[0]["state"], "in flight");
-  newBag({{"notes", kNotes}, {"other", "https://service.test/resources/other"}});
+  newBag(kBoth);
   EXPECT_TRUE(device.log.contains("canceling https://service.test/resources/notes?key="));
   device.advance(50s);
   EXPECT_EQ(file("notes"), "(none)");
@@ -338,10 +329,8 @@ TEST_F(Downloads, ANewBagTakesBackWhatTheOldOneAskedFor) {
 
 TEST_F(Downloads, AnotherDaemonKnowsWhatIsThereAndFetchesWhatWasUnderWay) {
   startWithFiles();
-  Scripted slow = answering("late");
-  slow.latency = 30s;
-  device.service.on("/resources", slow);
-  newBag({{"notes", kNotes}, {"other", "https://service.test/resources/other?version=2"}});
+  answerSlowly();
+  newBag(kBoth);
   device.advance(65s);
   EXPECT_EQ(requests().size(), 1u);
   forget();
@@ -357,13 +346,12 @@ TEST_F(Downloads, AnotherDaemonKnowsWhatIsThereAndFetchesWhatWasUnderWay) {
 }
 
 TEST_F(Downloads, WhatTheBagDropsIsDeleted) {
-  const json both = {{"notes", kNotes}, {"other", "https://service.test/resources/other?version=2"}};
-  offer(both);
+  offer(kBoth);
   startWithFiles();
   newBag({{"notes", kNotes}});
   EXPECT_EQ(file("other"), "(none)");
   EXPECT_THAT(posted, ElementsAre("deleted other"));
-  newBag(both);
+  newBag(kBoth);
   newBag({{"notes", nullptr}, {"other", "nowhere"}});
   EXPECT_THAT(posted, ElementsAre("deleted other", "deleted notes", "deleted other"));
   EXPECT_EQ(file("notes"), "(none)");
@@ -371,30 +359,19 @@ TEST_F(Downloads, WhatTheBagDropsIsDeleted) {
   device.advance(70s);
   EXPECT_THAT(requests(), IsEmpty()) << "also what was to be fetched";
 
-  newBag(both);
+  newBag(kBoth);
   device.advance(70s);
   device.bag.erase("download_resources_list");
-  newBag();
+  device.publishBag();
   EXPECT_EQ(file("notes"), "text") << "a bag that says nothing about resources costs none";
 }
 
 TEST_F(Downloads, AnIdentifierIsAFileNameOrNothing) {
-  const Strings refused = {"",
-                           ".",
-                           "..",
-                           "../x",
-                           "a/b",
-                           "/etc/passwd",
-                           "bag.plist",
-                           "http",
-                           "session.12",
-                           "flushing.first",
-                           "crowdsourcing.first",
-                           "temporary",
-                           ".hidden",
-                           "a\nb",
-                           std::string("a\0b", 3),
-                           std::string(256, 'n')};
+  Strings refused = {"", ".", "..", "../x", "a/b", "/etc/passwd", "bag.plist", "http"};
+  for (const char* name : {"session.12", "flushing.first", "crowdsourcing.first", "temporary", ".hidden"})
+    refused.emplace_back(name);
+  for (const auto& name : {std::string("a\nb"), std::string("a\0b", 3), std::string(256, 'n')})
+    refused.push_back(name);
   const std::string url = "https://service.test/resources/x";
   json resources = {{std::string(255, 'n'), url}};
   for (const std::string& identifier : refused) resources[identifier] = url;

@@ -312,9 +312,9 @@ TEST_F(Flusher, AKillAtAnyMomentNeitherLosesASessionNorSendsItTwice) {
   }
 }
 
-TEST_F(Flusher, ItsBufferAndItsAddresses) {
+TEST_F(Flusher, WhatItBuffersIsPackedUnlessItIsDropped) {
   start();
-  SableFeedbackFlusher feedbacks(device.assembly(), 1), odd(device.assembly(), 2);
+  SableFeedbackFlusher feedbacks(device.assembly(), 1);
   const auto session = std::make_shared<ClientSession>(device.assembly(), search("a"));
   bool called = false;
   feedbacks.flush(session, [&] { called = true; });
@@ -323,19 +323,13 @@ TEST_F(Flusher, ItsBufferAndItsAddresses) {
   EXPECT_TRUE(called);
   feedbacks.flushSyncFromArray({session});
   EXPECT_EQ(feedbacks.countOfDatabuffer(), 2u);
-  EXPECT_EQ(feedbacks.sessionBuffer()[1], session);
   feedbacks.dropFeedbacks();
   device.run();
-  EXPECT_EQ(feedbacks.countOfDatabuffer(), 0u);
-  EXPECT_TRUE(feedbacks.flushToWireSync(true).empty()) << "no file, no upload";
-  EXPECT_TRUE(files() == std::vector<std::string>{"session"});
-
+  EXPECT_TRUE(feedbacks.flushToWireSync(true).empty());
   feedbacks.flushSyncFromArray({session});
   const auto envelopes = feedbacks.flushToWireSync(true);
   ASSERT_EQ(envelopes.size(), 1u);
   EXPECT_EQ(json::parse(envelopes[0])["agent"], "Beacon/1");
-  EXPECT_TRUE(odd.flushToWireSync(false).empty());
-  EXPECT_TRUE(device.log.contains("Initialize flusher for "));
 
   const auto endpoint = SableFeedbackFlusher::getServerEndpointForFeedback;
   EXPECT_EQ(endpoint("https://service.test/a?b=c&d"), "https://service.test/a?v=2");

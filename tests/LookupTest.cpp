@@ -4,7 +4,6 @@
 #include "platform/WordTokenizer.h"
 #include "sabled/DownloadManager.h"
 #include "sabled/Lookup.h"
-#include "sabled/SableBagController.h"
 #include "tests/support/VirtualDevice.h"
 
 // Lookups of selected text on the virtual device.
@@ -33,16 +32,6 @@ TEST_F(LookupTest, TheSignatureIsTakenFromTheThirdFourthAndSecondPieceOfThePath)
     EXPECT_EQ(Lookup::signatureFromURL(row.url), row.signature) << row.url;
     const auto logged = device.log.count("invalid lookup hints url when processing signature: ") - before;
     EXPECT_EQ(logged, *row.signature == '\0' ? 1u : 0u) << row.url;
-  }
-}
-
-TEST_F(LookupTest, TheUsersSwitchIsReadAnewAtEachCall) {
-  device.start();
-  EXPECT_TRUE(device.assembly().lookup->lookupEnabled());
-  for (const bool disabled : {true, false}) {
-    device.platform.userDefaults().setShared("com.kestrel.lookup.shared", "LookupSuggestionsDisabled",
-                                             disabled);
-    EXPECT_EQ(device.assembly().lookup->lookupEnabled(), !disabled);
   }
 }
 
@@ -230,6 +219,7 @@ TEST_F(LookupFilter, WordsAreTheLanguagesOwn) {
 
 struct LookupHints : LookupTest {
   static constexpr const char* kWeekly = "https://files.test/hints/weekly";
+  static constexpr const char* kWeeklyFile = "/home/user/.cache/com.kestrel.sabled/lookup_hints_weekly";
 
   LookupHints() {
     device.bag["download_resources_list"] = {"lookup_hints_weekly", "lookup_hints_monthly", "other"};
@@ -247,9 +237,7 @@ struct LookupHints : LookupTest {
     device.service.on("/hints/weekly", answer);
   }
   void fetch() {
-    ++version;
-    device.bag["version"] = std::to_string(version);
-    device.assembly().bagController->forceFetchBag({{"bag", version}});
+    device.publishBag();
     device.advance(24h);
   }
   std::string kept(const std::string& name) {
@@ -260,8 +248,6 @@ struct LookupHints : LookupTest {
     device.platform.notificationCenter().post({name, nullptr, std::move(userInfo)});
     device.run();
   }
-
-  int version = 1;
 };
 
 TEST_F(LookupHints, AHintFileIsHandedOverAsItArrivesAndAgainUntilItsVersionIsKnown) {
@@ -320,10 +306,7 @@ TEST_F(LookupHints, AFileThatIsGoneOrCannotBeKeptIsToldOfAndLosesNothing) {
   EXPECT_EQ(device.log.count("failed to push data to data detectors"), 1u);
   EXPECT_EQ(kept("2") + kept("2.signature"), "weekly words 1US-1-en");
 
-  const auto resource = std::ranges::find_if(
-      files.files(), [](const auto& file) { return file.first.filename() == "lookup_hints_weekly"; });
-  ASSERT_NE(resource, files.files().end());
-  ASSERT_TRUE(files.remove(std::filesystem::path(resource->first)));
+  ASSERT_TRUE(files.remove(kWeeklyFile));
   ASSERT_TRUE(files.remove("/state/hints/2.signature"));
   device.restart();
   EXPECT_EQ(device.log.count("reprocess file doesn't exist or there was an error. file: "), 1u);
@@ -331,14 +314,24 @@ TEST_F(LookupHints, AFileThatIsGoneOrCannotBeKeptIsToldOfAndLosesNothing) {
 }
 
 TEST_F(LookupHints, WhileTheUserWantsNoLookupsNoHintsAreFetched) {
-  device.platform.userDefaults().setShared("com.kestrel.lookup.shared", "LookupSuggestionsDisabled", true);
+  const auto disable = [&](bool disabled) {
+    device.platform.userDefaults().setShared("com.kestrel.lookup.shared", "LookupSuggestionsDisabled",
+                                             disabled);
+  };
+  disable(true);
   device.start();
   device.advance(24h);
   EXPECT_EQ(device.sent("/hints") + device.sent("/other"), 1u);
   EXPECT_EQ(kept("2") + kept("3"), "--");
-  device.platform.userDefaults().setShared("com.kestrel.lookup.shared", "LookupSuggestionsDisabled", false);
+  EXPECT_TRUE(device.log.contains("lookup_hints_weekly is disabled, not downloading"));
+  disable(false);
   fetch();
   EXPECT_EQ(kept("2"), "weekly words 1");
+  disable(true);
+  publish("2");
+  fetch();
+  EXPECT_EQ(device.sent("/hints"), 2u);
+  EXPECT_EQ(device.platform.fileManager().files().at(kWeeklyFile), "weekly words 1") << "it stays";
 }
 
 }  // namespace
