@@ -181,22 +181,21 @@ TEST_F(Flusher, OnlyA200CountsAsSentAndNothingElseIsTriedAgain) {
 }
 
 TEST_F(Flusher, WithoutAnEndpointSessionsArePackedAndDropped) {
-  for (const bool enabled : {true, false}) {
-    VirtualDevice other;
-    other.bag["feedback_enabled"] = enabled;
-    if (!enabled) other.bag["feedback_url"] = "https://service.test/feedback";
-    other.start();
-    ClientSession session(other.assembly(), search("a"));
-    session.sessionComplete();
-    other.log.clear();
-    other.assembly().backgroundFlusher->insertFlushActivity(0);
-    other.advance(5s);
-    EXPECT_TRUE(other.log.contains("Server endpoint not set, data can't be sent to server"));
-    EXPECT_TRUE(other.log.contains("flushing to "));
-    EXPECT_TRUE(other.log.contains("File removed "));
-    EXPECT_TRUE(other.platform.httpSessions().pendingTransfers().empty());
-    EXPECT_TRUE(other.assembly().persistentStorage->getAvailableSessionHandles().empty());
-    EXPECT_GE(SBLFeedbackLedger(other.platform.tally().snapshot())[SBLLedgerEntry::unsent], 1);
+  start();
+  for (const bool enabled : {false, true}) {
+    device.bag["feedback_enabled"] = enabled;
+    if (enabled) device.bag.erase("feedback_url");
+    device.publishBag();
+    session({"a"});
+    device.log.clear();
+    const auto unsent = ledger()[SBLLedgerEntry::unsent];
+    flush();
+    EXPECT_TRUE(device.log.contains("Server endpoint not set, data can't be sent to server"));
+    EXPECT_TRUE(device.log.contains("flushing to "));
+    EXPECT_TRUE(device.log.contains("File removed "));
+    EXPECT_TRUE(uploads().empty());
+    EXPECT_THAT(files(), IsEmpty());
+    EXPECT_GE(ledger()[SBLLedgerEntry::unsent], unsent + 1);
   }
 }
 
