@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <map>
 
 #include "tests/support/TemporaryFolder.h"
@@ -10,7 +11,6 @@ namespace sable::test {
 namespace {
 
 using nlohmann::json;
-using Items = std::map<std::string, std::string>;
 
 /// A world whose bag is changed before the daemon starts.
 class ChangingWorld {
@@ -28,19 +28,22 @@ class ChangingWorld {
     writeFile(world_.folder("config") / "facts.toml", facts);
     world_.waitForLog(text, before + 1);
   }
-  /// The items of a new search.
-  Items searched() {
+  /// What a new search says in its items of these names, "-" for nothing.
+  std::string searched(const std::vector<std::string>& names = {"latlng", "geosrc"}) {
     EXPECT_EQ(world_.sablectl({"search", "weather"}).exitCode, 0);
     const json sent = world_.requests("/search", ++searches_).back();
-    Items items;
-    for (const auto& item : sent["items"]) items[item[0]] = item[1];
-    return items;
+    std::string text;
+    for (const auto& name : names) {
+      const auto item =
+          std::ranges::find_if(sent["items"], [&](const json& each) { return each[0] == name; });
+      text += (text.empty() ? "" : " ") + (item == sent["items"].end() ? "-" : (*item)[1].get<std::string>());
+    }
+    return text;
   }
-  /// "latlng geosrc" of a new search.
-  std::string location() {
-    const Items items = searched();
-    const auto found = items.find("latlng");
-    return (found == items.end() ? "-" : found->second) + " " + items.at("geosrc");
+  /// Waits until the reason for having no location is this one, and expects it in the next search.
+  void expectNoLocation(const std::string& reason) {
+    world_.waitForLog("location: " + reason);
+    EXPECT_EQ(searched(), "- " + reason);
   }
   World& world() { return world_; }
 
@@ -67,38 +70,30 @@ std::string facts(std::string_view locale, std::string_view country, std::string
 TEST(ContextProcess, AChangeOfTheDeviceIsInTheNextRequestAndInTheBagsWhereItMatters) {
   constexpr std::string_view kBefore =
       "time_zone = \"Europe/London\"\n[location]\nlatitude = 51.507351\nlongitude = -0.127758\ntype = 4\n";
+  constexpr std::string_view kAfter =
+      "time_zone = \"Europe/Berlin\"\nmanaged_account = true\n"
+      "[location]\nlatitude = 52.52\nlongitude = 13.405\ntype = 1\n";
+  const std::vector<std::string> all{"latlng", "geosrc", "locale", "cc", "time_zone", "mode"};
   ChangingWorld device(kAnySource, facts("en_GB", "GB", kBefore));
   World& world = device.world();
   world.waitForLog("location: wifi");
-  Items sent = device.searched();
-  EXPECT_EQ(sent["latlng"] + " " + sent["geosrc"], "51.500000,-0.100000 wifi");
-  EXPECT_EQ(sent["locale"] + sent["cc"] + sent["time_zone"] + sent["mode"], "en_GBGBEurope/London");
+  EXPECT_EQ(device.searched(all), "51.500000,-0.100000 wifi en_GB GB Europe/London -");
 
   device.change(facts("de_DE", "GB", kBefore), kBagHere);
-  EXPECT_EQ(device.searched()["locale"], "de_DE");  // and by then the bag's fetch is over
+  EXPECT_EQ(device.searched({"locale"}), "de_DE");  // and by then the bag's fetch is over
   device.change(facts("de_DE", "DE", kBefore), kBagHere);
   const auto bags = world.requests("/bag", 3);
   EXPECT_EQ(bags[1]["items"].dump().find("en_GB"), std::string::npos) << bags[1];
   EXPECT_NE(bags[2]["items"].dump().find(R"(["cc","DE"])"), std::string::npos) << bags[2];
 
-  device.change(facts("de_DE", "DE", R"(
-time_zone = "Europe/Berlin"
-managed_account = true
-[location]
-latitude = 52.52
-longitude = 13.405
-type = 1
-)"),
-                "location: gps");
-  sent = device.searched();
-  EXPECT_EQ(sent["latlng"] + " " + sent["geosrc"], "52.500000,13.400000 gps");
-  EXPECT_EQ(sent["locale"] + sent["cc"] + sent["time_zone"] + sent["mode"], "de_DEDEEurope/Berlinmanaged");
+  device.change(facts("de_DE", "DE", kAfter), "location: gps");
+  EXPECT_EQ(device.searched(all), "52.500000,13.400000 gps de_DE DE Europe/Berlin managed");
 
   device.change(facts("de_DE", "DE", "[location]\nauthorization = 2\n"), "location: userno");
-  EXPECT_EQ(device.searched()["mode"], "");
+  EXPECT_EQ(device.searched({"mode"}), "-");
   device.change(facts("de_DE", "DE", "media_store_allowed = false\n[location]\nauthorization = 2\n"),
                 "updating device restriction status to: 1");
-  EXPECT_EQ(device.searched()["mode"], "managed");
+  EXPECT_EQ(device.searched({"mode"}), "managed");
   EXPECT_EQ(world.requests("/bag", 3).size(), 3u) << "what the bag does not depend on does not fetch it";
   EXPECT_EQ(occurrences(world.daemonErrors(), kBagChecked), 2u);
   for (const char* exact : {"51.507", "0.1277", "52.52,", "13.405"}) {
@@ -107,28 +102,23 @@ type = 1
 }
 
 TEST(ContextProcess, EveryReasonForNoLocationIsOnTheWire) {
-  const auto located = [](std::string_view table) { return "[location]\n" + std::string(table) + "\n"; };
-  {
-    ChangingWorld device({{"geo_location_sources", {"gps"}}}, located("authorization = 3"));
-    device.world().waitForLog("location: slow");
-    EXPECT_EQ(device.location(), "- slow");
-    device.change(located("latitude = 51.5\nlongitude = 200\ntype = 1"), "location: error.fail");
-    EXPECT_EQ(device.location(), "- error.fail");
-    device.change(located("latitude = 51.5\nlongitude = -0.1\ntype = 1"), "location: gps");
-    EXPECT_EQ(device.location(), "51.500000,-0.100000 gps");
-    device.change(located("latitude = 51.5"), "location: error.fail");
-    EXPECT_EQ(device.location(), "- error.fail");
-    device.change(located("latitude = 51.5\nlongitude = -0.1\ntype = 5"), "location: bagno.wifi");
-    EXPECT_EQ(device.location(), "- bagno.wifi");
-    device.change(located("authorization = 2\nlatitude = 51.5\nlongitude = -0.1\ntype = 1"),
-                  "location: userno");
-    EXPECT_EQ(device.location(), "- userno");
-    device.change(located("authorization = 4\nlatitude = \"north\""), "location is not a table");
-    EXPECT_EQ(device.location(), "- userno") << "the last good facts stay";
+  ChangingWorld device({{"geo_location_sources", {"gps"}}}, "[location]\nauthorization = 3\n");
+  device.expectNoLocation("slow");
+  const struct {
+    const char *location, *logged, *sent;
+  } rows[] = {
+      {"latitude = 51.5\nlongitude = 200\ntype = 1", "location: error.fail", "- error.fail"},
+      {"latitude = 51.5\nlongitude = -0.1\ntype = 1", "location: gps", "51.500000,-0.100000 gps"},
+      {"latitude = 51.5", "location: error.fail", "- error.fail"},
+      {"latitude = 51.5\nlongitude = -0.1\ntype = 5", "location: bagno.wifi", "- bagno.wifi"},
+      {"authorization = 2\nlatitude = 51.5\nlongitude = -0.1\ntype = 1", "location: userno", "- userno"},
+      // The last good facts stay.
+      {"authorization = 4\nlatitude = \"north\"", "location is not a table", "- userno"},
+  };
+  for (const auto& [location, logged, sent] : rows) {
+    device.change("[location]\n" + std::string(location) + "\n", logged);
+    EXPECT_EQ(device.searched(), sent) << location;
   }
-  ChangingWorld closed({{"geo_location_sources", json::array()}}, located("latitude = 51.5\nlongitude = 0"));
-  closed.world().waitForLog("location: bagno.all");
-  EXPECT_EQ(closed.location(), "- bagno.all");
 }
 
 // A stand-in for GeoClue that says what it is asked for, one line each, and does as its argument says.
@@ -141,17 +131,12 @@ from dbus_next.service import ServiceInterface, dbus_property, method, signal
 NAME = 'org.freedesktop.GeoClue2'
 
 class Location(ServiceInterface):
-    def __init__(self):
-        super().__init__(NAME + '.Location')
     @dbus_property(access=PropertyAccess.READ)
     def Latitude(self) -> 'd':
         return 59.329323
     @dbus_property(access=PropertyAccess.READ)
     def Longitude(self) -> 'd':
         return 18.068581
-    @dbus_property(access=PropertyAccess.READ)
-    def Accuracy(self) -> 'd':
-        return 1500.0
     @dbus_property(access=PropertyAccess.READ)
     def Description(self) -> 's':
         return 'somewhere'
@@ -160,9 +145,7 @@ class Location(ServiceInterface):
         return [1750000000, 5]
 
 class Client(ServiceInterface):
-    def __init__(self):
-        super().__init__(NAME + '.Client')
-        self.desktop, self.level = '', 0
+    desktop, level = '', 0
     @dbus_property()
     def DesktopId(self) -> 's':
         return self.desktop
@@ -190,17 +173,15 @@ class Client(ServiceInterface):
         return ['/', '/org/freedesktop/GeoClue2/Client/1/Location/0']
 
 class Manager(ServiceInterface):
-    def __init__(self):
-        super().__init__(NAME + '.Manager')
     @method()
     def GetClient(self) -> 'o':
         return '/org/freedesktop/GeoClue2/Client/1'
 
 async def main():
     bus = await MessageBus(bus_address=sys.argv[1]).connect()
-    bus.export('/org/freedesktop/GeoClue2/Manager', Manager())
-    bus.export('/org/freedesktop/GeoClue2/Client/1', Client())
-    bus.export('/org/freedesktop/GeoClue2/Client/1/Location/0', Location())
+    bus.export('/org/freedesktop/GeoClue2/Manager', Manager(NAME + '.Manager'))
+    bus.export('/org/freedesktop/GeoClue2/Client/1', Client(NAME + '.Client'))
+    bus.export('/org/freedesktop/GeoClue2/Client/1/Location/0', Location(NAME + '.Location'))
     await bus.request_name(NAME)
     print('ready', flush=True)
     await bus.wait_for_disconnect()
@@ -233,11 +214,11 @@ struct SystemBus {
 TEST(ContextProcess, GeoClueIsAskedOnceALocationIsWantedAndStoppedOnceItIsKnown) {
   SystemBus system("locate");
   ChangingWorld device(kAnySource, "", system.environment());
-  EXPECT_EQ(device.location(), "- slow") << "nobody asks before the first search";
+  EXPECT_EQ(device.searched(), "- slow") << "nobody asks before the first search";
   EXPECT_EQ(system.geoClue->readLine(), "Start com.kestrel.sabled 4");
   device.world().waitForLog("location: unknown");
   EXPECT_EQ(system.geoClue->readLine(), "Stop");
-  EXPECT_EQ(device.location(), "59.350000,18.100000 unknown");
+  EXPECT_EQ(device.searched(), "59.350000,18.100000 unknown");
   EXPECT_EQ(system.geoClue->readLine(), "Start com.kestrel.sabled 4") << "for that fix was old";
   EXPECT_EQ(occurrences(device.world().daemonErrors(), "59.32"), 0u);
   const auto status = device.world().sablectl({"status"});
@@ -248,25 +229,19 @@ TEST(ContextProcess, GeoClueMayRefuseAndMayBeMissing) {
   {
     SystemBus system("refuse");
     ChangingWorld device(kAnySource, "", system.environment());
-    EXPECT_EQ(device.location(), "- slow");
-    device.world().waitForLog("location: userno");
-    EXPECT_EQ(device.location(), "- userno");
+    EXPECT_EQ(device.searched(), "- slow");
+    device.expectNoLocation("userno");
     device.change("[location]\nlatitude = 1\nlongitude = 1\ntype = 6", "location: cell");
-    EXPECT_EQ(device.location(), "1.000000,1.000000 cell") << "facts stand above it";
+    EXPECT_EQ(device.searched(), "1.000000,1.000000 cell") << "facts stand above it";
   }
-  {
-    const SystemBus empty("");
-    ChangingWorld device(kAnySource, "", empty.environment());
-    EXPECT_EQ(device.location(), "- slow");
-    device.world().waitForLog("location: error.fail");
-    EXPECT_EQ(device.location(), "- error.fail");
+  const SystemBus empty("");
+  for (const auto& environment : {empty.environment(), {{"DBUS_SYSTEM_BUS_ADDRESS", "unix:path=/nowhere"}}}) {
+    ChangingWorld device(kAnySource, "", environment);
+    EXPECT_EQ(device.searched(), "- slow");
+    device.expectNoLocation("error.fail");
+    EXPECT_EQ(occurrences(device.world().daemonErrors(), "no location: GeoClue"), 1u)
+        << "not asked again at once";
   }
-  ChangingWorld device(kAnySource, "", {{"DBUS_SYSTEM_BUS_ADDRESS", "unix:path=/nowhere"}});
-  EXPECT_EQ(device.location(), "- slow");
-  device.world().waitForLog("location: error.fail");
-  EXPECT_EQ(device.location(), "- error.fail");
-  EXPECT_EQ(occurrences(device.world().daemonErrors(), "no location: GeoClue"), 1u)
-      << "not asked again at once";
 }
 
 }  // namespace

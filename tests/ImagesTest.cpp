@@ -202,20 +202,17 @@ TEST_F(Images, NoDeadlineOutlastsTheTimeoutOfARequest) {
 TEST_F(Images, OneURLIsAskedForOnceHoweverManyWantIt) {
   startVouchingFor({"img.test"});
   device.service.on("/shared", after(1s, answering("shared")));
-  std::vector<Loaded> all;
+  std::vector<std::size_t> counts;
   std::vector<std::shared_ptr<SBLClient>> clients;
   const auto deadline = device.platform.runtime().ticks() + 5s;
   for (int i = 0; i < 3; ++i) {
     clients.push_back(application());
-    clients.back()->loadImages({at("http://img.test/shared"), at("http://img.test/shared")}, deadline,
-                               [&](Expected<SBLClient::Images> images) {
-                                 ASSERT_TRUE(images);
-                                 all.push_back({{"n", std::to_string(images->size())}});
-                               });
+    clients.back()->loadImages(
+        {at("http://img.test/shared"), at("http://img.test/shared")}, deadline,
+        [&](Expected<SBLClient::Images> images) { counts.push_back(images ? images->size() : 0); });
   }
   device.advance(6s);
-  EXPECT_THAT(all, testing::SizeIs(3));
-  EXPECT_THAT(all, testing::Each(Loaded{{"n", "1"}}));
+  EXPECT_THAT(counts, ElementsAre(1, 1, 1));
   EXPECT_EQ(device.sent("/shared"), 1u);
 }
 

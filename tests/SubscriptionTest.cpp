@@ -40,7 +40,6 @@ struct SubscriptionTest : testing::Test {
   Subscription subscription(std::string provider, platform::Duration age, std::string domain = "") {
     return {std::move(provider), std::move(domain), "premium", device.platform.runtime().now() - age};
   }
-  std::size_t updates() const { return device.log.count("updating subscription info"); }
 
   int searches = 0;
 };
@@ -98,12 +97,13 @@ TEST_F(SubscriptionTest, TheStoreFrontIsToldFromTheFirstRequestOnAndWhenItChange
   account.change({false, std::nullopt, "143444"});
   start();
   EXPECT_EQ(told("storefront"), "143444");
-  const std::size_t before = updates();
+  device.log.clear();
   account.change({true, std::nullopt, "143441"});
   EXPECT_EQ(told("storefront"), "143441");
   account.change({true, std::nullopt, std::nullopt});
   EXPECT_EQ(told("storefront"), "-");
-  EXPECT_EQ(updates(), before) << "subscriptions have nothing to do with it";
+  EXPECT_FALSE(device.log.contains("updating subscription info"))
+      << "subscriptions have nothing to do with it";
 }
 
 TEST_F(SubscriptionTest, ARegistryThatFailsContributesNothing) {
