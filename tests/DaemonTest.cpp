@@ -12,7 +12,6 @@ namespace sable::test {
 namespace {
 
 using platform::HTTPErrorCode;
-using platform::simulated::Scripted;
 
 class Daemon : public testing::Test {
  protected:
@@ -95,8 +94,7 @@ TEST_F(Daemon, ASilentConnectionIsClosedAfterSixtySecondsAndACallPostponesThat) 
 }
 
 TEST_F(Daemon, SeveralConnectionsOfOneProcessAreToldOfAndKept) {
-  device.start();
-  VirtualClient& first = device.client();
+  VirtualClient& first = device.startWithClient();
   VirtualClient& second = device.client();
   EXPECT_TRUE(device.log.contains("too many connections 2 from pid 100"));
   EXPECT_EQ(device.log.count("new connection from beacon (100)"), 2u);
@@ -129,8 +127,7 @@ TEST_F(Daemon, ConnectionsWithOneIdentifierShareAState) {
 }
 
 TEST_F(Daemon, TheEleventhEndpointConnectionIsRefusedUntilAPlaceIsFree) {
-  device.start();
-  const auto endpoint = *device.client().endpoint();
+  const auto endpoint = *device.startWithClient().endpoint();
   std::vector<std::shared_ptr<platform::RelayConnection>> open;
   const auto invalidated = std::make_shared<int>(0);
   const auto connect = [&] {
@@ -154,8 +151,7 @@ TEST_F(Daemon, TheEleventhEndpointConnectionIsRefusedUntilAPlaceIsFree) {
 TEST_F(Daemon, TheGatesAnswerWithNothing) {
   device.bag["minimum_query_length"] = 3;
   device.bag["agents"] = {{"rover", {{"enabled", false}}}};
-  device.start();
-  VirtualClient& beacon = device.client();
+  VirtualClient& beacon = device.startWithClient();
   for (const char* tooShort : {"", "we", "🦋"}) {
     const Answer answer = beacon.search(tooShort);
     EXPECT_FALSE(answer.reply || answer.error) << tooShort;
@@ -176,8 +172,7 @@ TEST_F(Daemon, TheGatesAnswerWithNothing) {
 
 TEST_F(Daemon, WithoutABagAQueryWaitsASecondThenFails) {
   device.service.on("/bag", answering("not found", 404));
-  device.start();
-  VirtualClient& client = device.client();
+  VirtualClient& client = device.startWithClient();
   device.advance(2s);
   const auto start = device.platform.runtime().ticks();
   const Answer answer = client.search("wea");
@@ -189,9 +184,7 @@ TEST_F(Daemon, WithoutABagAQueryWaitsASecondThenFails) {
 }
 
 TEST_F(Daemon, ABagThatArrivesWithinTheSecondServesEveryWaitingQuery) {
-  Scripted late = answering(device.bag.dump());
-  late.latency = 700ms;
-  device.service.on("/bag", late);
+  device.service.on("/bag", after(700ms, answering(device.bag.dump())));
   device.start();
   std::vector<PendingAnswer> answers;
   for (int i = 0; i < 4; ++i) {
@@ -206,8 +199,7 @@ TEST_F(Daemon, ABagThatArrivesWithinTheSecondServesEveryWaitingQuery) {
 }
 
 TEST_F(Daemon, OnlyTheNewestSearchIsAnsweredWithResults) {
-  device.start();
-  VirtualClient& client = device.client();
+  VirtualClient& client = device.startWithClient();
   const PendingAnswer first = client.send(searchFor("w", 1));
   const PendingAnswer second = client.send(searchFor("we", 5));
   const PendingAnswer stale = client.send(searchFor("wea", 4));
@@ -221,21 +213,16 @@ TEST_F(Daemon, OnlyTheNewestSearchIsAnsweredWithResults) {
 }
 
 TEST_F(Daemon, LookupsAreTriedAgainUntilTheirPageNoLongerWaitsAndSearchesAreNot) {
-  device.start();
-  VirtualClient& client = device.client();
+  VirtualClient& client = device.startWithClient();
   device.service.failNext(2, HTTPErrorCode::cannotConnect);
   EXPECT_TRUE(client.ask(SBLLookupRequest{}).reply);
   EXPECT_EQ(device.sent("/search"), 3u);
 
-  Scripted slow;
-  slow.error = HTTPErrorCode::timedOut;
-  slow.latency = 3s;
-  device.service.on("/search", slow);
+  device.service.on("/search", after(3s, failing(HTTPErrorCode::timedOut)));
   EXPECT_TRUE(client.ask(SBLLookupRequest{}).error);
   EXPECT_EQ(device.sent("/search"), 4u) << "after the deadline nothing is sent again";
 
-  slow.error = HTTPErrorCode::connectionLost;
-  device.service.on("/search", slow);
+  device.service.failNext(1, HTTPErrorCode::connectionLost);
   const Answer broken = client.search("weath");
   EXPECT_FALSE(broken.reply);
   EXPECT_EQ(broken.error->domain, platform::kHTTPErrorDomain);
@@ -243,8 +230,7 @@ TEST_F(Daemon, LookupsAreTriedAgainUntilTheirPageNoLongerWaitsAndSearchesAreNot)
 }
 
 TEST_F(Daemon, MoreResultsAndCardsAreServedOnTheEndpointAndNothingElseIs) {
-  device.start();
-  VirtualClient& client = device.client();
+  VirtualClient& client = device.startWithClient();
   device.service.on("/card", answering("no object"));
   SBLMoreResultsRequest more;
   more.moreResultsURL = "https://service.test/more?page=2";

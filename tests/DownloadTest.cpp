@@ -79,11 +79,7 @@ class Downloads : public testing::Test {
   }
 
   /// From now on files are "late", and half a minute on their way.
-  void answerSlowly() {
-    Scripted slow = answering("late");
-    slow.latency = 30s;
-    device.service.on("/resources", slow);
-  }
+  void answerSlowly() { device.service.on("/resources", after(30s, answering("late"))); }
 
   static std::filesystem::path path(const std::string& identifier) {
     return "/home/user/.cache/com.kestrel.sabled/" + identifier;
@@ -268,13 +264,12 @@ TEST_F(Downloads, WhatFailsIsReportedOnceAndLeavesTheFileAsItWas) {
     Scripted answer;
     std::string reported, logged;
   };
-  Scripted tooLarge;
-  tooLarge.error = HTTPErrorCode::responseTooLarge;
   startWithFiles();
   for (const Row& row : {Row{answering("no", 500), "status code 500", "download of notes got a 500 response"},
                          Row{answering("no", 404), "status code 404", "download of notes got a 404 response"},
                          Row{answering("no", 302), "status code 302", ""},
-                         Row{tooLarge, "download error HTTPErrorDomain 8", "download task error"}}) {
+                         Row{failing(HTTPErrorCode::responseTooLarge), "download error HTTPErrorDomain 8",
+                             "download task error"}}) {
     forget();
     device.service.on("/resources", row.answer);
     newBag({{"notes",

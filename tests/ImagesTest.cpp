@@ -27,11 +27,6 @@ SBLImageDescription at(std::string url) {
   return {std::move(url), std::nullopt};
 }
 
-Scripted after(platform::Duration latency, Scripted answer) {
-  answer.latency = latency;
-  return answer;
-}
-
 Scripted redirectingTo(std::string location) {
   Scripted answer = answering("moved", 302);
   answer.headers.add("Location", std::move(location));
@@ -288,9 +283,7 @@ TEST_F(Images, WhatIsNoImageCostsNoOther) {
   device.service.on("/empty", answering(""));
   device.service.on("/huge", answering(std::string(ImageFetcher::kMaximumImageBytes + 1, 'x')));
   device.service.on("/large", answering(std::string(ImageFetcher::kMaximumImageBytes, 'x')));
-  Scripted reset;
-  reset.error = HTTPErrorCode::connectionLost;
-  device.service.on("/reset", reset);
+  device.service.on("/reset", failing(HTTPErrorCode::connectionLost));
   std::vector<SBLImageDescription> all;
   for (const char* path : {"404", "206", "empty", "huge", "large", "reset", "fine"}) {
     all.push_back(at(std::string("http://img.test/") + path));

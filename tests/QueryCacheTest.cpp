@@ -241,12 +241,10 @@ class CachedSearches : public testing::Test {
 };
 
 TEST_F(CachedSearches, TypingAQueryAsksTheServiceOnce) {
-  auto weather = answering(sets({{{"query", "Weather Oslo"}, {"completion_score", 0.5}}}));
-  weather.latency = 80ms;
-  device.service.on("/search", weather);
+  const std::string weather = sets({{{"query", "Weather Oslo"}, {"completion_score", 0.5}}});
+  device.service.on("/search", after(80ms, answering(weather)));
   device.platform.mapsService().sessions = {{"id-1", "entity-1"}};
-  device.start();
-  VirtualClient& client = device.client();
+  VirtualClient& client = device.startWithClient();
   const std::string text = "weather oslo";
   for (std::size_t length = 1; length <= text.size(); ++length) {
     SBLSearchRequest request = searchFor(text.substr(0, length), length);
@@ -255,7 +253,7 @@ TEST_F(CachedSearches, TypingAQueryAsksTheServiceOnce) {
     const auto start = device.platform.runtime().ticks();
     const Answer answer = client.ask(request);
     const bool first = length == 1;
-    EXPECT_EQ(answer.data(), weather.body);
+    EXPECT_EQ(answer.data(), weather);
     EXPECT_EQ(answer.reply->scale, 2);
     EXPECT_EQ(answer.reply->geoSessionEntityString, "entity-1");
     EXPECT_EQ(answer.reply->httpRequest.has_value(), first);
@@ -277,8 +275,7 @@ TEST_F(CachedSearches, TypingAQueryAsksTheServiceOnce) {
 }
 
 TEST_F(CachedSearches, ForcedQueryItemsGoToTheServiceAndTheirAnswersAreKept) {
-  device.start();
-  VirtualClient& client = device.client();
+  VirtualClient& client = device.startWithClient();
   SBLSearchRequest forced = searchFor("wea", 1);
   forced.queryItems = {{"debug", "1"}};
   client.ask(forced);
@@ -296,8 +293,7 @@ TEST_F(CachedSearches, EachGoodResultSetOfAnAnswerIsAnEntryOnTheSameBytes) {
                                                {{"query", "weather map"}, {"status", "ERROR"}},
                                                "weather vane",
                                                {{"query", 7}}})));
-  device.start();
-  device.client().search("we");
+  device.startWithClient().search("we");
   QueryCache& cache = cacheOf("com.kestrel.beacon");
   EXPECT_EQ(cache.count(), 2u);
   const auto first = cache.get("wea"), second = cache.get("weather r");
@@ -308,8 +304,7 @@ TEST_F(CachedSearches, EachGoodResultSetOfAnAnswerIsAnEntryOnTheSameBytes) {
 }
 
 TEST_F(CachedSearches, OnlySearchesThatAreArraysAreKept) {
-  device.start();
-  VirtualClient& client = device.client();
+  VirtualClient& client = device.startWithClient();
   for (const char* body : {R"({"query":"weather"})", R"([{"query":"weather"})", "[]", ""}) {
     device.service.on("/search", answering(body));
     client.search("we");
@@ -321,8 +316,7 @@ TEST_F(CachedSearches, OnlySearchesThatAreArraysAreKept) {
 }
 
 TEST_F(CachedSearches, GatesStandBeforeTheCache) {
-  device.start();
-  VirtualClient& client = device.client();
+  VirtualClient& client = device.startWithClient();
   client.search("we");
   device.bag["enabled"] = false;
   device.publishBag();

@@ -22,6 +22,17 @@ Scripted answering(std::string body, int status) {
   return answer;
 }
 
+Scripted failing(platform::HTTPErrorCode error) {
+  Scripted answer;
+  answer.error = error;
+  return answer;
+}
+
+Scripted after(platform::Duration latency, Scripted answer) {
+  answer.latency = latency;
+  return answer;
+}
+
 SBLSearchRequest searchFor(std::string text, std::uint64_t queryId) {
   SBLSearchRequest request;
   request.queryId = queryId;
@@ -122,6 +133,11 @@ void VirtualDevice::start() {
   if (const auto started = daemon_->start(); !started)
     throw std::runtime_error(started.error().description());
   advance(200ms);
+}
+
+VirtualClient& VirtualDevice::startWithClient() {
+  start();
+  return client();
 }
 
 void VirtualDevice::publishBag() {

@@ -25,6 +25,8 @@ class VirtualDevice;
 
 /// An answer for the scripted service to give.
 platform::simulated::Scripted answering(std::string body, int status = 200);
+platform::simulated::Scripted failing(platform::HTTPErrorCode error);
+platform::simulated::Scripted after(platform::Duration latency, platform::simulated::Scripted answer);
 SBLSearchRequest searchFor(std::string text, std::uint64_t queryId = 1);
 /// What a request says in the header or the query item of a name; "-" without it.
 std::string sentValue(const platform::HTTPRequest& request, std::string_view name);
@@ -81,6 +83,7 @@ class VirtualDevice {
 
   /// Starts the daemon and lets it settle.
   void start();
+  VirtualClient& startWithClient();
   /// Ends the daemon as kill -9 does, in the middle of what it is doing; files, settings and counters
   /// stay. All clients are gone, and their references with them.
   void killDaemon();
