@@ -194,6 +194,7 @@ TEST_F(Flusher, WithoutAnEndpointSessionsArePackedAndDropped) {
     EXPECT_THAT(files(), IsEmpty());
     EXPECT_GE(ledger()[SBLLedgerEntry::unsent], unsent + 1);
   }
+  EXPECT_FALSE(SableFeedbackFlusher::getServerEndpointForFeedback("no URL"));
 }
 
 TEST_F(Flusher, StoppedRunsLeaveTheFilesWhereTheyAre) {

@@ -83,15 +83,14 @@ class PersistentStorage : public testing::Test {
 };
 
 TEST_F(PersistentStorage, AFileHoldsTheVersionTheSessionAndEachFeedbackAsItCame) {
-  const auto before = device.platform.transactions().openedCount("archiveObject");
+  const auto opened = device.platform.transactions().openedCount("archiveObject");
   const auto session = this->session();
   session->addFeedback(feedback("weather"));
-  EXPECT_EQ(file("session.0"), recordOf(version) + recordOf(session->data()) + recordOf(feedback()->data()))
-      << "who reports does not wait for the disk";
+  const std::string before = recordOf(version) + recordOf(session->data()) + recordOf(feedback()->data());
+  EXPECT_EQ(file("session.0"), before) << "who reports does not wait for the disk";
   device.run();
-  EXPECT_EQ(file("session.0"), recordOf(version) + recordOf(session->data()) + recordOf(feedback()->data()) +
-                                   recordOf(feedback("weather")->data()));
-  EXPECT_EQ(device.platform.transactions().openedCount("archiveObject") - before, 4u);
+  EXPECT_EQ(file("session.0"), before + recordOf(feedback("weather")->data()));
+  EXPECT_EQ(device.platform.transactions().openedCount("archiveObject") - opened, 4u);
   EXPECT_EQ(device.platform.transactions().openCount("archiveObject"), 0u);
 
   EXPECT_TRUE(available().empty());
@@ -134,7 +133,6 @@ TEST_F(PersistentStorage, ARecordThatWouldJustFillTheFileClosesIt) {
 
 TEST_F(PersistentStorage, TheDefaultLimitIsTwoMebibytes) {
   const auto session = this->session();
-  const auto empty = recordOf(feedback("")->data()).size();
   // Lengths inside the message grow with it: all of the same size are made by one that is as long.
   const std::string big(1'000'000, 'x');
   const auto overhead = recordOf(feedback(big)->data()).size() - big.size();
@@ -142,13 +140,10 @@ TEST_F(PersistentStorage, TheDefaultLimitIsTwoMebibytes) {
   device.run();
   const std::size_t rest = 2097152 - file("session.0").size();
   session->addFeedback(feedback(std::string(rest - overhead, 'x')));
-  device.run();
-  EXPECT_EQ(device.counter("filesizeexceeded"), 1);
   session->addFeedback(feedback());
   device.run();
-  EXPECT_EQ(file("session.0").size(), 2097152 - rest) << "nothing is written after that, however short";
   EXPECT_EQ(device.counter("filesizeexceeded"), 1);
-  EXPECT_GT(overhead, empty);
+  EXPECT_EQ(file("session.0").size(), 2097152 - rest) << "nothing is written after that, however short";
 }
 
 TEST_F(PersistentStorage, AFullDiskIsReportedOnceAndEndsOnlyTheFile) {
@@ -260,7 +255,6 @@ TEST_F(PersistentStorage, OfADamagedFileWhatStandsBeforeTheDamageIsUsed) {
       {header + one + giant + one, 1, "broken version string in file"},
       {header + one + std::string(9, '\0') + one, 1, "empty data file"},
       {header + one + recordOf("\xff") + one, 1, "sable feedback expected"},
-      {header + one + recordOf("\xff") + one, 1, "could not unarchive feedback range"},
       {header + one + header, 1, "could not unarchive feedback range"},
   };
   for (const Row& row : rows) {

@@ -61,6 +61,11 @@ class Sessions : public testing::Test {
     std::string agent, guid, previousReason;
     Records records;  ///< types; of a session's end its reason
   };
+  Ended endedAlone() {
+    const auto sessions = ended();
+    EXPECT_EQ(sessions.size(), 1u);
+    return sessions.empty() ? Ended() : sessions[0];
+  }
   std::vector<Ended> ended() {
     std::vector<Ended> sessions;
     auto& storage = *device.assembly().persistentStorage;
@@ -135,11 +140,10 @@ TEST_F(Sessions, TheFirstFeedbackBeginsASessionUnderTheDaemonsOwnGuid) {
   device.run();
   EXPECT_TRUE(flushed);
   EXPECT_EQ(manager().currentState(), SessionState::noSession);
-  const auto sessions = ended();
-  ASSERT_EQ(sessions.size(), 1u);
-  EXPECT_EQ(sessions[0].previousReason, "no previous session");
-  EXPECT_EQ(sessions[0].guid, guid().string());
-  EXPECT_EQ(sessions[0].records, (Records{"search_start", "external request"}));
+  const auto session = endedAlone();
+  EXPECT_EQ(session.previousReason, "no previous session");
+  EXPECT_EQ(session.guid, guid().string());
+  EXPECT_EQ(session.records, (Records{"search_start", "external request"}));
 
   manager().flushSession([&] { flushed = false; });
   device.run();
@@ -148,7 +152,7 @@ TEST_F(Sessions, TheFirstFeedbackBeginsASessionUnderTheDaemonsOwnGuid) {
   EXPECT_TRUE(ended().empty());
   search();
   flush();
-  EXPECT_EQ(ended()[0].previousReason, "external request");
+  EXPECT_EQ(endedAlone().previousReason, "external request");
 }
 
 TEST_F(Sessions, WhatTheBagTurnsOffIsDroppedBeforeAnything) {
@@ -160,9 +164,7 @@ TEST_F(Sessions, WhatTheBagTurnsOffIsDroppedBeforeAnything) {
   search("Beacon/1");
   search("Rover/1");
   flush();
-  const auto sessions = ended();
-  ASSERT_EQ(sessions.size(), 1u);
-  EXPECT_EQ(sessions[0].agent, "Beacon/1");
+  EXPECT_EQ(endedAlone().agent, "Beacon/1");
 }
 
 TEST_F(Sessions, APausePastTheSoftLimitEndsTheSessionUnderANewGuid) {
@@ -224,14 +226,13 @@ TEST_F(Sessions, AnEngagementPastTheSoftLimitClosesTheSessionItBelongsTo) {
     EXPECT_NE(guid(), before);
     EXPECT_TRUE(
         device.log.contains("session flushed because soft limit reached and sentinel feedback received"));
-    const auto sessions = ended();
-    ASSERT_EQ(sessions.size(), 1u);
-    EXPECT_EQ(sessions[0].guid, before.string());
-    EXPECT_EQ(sessions[0].records.size(), 15u);
-    EXPECT_EQ(sessions[0].records.back(), "engagement received");
+    const auto session = endedAlone();
+    EXPECT_EQ(session.guid, before.string());
+    EXPECT_EQ(session.records.size(), 15u);
+    EXPECT_EQ(session.records.back(), "engagement received");
     search();
     flush();
-    EXPECT_EQ(ended().at(0).previousReason, "engagement received");
+    EXPECT_EQ(endedAlone().previousReason, "engagement received");
     device.assembly().guidController->reset();
   }
 }
@@ -249,7 +250,7 @@ TEST_F(Sessions, ASessionThatNeverPausesEndsAtTheMaximumTimer) {
   EXPECT_EQ(posted[kSBLSessionMaxLimitNotification], 1);
   EXPECT_TRUE(device.log.contains("max timer expired expected 1 current 1"));
   EXPECT_TRUE(device.log.contains("session flushed because max timer expired com.kestrel.sabled"));
-  EXPECT_EQ(ended().at(0).records.back(), "max session time passed");
+  EXPECT_EQ(endedAlone().records.back(), "max session time passed");
 }
 
 TEST_F(Sessions, AnotherGuidEndsTheSessionInEitherState) {
@@ -267,10 +268,9 @@ TEST_F(Sessions, AnotherGuidEndsTheSessionInEitherState) {
     EXPECT_EQ(open, pause == 0min ? SessionState::active : SessionState::softLimitReached);
     EXPECT_EQ(manager().currentState(), SessionState::active);
     EXPECT_TRUE(device.log.contains("session flushed because guid changed com.kestrel.sabled"));
-    const auto sessions = ended();
-    ASSERT_EQ(sessions.size(), 1u);
-    EXPECT_EQ(sessions[0].guid, before.string());
-    EXPECT_EQ(sessions[0].records.back(), "guid changed");
+    const auto session = endedAlone();
+    EXPECT_EQ(session.guid, before.string());
+    EXPECT_EQ(session.records.back(), "guid changed");
     EXPECT_EQ(manager().session()->userGuid(), guid());
   }
 }
@@ -339,10 +339,9 @@ TEST_F(Sessions, AClientWithASessionOfItsOwnEndsItByGoing) {
   EXPECT_TRUE(device.log.contains("session flushed on invalidation"));
   EXPECT_EQ(device.daemon().service().getClientConnections().size(), 1u);
   EXPECT_EQ(managerOf(1)->currentState(), SessionState::active);
-  const auto sessions = ended();
-  ASSERT_EQ(sessions.size(), 1u);
-  EXPECT_EQ(sessions[0].agent, "B");
-  EXPECT_EQ(sessions[0].records, (Records{"search_start", "external request"}));
+  const auto session = endedAlone();
+  EXPECT_EQ(session.agent, "B");
+  EXPECT_EQ(session.records, (Records{"search_start", "external request"}));
   EXPECT_TRUE(other.isConnected());
 }
 

@@ -23,8 +23,7 @@ struct SubscriptionTest : testing::Test {
     device.bag["subscription_ttl"] = 3600;
   }
   void start() {
-    device.start();
-    client = &device.client();
+    client = &device.startWithClient();
     device.advance(2s);
   }
   void changeBag() {
