@@ -16,7 +16,7 @@ namespace {
 
 constexpr std::uint64_t kNanosecondsPerMillisecond = 1'000'000;
 /// So much JSON is handed on at once, and a record more.
-constexpr std::size_t kPieceBytes = 32u << 10;
+constexpr std::size_t kPieceBytes = 64u << 10;
 
 /// Times a record from `base`, the time of the first one; one that is older than that is of its time.
 void setRelativeTimestamp(SableFeedback& feedback, std::uint64_t base) {

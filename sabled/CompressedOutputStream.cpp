@@ -100,6 +100,7 @@ void CompressedOutputStream::close() {
   EVP_DigestFinal_ex(compressor_->sha512.get(), digest_.data(), nullptr);
   compressor_.reset();
   outputStream_->close();
+  if (outputStream_->streamError()) status_ = failed;
 }
 
 StreamStatus CompressedOutputStream::streamStatus() const {

@@ -1,10 +1,12 @@
 #pragma once
 
+#include <algorithm>
+#include <iterator>
 #include <optional>
 #include <span>
 #include <string>
 #include <string_view>
-#include <unordered_map>
+#include <utility>
 #include <vector>
 
 #include "SableKit/messages/Shared.pb.h"
@@ -44,19 +46,24 @@ void listOrNull(JSONPlace place, const List& members, Translate translate) {
 }
 
 /// Of fields with one key the last one, in the first one's place; `keyOf` leaves a field out with nothing.
-/// A stranger counts them: it takes time in proportion to their number.
+/// A stranger counts them: comparing each with each would be too slow.
 template <class Field, class KeyOf>
 std::vector<const Field*> withoutRepeated(const google::protobuf::RepeatedPtrField<Field>& fields,
                                           KeyOf keyOf) {
-  std::vector<const Field*> kept;
-  std::unordered_map<std::string_view, std::size_t> places;
-  for (const Field& field : fields) {
-    const std::optional<std::string_view> key = keyOf(field);
-    if (!key) continue;
-    const auto [place, isNew] = places.try_emplace(*key, kept.size());
-    if (isNew) kept.push_back(nullptr);
-    kept[place->second] = &field;
+  std::vector<std::pair<std::string_view, int>> places;
+  for (int i = 0; i < fields.size(); ++i) {
+    const std::optional<std::string_view> key = keyOf(fields[i]);
+    if (key) places.emplace_back(*key, i);
   }
+  std::ranges::sort(places);
+  std::vector<const Field*> kept(static_cast<std::size_t>(fields.size()));
+  for (auto first = places.begin(); first != places.end();) {
+    const auto next =
+        std::find_if(first, places.end(), [&](const auto& each) { return each.first != first->first; });
+    kept[static_cast<std::size_t>(first->second)] = &fields[std::prev(next)->second];
+    first = next;
+  }
+  std::erase(kept, nullptr);
   return kept;
 }
 

@@ -2,6 +2,12 @@
 
 namespace sable {
 
+namespace {
+
+constexpr std::size_t kBufferBytes = 64u << 10;
+
+}  // namespace
+
 void FileOutputStream::open() {
   auto file = fileManager_.openForAppending(path_);
   if (file) {
@@ -13,11 +19,21 @@ void FileOutputStream::open() {
 
 std::ptrdiff_t FileOutputStream::write(std::string_view bytes) {
   if (!file_ || error_) return -1;
-  if (auto appended = file_->append(bytes, {}); !appended) {
-    error_ = std::move(appended.error());
-    return -1;
-  }
+  buffer_ += bytes;
+  if (buffer_.size() >= kBufferBytes && !writeBuffer()) return -1;
   return static_cast<std::ptrdiff_t>(bytes.size());
+}
+
+bool FileOutputStream::writeBuffer() {
+  auto appended = file_->append(buffer_, {});
+  if (!appended) error_ = std::move(appended.error());
+  buffer_.clear();
+  return !error_;
+}
+
+void FileOutputStream::close() {
+  if (file_ && !error_ && !buffer_.empty()) writeBuffer();
+  file_.reset();
 }
 
 StreamStatus FileOutputStream::streamStatus() const {

@@ -91,11 +91,13 @@ void JSONPlace::operator=(std::optional<std::string_view> value) {
 }
 
 void JSONPlace::writeSigned(std::int64_t value) {
-  text_ += fmt::format_int(value).c_str();
+  const fmt::format_int digits(value);
+  text_.append(digits.data(), digits.size());
 }
 
 void JSONPlace::writeUnsigned(std::uint64_t value) {
-  text_ += fmt::format_int(value).c_str();
+  const fmt::format_int digits(value);
+  text_.append(digits.data(), digits.size());
 }
 
 JSONPlace JSONObject::operator[](std::string_view key) {
