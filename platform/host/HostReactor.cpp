@@ -145,15 +145,16 @@ HostReactor::HostReactor(unsigned threads)
 }
 
 HostReactor::~HostReactor() {
-  stopping_ = true;
+  {
+    const std::lock_guard lock(mutex_);
+    stopping_ = true;  // from now on no thread takes itself out of the list
+  }
   epoll_event event{};
   event.events = EPOLLIN;  // level-triggered from now on: one write wakes them all
   event.data.u64 = kWakeId;
   ::epoll_ctl(epoll_, EPOLL_CTL_MOD, wakeDescriptor_, &event);
   ::eventfd_write(wakeDescriptor_, 1);
-  for (auto* threads : {&threads_, &retired_}) {
-    for (auto& thread : *threads) thread.join();
-  }
+  for (auto& thread : threads_) thread.join();
   timers_.clear();
   // What is dropped may post in turn as it goes.
   while (takePosted()) continue;
@@ -263,7 +264,8 @@ HostReactor::Next HostReactor::prepareToWait(Threads::iterator self) {
   if (stopping_) return Next::end;
   if (postedCount_ > 0) return Next::look;
   if (threads_.size() > wantedThreads_ + kSpareThreads + blockedThreads_) {
-    retired_.splice(retired_.end(), threads_, self);
+    self->detach();  // it only returns from here
+    threads_.erase(self);
     return Next::end;
   }
   ++waitingThreads_;
@@ -278,8 +280,6 @@ void HostReactor::noteWoken(Next waited, std::uint64_t id) {
 }
 
 void HostReactor::startThread() {
-  for (auto& thread : retired_) thread.join();
-  retired_.clear();
   const SignalsBlocked duringStart;
   const auto self = threads_.emplace(threads_.end());
   try {

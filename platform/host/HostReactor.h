@@ -83,7 +83,6 @@ class HostReactor final : public Reactor {
   std::array<std::deque<Function<void()>>, 3> posted_;
   std::size_t postedCount_ = 0;
   Threads threads_;
-  Threads retired_;
   unsigned blockedThreads_ = 0;
   unsigned waitingThreads_ = 0;
   bool wakeOnItsWay_ = false;

@@ -3,7 +3,6 @@
 #include <memory>
 #include <string>
 #include <utility>
-#include <vector>
 
 #include "platform/LocationService.h"
 
@@ -31,17 +30,24 @@ class SimulatedLocationService final : public LocationService {
     tell([reason = std::move(reason)](const LocationEvents& events) { events.failed(reason); });
   }
 
-  bool isUpdating() const { return !managers_.empty() && managers_.back()->updating; }
-  /// How often a manager that stood still was started.
-  int starts() const { return managers_.empty() ? 0 : managers_.back()->starts; }
+  bool isUpdating() const {
+    const auto manager = manager_.lock();
+    return manager && manager->updating;
+  }
+  /// How often the manager was started when it stood still.
+  int starts() const {
+    const auto manager = manager_.lock();
+    return manager ? manager->starts : 0;
+  }
 
   bool locationServicesEnabled() const override { return enabled; }
 
   std::shared_ptr<LocationManager> makeManager(std::shared_ptr<SerialQueue> queue, double,
                                                LocationEvents events) override {
     if (!canMakeManager) return nullptr;
-    managers_.push_back(std::make_shared<Manager>(std::move(queue), std::move(events), status_));
-    return managers_.back();
+    auto manager = std::make_shared<Manager>(std::move(queue), std::move(events), status_);
+    manager_ = manager;
+    return manager;
   }
 
  private:
@@ -69,13 +75,15 @@ class SimulatedLocationService final : public LocationService {
 
   template <class Event>
   void tell(Event event) {
-    for (const auto& manager : managers_) {
-      manager->queue->async([manager, event] { event(manager->events); });
-    }
+    const auto manager = manager_.lock();
+    if (!manager) return;
+    manager->queue->async([weak = manager_, event] {
+      if (const auto told = weak.lock()) event(told->events);
+    });
   }
 
   const std::shared_ptr<LocationAuthorization> status_;
-  std::vector<std::shared_ptr<Manager>> managers_;
+  std::weak_ptr<Manager> manager_;  ///< of the daemon of the moment; one that is gone hears nothing
 };
 
 }  // namespace sable::platform::simulated
