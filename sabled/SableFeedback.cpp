@@ -5,12 +5,12 @@
 
 #include <algorithm>
 #include <nlohmann/json.hpp>
-#include <utility>
 
 #include "SableKit/SBLError.h"
 #include "SableKit/messages/SKSession.pb.h"
 #include "sabled/FeedbackTables.h"
 #include "sabled/JSONWriter.h"
+#include "sabled/ParsedMessage.h"
 
 namespace sable {
 
@@ -22,77 +22,12 @@ constexpr std::size_t kTagBytes = 1;  // of fields up to 15
 using StoredRecord = messages::_SKSableFeedback;
 using StoredPayload = messages::_SKFeedbackPayload;
 using Wire = google::protobuf::internal::WireFormatLite;
-using Input = google::protobuf::io::CodedInputStream;
 
 /// The tag and length of a field whose bytes follow.
 std::uint8_t* writeLength(int field, std::size_t length, std::uint8_t* to) {
   to = Wire::WriteTagToArray(field, Wire::WIRETYPE_LENGTH_DELIMITED, to);
   return google::protobuf::io::CodedOutputStream::WriteVarint32ToArray(static_cast<std::uint32_t>(length),
                                                                        to);
-}
-
-/// A record's fields, in the bytes that it is read from: a record object would copy them.
-struct Record {
-  std::string_view className, feedback;
-  std::uint64_t queryId = 0;  ///< zigzag
-  std::uint64_t clientQueryId = 0, relTimestamp = 0;
-};
-
-/// Hands each field's tag to `read`, which takes its value or answers false.
-template <class Read>
-bool readFields(std::string_view bytes, const Read& read) {
-  if (!std::in_range<int>(bytes.size())) return false;
-  Input input(reinterpret_cast<const std::uint8_t*>(bytes.data()), static_cast<int>(bytes.size()));
-  while (const std::uint32_t tag = input.ReadTag()) {
-    if (!read(input, tag)) return false;
-  }
-  return input.ConsumedEntireMessage();
-}
-
-bool readBytes(Input& input, std::string_view& bytes) {
-  std::uint32_t length = 0;
-  if (!input.ReadVarint32(&length)) return false;
-  const void* data = nullptr;
-  int available = 0;
-  input.GetDirectBufferPointer(&data, &available);
-  if (std::cmp_greater(length, available)) return false;
-  bytes = {static_cast<const char*>(data), length};
-  return input.Skip(static_cast<int>(length));
-}
-
-constexpr std::uint32_t tagOf(int field, Wire::WireType type) {
-  return static_cast<std::uint32_t>(field) << Wire::kTagTypeBits | static_cast<std::uint32_t>(type);
-}
-
-bool readPayload(std::string_view bytes, Record& record) {
-  return readFields(bytes, [&](Input& input, std::uint32_t tag) {
-    switch (tag) {
-      case tagOf(StoredPayload::kClassNameFieldNumber, Wire::WIRETYPE_LENGTH_DELIMITED):
-        return readBytes(input, record.className);
-      case tagOf(StoredPayload::kFeedbackFieldNumber, Wire::WIRETYPE_LENGTH_DELIMITED):
-        return readBytes(input, record.feedback);
-      default:
-        return Wire::SkipField(&input, tag);
-    }
-  });
-}
-
-bool readRecord(std::string_view bytes, Record& record) {
-  return readFields(bytes, [&](Input& input, std::uint32_t tag) {
-    std::string_view payload;
-    switch (tag) {
-      case tagOf(StoredRecord::kPayloadFieldNumber, Wire::WIRETYPE_LENGTH_DELIMITED):
-        return readBytes(input, payload) && readPayload(payload, record);
-      case tagOf(StoredRecord::kQueryIdFieldNumber, Wire::WIRETYPE_VARINT):
-        return input.ReadVarint64(&record.queryId);
-      case tagOf(StoredRecord::kClientQueryIdFieldNumber, Wire::WIRETYPE_VARINT):
-        return input.ReadVarint64(&record.clientQueryId);
-      case tagOf(StoredRecord::kRelTimestampFieldNumber, Wire::WIRETYPE_VARINT):
-        return input.ReadVarint64(&record.relTimestamp);
-      default:
-        return Wire::SkipField(&input, tag);
-    }
-  });
 }
 
 }  // namespace
@@ -112,23 +47,27 @@ Expected<SableFeedback> SableFeedback::parse(std::string_view bytes) {
   return std::move(**feedback);
 }
 
+SableFeedbackReader::SableFeedbackReader() : record_(std::make_unique<StoredRecord>()) {}
+
+SableFeedbackReader::~SableFeedbackReader() = default;
+
 Expected<SableFeedback*> SableFeedbackReader::read(std::string_view bytes) {
-  Record record;
-  if (!readRecord(bytes, record))
+  if (!parseMessage(*record_, bytes))
     return tl::unexpected(makeSBLError(SBLErrorCode::daemonSide, "sable feedback expected"));
-  auto entry = ofClass_.find(record.className);
+  const StoredPayload& payload = record_->payload();
+  auto entry = ofClass_.find(payload.class_name());
   if (entry == ofClass_.end()) {
-    auto message = FeedbackMessage::parse(record.className, record.feedback);
+    auto message = FeedbackMessage::parse(payload.class_name(), payload.feedback());
     if (!message) return tl::unexpected(std::move(message.error()));
     SableFeedback feedback(std::move(*message), 0, std::nullopt, {});
-    entry = ofClass_.emplace(record.className, std::move(feedback)).first;
-  } else if (auto assigned = entry->second.feedback_->assign(record.feedback); !assigned) {
+    entry = ofClass_.emplace(payload.class_name(), std::move(feedback)).first;
+  } else if (auto assigned = entry->second.feedback_->assign(payload.feedback()); !assigned) {
     return tl::unexpected(std::move(assigned.error()));
   }
   SableFeedback& feedback = entry->second;
-  feedback.queryId_ = Wire::ZigZagDecode64(record.queryId);
-  feedback.clientQueryId_ = record.clientQueryId;
-  feedback.relTimestamp_ = record.relTimestamp;
+  feedback.queryId_ = record_->query_id();
+  feedback.clientQueryId_ = record_->client_query_id();
+  feedback.relTimestamp_ = record_->rel_timestamp();
   return &feedback;
 }
 

@@ -15,6 +15,10 @@
 
 namespace sable {
 
+namespace messages {
+class _SKSableFeedback;
+}  // namespace messages
+
 /// One feedback as it goes through a session: made when a client or the daemon reports it, processed
 /// once, stored, and translated when its session is uploaded. One thread at a time.
 class SableFeedback {
@@ -83,10 +87,14 @@ class SableFeedback {
 /// allocation of messages that takes the time.
 class SableFeedbackReader {
  public:
+  SableFeedbackReader();
+  ~SableFeedbackReader();
+
   /// As SableFeedback::parse(). The feedback is the reader's, until the next one is read.
   Expected<SableFeedback*> read(std::string_view bytes);
 
  private:
+  const std::unique_ptr<messages::_SKSableFeedback> record_;
   std::map<std::string, SableFeedback, std::less<>> ofClass_;
 };
 
