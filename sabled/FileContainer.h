@@ -113,8 +113,8 @@ class FileContainer : public std::enable_shared_from_this<FileContainer> {
   std::shared_ptr<platform::Transaction> transaction_;  ///< as long as there are any
   std::uint64_t records_ = 0, readRecords_ = 0;         ///< feedback in the file; as far as it was read
   SBLLedgerEntry endOfLaterRecords_ = SBLLedgerEntry::unwritten;  ///< of those that find the file closed
-  SBLLedgerEntry end_ = SBLLedgerEntry::damaged;  ///< of those in the file, by the last read()
-  std::optional<std::shared_ptr<ClientSession>> ahead_;
+  SBLLedgerEntry end_ = SBLLedgerEntry::damaged;         ///< of those in the file, by the last read()
+  std::optional<std::shared_ptr<ClientSession>> ahead_;  ///< read before anybody asked for it, or null
 };
 
 /// The feedback records in a session file, as FileContainer::countRecords().

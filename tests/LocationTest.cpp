@@ -156,13 +156,11 @@ TEST_F(Location, WithoutAManagerOrPermissionNothingIsLookedFor) {
   location.canMakeManager = true;
   for (const auto status : {LocationAuthorization::denied, LocationAuthorization::restricted}) {
     location.authorize(status);
-    device.run();
     device.restart();
     EXPECT_FALSE(location.isUpdating());
     EXPECT_EQ(searched(), "- userno");
   }
   location.authorize(LocationAuthorization::notDetermined);
-  device.run();
   device.restart();
   EXPECT_FALSE(location.isUpdating()) << "nobody has been asked, so nobody is asked before a search";
   EXPECT_EQ(searched(), "- slow");
