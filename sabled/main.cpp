@@ -61,6 +61,7 @@ int run(const Options& options) {
     std::fprintf(stderr, "sabled: %s\n", started.error().reason.c_str());
     platform.process().exit(kExitFailure);
   }
+  sable::platform::host::releaseStartUpPages();
   platform.process().runMainLoop();
   platform.process().exit(0);
   return 0;
