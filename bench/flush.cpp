@@ -21,17 +21,17 @@
 #include "platform/host/HostPlatform.h"
 #include "sabled/Assembly.h"
 #include "sabled/ClientSession.h"
-#include "sabled/CompressedOutputStream.h"
 #include "sabled/DaemonFeedback.h"
 #include "sabled/FileContainer.h"
-#include "sabled/FileOutputStream.h"
 #include "sabled/SableFeedback.h"
+#include "sabled/SableFeedbackFlusher.h"
 #include "sabled/SablePersistentStorage.h"
 
 namespace {
 
 using namespace sable::bench;
 
+constexpr int kFeedbacks = 1;
 constexpr std::size_t kWholeBytes = 100'000'000;
 
 /// What a user does in a session, again and again, as far as the daemon itself records it.
@@ -68,26 +68,19 @@ void makeSessions(sable::Assembly& assembly, std::size_t bytesEach, std::size_t 
   }
 }
 
-/// What the flusher does with one session, while the storage reads the next; the compressed bytes are left in
-/// `file`.
-std::uint64_t pack(sable::Assembly& assembly, sable::FileContainer& container, sable::FileContainer* next,
-                   const std::filesystem::path& file) {
-  std::ofstream(file).close();
-  sable::CompressedOutputStream stream(std::make_unique<sable::FileOutputStream>(assembly.fileManager, file));
-  stream.open();
-  const auto session = container.read();
+/// Packs one session, while the storage reads the next. No bag names a place to upload it to, so that is
+/// all: its file is deleted.
+void pack(sable::SableFeedbackFlusher& flusher, sable::FileContainer& container, sable::FileContainer* next) {
+  auto session = container.read();
   if (!session) fail("a session cannot be read");
   if (next != nullptr) next->readAhead();
-  if (!session->writeFeedbacksToSend([&](std::string_view json) { return stream.writeOnce(json); }))
-    fail("a session cannot be packed");
-  stream.close();
-  if (stream.streamError()) fail("the packed session cannot be written");
-  return stream.bytesRead();
+  flusher.flushSyncFromArray({std::move(session)});
+  flusher.flushToWireSync(false);
 }
 
 std::string jsonOf(sable::FileContainer& container) {
   std::string text;
-  container.read()->writeFeedbacksToSend([&](std::string_view json) { return text.append(json), true; });
+  container.read()->writeFeedbacksToSend([&](std::string_view json) { text += json; });
   return text;
 }
 
@@ -112,17 +105,18 @@ double sum(const Microseconds& times) {
 }
 
 /// Megabytes of JSON a second, both sides session by session in turns.
-void measureSpeed(sable::Assembly& assembly, const std::filesystem::path& file, int argc, char** argv) {
+void measureSpeed(sable::Assembly& assembly, sable::SableFeedbackFlusher& flusher, int argc, char** argv) {
   const auto containers = assembly.persistentStorage->getAvailableSessionHandles();
   std::vector<std::string> texts;
   for (const auto& container : containers) texts.push_back(jsonOf(*container));
   Microseconds times, floors;
-  std::uint64_t bytes = 0;
+  std::size_t bytes = 0;
   std::string compressed;
   for (std::size_t i = 0; i < containers.size(); ++i) {
     measure(1, floors, [&] { floorOf(texts[i], compressed); });
     auto* const next = i + 1 < containers.size() ? containers[i + 1].get() : nullptr;
-    measure(1, times, [&] { bytes += pack(assembly, *containers[i], next, file); });
+    measure(1, times, [&] { pack(flusher, *containers[i], next); });
+    bytes += texts[i].size();
   }
   report({"flush", "MB/s", static_cast<double>(bytes) / sum(times), static_cast<double>(bytes) / sum(floors),
           0.85, true},
@@ -138,14 +132,14 @@ double peakMiB() {
   fail("no VmHWM");
 }
 
-void measureMemory(sable::Assembly& assembly, const std::filesystem::path& file, std::size_t mebibytes,
+void measureMemory(sable::Assembly& assembly, sable::SableFeedbackFlusher& flusher, std::size_t mebibytes,
                    int argc, char** argv) {
   makeSessions(assembly, mebibytes << 20, 1);
   const auto container = assembly.persistentStorage->getAvailableSessionHandles().back();
   ::malloc_trim(0);
   std::ofstream("/proc/self/clear_refs") << "5";  // VmHWM begins anew
   const double before = peakMiB();
-  pack(assembly, *container, nullptr, file);
+  pack(flusher, *container, nullptr);
   report(
       {fmt::format("flush_memory_{}_mib", mebibytes), "MiB", peakMiB() - before, std::nullopt, std::nullopt},
       argc, argv);
@@ -165,12 +159,10 @@ int main(int argc, char** argv) {
     device.userDefaults().set("SBLSessionSizeLimit", std::int64_t{64} << 20);
     sable::Assembly assembly(device);
     assembly.persistentStorage = std::make_unique<sable::SablePersistentStorage>(assembly);
-    for (const std::size_t mebibytes : {2, 16})
-      measureMemory(assembly, root / "packed", mebibytes, argc, argv);
-    for (const auto& container : assembly.persistentStorage->getAvailableSessionHandles())
-      assembly.persistentStorage->deleteSessionWithFileContainer(container);
+    sable::SableFeedbackFlusher flusher(assembly, kFeedbacks);
+    for (const std::size_t mebibytes : {2, 16}) measureMemory(assembly, flusher, mebibytes, argc, argv);
     makeSessions(assembly, 2u << 20, kWholeBytes / (2u << 20));
-    measureSpeed(assembly, root / "packed", argc, argv);
+    measureSpeed(assembly, flusher, argc, argv);
   }
   std::error_code ignored;
   std::filesystem::remove_all(root, ignored);

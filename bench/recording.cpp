@@ -241,7 +241,7 @@ int main(int argc, char** argv) {
       const auto session = recorder.end(kTranslatedRecords);
       measure(1, times, [&] {
         std::size_t bytes = 0;
-        session->writeFeedbacksToSend([&](std::string_view json) { return bytes += json.size(), true; });
+        session->writeFeedbacksToSend([&](std::string_view json) { bytes += json.size(); });
         if (bytes < kTranslatedRecords) fail("records are missing");
       });
     }

@@ -63,8 +63,8 @@ class ClientSession final : public FeedbackSession {
   /// The upload's envelope of a session that was read back. Once: its feedback is processed.
   Dictionary getFeedbacksToSend();
   /// The same as JSON, and likewise once: compactJSON() of it, handed out in pieces so that it is never
-  /// in memory as a whole. Ends early where `write` answers false, and then returns false.
-  bool writeFeedbacksToSend(const std::function<bool(std::string_view)>& write);
+  /// in memory as a whole.
+  void writeFeedbacksToSend(const std::function<void(std::string_view)>& write);
 
   void enumerateSessions(const std::function<void(ClientSession&, bool)>& callback) override;
 
@@ -94,12 +94,12 @@ class ClientSession final : public FeedbackSession {
     std::uint64_t timestamp = 0;
     bool hasIdentifiers = false;
   };
-  using RecordVisitor = std::function<bool(const SableFeedback& record)>;
+  using RecordVisitor = std::function<void(const SableFeedback& record)>;
 
   void begin(const SableFeedback* feedback);
-  bool visitRecordsToSend(const SableFeedbacks& feedbacks, const RecordVisitor& visit);
-  bool visitStoredRecordsToSend(const RecordVisitor& visit);
-  bool visitMissing(const SessionProcessingHelper& helper, const RecordVisitor& visit);
+  void visitRecordsToSend(const SableFeedbacks& feedbacks, const RecordVisitor& visit);
+  void visitStoredRecordsToSend(const RecordVisitor& visit);
+  void visitMissing(const SessionProcessingHelper& helper, const RecordVisitor& visit);
   SableFeedback read(const StoredFeedback& stored) const;
   Dictionary envelopeBehindFeedback();
   bool _firstUseOfTheDay(const std::string& agent);

@@ -45,28 +45,25 @@ Dictionary ClientSession::feedbacksWithRelativeTimestamp() {
 
 Dictionary ClientSession::privacyFilteredFeedbacksWithRelativeTimestamp(const SableFeedbacks& feedbacks) {
   Dictionary result = Dictionary::array();
-  visitRecordsToSend(feedbacks, [&](const SableFeedback& record) {
-    result.push_back(record.dictionary());
-    return true;
-  });
+  visitRecordsToSend(feedbacks, [&](const SableFeedback& record) { result.push_back(record.dictionary()); });
   return result;
 }
 
 /// Each record in the order in which it is uploaded. What is missing goes first: the suggestions, then
-/// the results. Only when all feedback is processed is it known. False when `visit` says so.
-bool ClientSession::visitRecordsToSend(const SableFeedbacks& feedbacks, const RecordVisitor& visit) {
+/// the results. Only when all feedback is processed is it known.
+void ClientSession::visitRecordsToSend(const SableFeedbacks& feedbacks, const RecordVisitor& visit) {
   SessionProcessingHelper helper;
   for (const auto& feedback : feedbacks) {
     setRelativeTimestamp(*feedback, feedbacks.front()->feedback().timestamp());
     feedback->process(helper);
   }
-  return visitMissing(helper, visit) &&
-         std::ranges::all_of(feedbacks, [&](const auto& feedback) { return visit(*feedback); });
+  visitMissing(helper, visit);
+  for (const auto& feedback : feedbacks) visit(*feedback);
 }
 
 /// The same of the feedback in the file, which is never in memory as a whole: what is missing is found on a
 /// way of its own, and on the second one each identifier gets the same replacement again.
-bool ClientSession::visitStoredRecordsToSend(const RecordVisitor& visit) {
+void ClientSession::visitStoredRecordsToSend(const RecordVisitor& visit) {
   SableFeedbackReader reader;
   const auto read = [&](const StoredFeedback& stored) -> SableFeedback& {
     return **reader.read(stored.record);  // as it could be when the file was read
@@ -75,21 +72,22 @@ bool ClientSession::visitStoredRecordsToSend(const RecordVisitor& visit) {
   for (const auto& stored : storedFeedbacks_) {
     if (stored.hasIdentifiers) read(stored).process(first);
   }
-  return visitMissing(first, visit) && std::ranges::all_of(storedFeedbacks_, [&](const auto& stored) {
-           SableFeedback& feedback = read(stored);
-           setRelativeTimestamp(feedback, storedFeedbacks_.front().timestamp);
-           feedback.process(second);
-           return visit(feedback);
-         });
+  visitMissing(first, visit);
+  for (const auto& stored : storedFeedbacks_) {
+    SableFeedback& feedback = read(stored);
+    setRelativeTimestamp(feedback, storedFeedbacks_.front().timestamp);
+    feedback.process(second);
+    visit(feedback);
+  }
 }
 
-bool ClientSession::visitMissing(const SessionProcessingHelper& helper, const RecordVisitor& visit) {
+void ClientSession::visitMissing(const SessionProcessingHelper& helper, const RecordVisitor& visit) {
   const auto visitOne = [&](const std::vector<std::string>& missing, auto message) {
-    if (missing.empty()) return true;
-    return visit(SableFeedback(message(assembly_.runtime.ticks(), missing), 0, userGuid(), agent_));
+    if (!missing.empty())
+      visit(SableFeedback(message(assembly_.runtime.ticks(), missing), 0, userGuid(), agent_));
   };
-  return visitOne(helper.missingSuggestions(), feedback::sessionMissingSuggestions) &&
-         visitOne(helper.missingResults(), feedback::sessionMissingResults);
+  visitOne(helper.missingSuggestions(), feedback::sessionMissingSuggestions);
+  visitOne(helper.missingResults(), feedback::sessionMissingResults);
 }
 
 Dictionary ClientSession::getFeedbacksToSend() {
@@ -99,21 +97,23 @@ Dictionary ClientSession::getFeedbacksToSend() {
   return envelope;
 }
 
-bool ClientSession::writeFeedbacksToSend(const std::function<bool(std::string_view)>& write) {
+void ClientSession::writeFeedbacksToSend(const std::function<void(std::string_view)>& write) {
   std::string piece = R"({"fb":[)";
   bool isFirst = true;
   const auto writeRecord = [&](const SableFeedback& record) {
     if (!std::exchange(isFirst, false)) piece += ',';
     record.writeJSON(piece);
-    if (piece.size() < kPieceBytes) return true;
-    const bool wanted = write(piece);
+    if (piece.size() < kPieceBytes) return;
+    write(piece);
     piece.clear();
-    return wanted;
   };
-  const bool written =
-      file_ ? visitStoredRecordsToSend(writeRecord) : visitRecordsToSend(getSessionFeedbacks(), writeRecord);
+  if (file_) {
+    visitStoredRecordsToSend(writeRecord);
+  } else {
+    visitRecordsToSend(getSessionFeedbacks(), writeRecord);
+  }
   piece.append("],").append(compactJSON(envelopeBehindFeedback()), 1);
-  return written && write(piece);
+  write(piece);
 }
 
 /// The keys that follow "fb".

@@ -25,6 +25,8 @@ namespace sable {
 namespace {
 
 constexpr double kUploadTimeout = 300;  // seconds
+/// So many pieces of an envelope may wait for their compression: one would leave it idle while threads wake.
+constexpr unsigned kPiecesAhead = 2;
 constexpr int kCrowdsourcing = 0, kFeedbacks = 1;
 
 const platform::LogHandle& log() {
@@ -48,6 +50,8 @@ SableFeedbackFlusher::SableFeedbackFlusher(Assembly& assembly, int identifier)
       identifier_(identifier),
       queueBuffer_(assembly.runtime.serialQueue("com.kestrel.sabled.sableDataBufferQueue",
                                                 platform::QualityOfService::background)),
+      queueCompression_(assembly.runtime.serialQueue("com.kestrel.sabled.sableDataCompressionQueue",
+                                                     platform::QualityOfService::background)),
       feedbackCountQueue_(assembly.runtime.serialQueue("com.kestrel.sabled.feedbackCountQueue")) {
   bagObservation_ = assembly.notificationCenter.observe(
       std::string(kSBLBagChangeNotification),
@@ -210,11 +214,17 @@ Expected<SableFeedbackFlusher::Packed> SableFeedbackFlusher::pack(ClientSession&
                                                                   const std::filesystem::path& file) {
   CompressedOutputStream stream(std::make_unique<FileOutputStream>(assembly_.fileManager, file));
   stream.open();
-  const bool written =
-      session.writeFeedbacksToSend([&](std::string_view json) { return stream.writeOnce(json); });
-  stream.close();
-  if (auto error = stream.streamError(); error || !written)
-    return tl::unexpected(std::move(error).value_or(posixError(EIO, file.native())));
+  // Pieces of the JSON are compressed while the next ones are made of the records.
+  const auto room = assembly_.runtime.semaphore(kPiecesAhead);
+  session.writeFeedbacksToSend([&](std::string_view json) {
+    static_cast<void>(room->wait(platform::MonotonicTime::max()));
+    queueCompression_->async([&, piece = std::string(json)] {
+      stream.writeOnce(piece);
+      room->signal();
+    });
+  });
+  queueCompression_->sync([&] { stream.close(); });
+  if (auto error = stream.streamError()) return tl::unexpected(*std::move(error));
   return Packed{stream.dataDigestForStream(), stream.bytesRead(),
                 static_cast<std::int64_t>(session.countOfSessionFeedbacks())};
 }

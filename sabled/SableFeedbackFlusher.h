@@ -79,7 +79,7 @@ class SableFeedbackFlusher {
 
   Assembly& assembly_;
   const int identifier_;
-  const std::shared_ptr<platform::SerialQueue> queueBuffer_, feedbackCountQueue_;
+  const std::shared_ptr<platform::SerialQueue> queueBuffer_, queueCompression_, feedbackCountQueue_;
 
   // On queueBuffer_.
   std::optional<std::string> serverEndpoint_;

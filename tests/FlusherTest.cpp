@@ -147,10 +147,7 @@ TEST_F(Flusher, WhatIsWrittenPieceByPieceIsTheEnvelopesJSON) {
     if (!isEmpty) session.addFeedback(results);
     session.sessionComplete();
     std::string written;
-    EXPECT_TRUE(session.storageHandle()->read()->writeFeedbacksToSend([&](std::string_view text) {
-      written += text;
-      return true;
-    }));
+    session.storageHandle()->read()->writeFeedbacksToSend([&](std::string_view json) { written += json; });
     EXPECT_EQ(written, compactJSON(session.storageHandle()->read()->getFeedbacksToSend()));
   }
 }
