@@ -7,10 +7,9 @@ namespace sable::platform::host {
 /// starts.
 void shareOneHeap();
 
-/// Gives back the pages of programs and libraries that linking and starting have touched, 4 MiB of which
-/// are not needed again: symbol tables, constructors. They stay in the page cache, from where a
-/// touch maps them again, but they are no longer held for this process. Call it once, when all is started. A
-/// debugger's breakpoints that were set before go with the pages.
+/// Gives back the pages of the program and its libraries that linking and starting have touched, symbol
+/// tables and constructors, 4 MiB that are hardly needed again. They stay in the page cache, from where a
+/// touch maps them again. Call it once, when all is started; a debugger's breakpoints of before are lost.
 void releaseStartUpPages();
 
 }  // namespace sable::platform::host
