@@ -3,7 +3,6 @@
 #include "SableKit/SBLBag.h"
 #include "platform/PropertyList.h"
 #include "sabled/SableBagController.h"
-#include "sabled/SableUserGUIDController.h"
 #include "tests/support/VirtualDevice.h"
 
 // The bag's life on the virtual device: fetched, kept, refreshed, announced.
@@ -12,25 +11,14 @@ namespace {
 
 using platform::HTTPErrorCode;
 
+constexpr const char* kFile = "/home/user/.cache/com.kestrel.sabled/bag.plist";
+
 class BagController : public testing::Test {
  protected:
   SableBagController& controller() { return *device.assembly().bagController; }
   std::string version() { return controller().currentBag()->version(); }
 
-  /// The same device after its daemon was killed.
-  void restart() {
-    restarted.reset();  // its log makes way for the next
-    restarted = std::make_unique<VirtualDevice>();
-    auto& files = restarted->platform.fileManager();
-    for (const auto& directory : device.platform.fileManager().directories())
-      (void)files.createDirectory(directory);
-    for (const auto& [path, bytes] : device.platform.fileManager().files())
-      (void)files.writeAtomically(path, bytes);
-    restarted->platform.runtime().setWallClock(device.platform.runtime().now());
-  }
-
   VirtualDevice device;
-  std::unique_ptr<VirtualDevice> restarted;
 };
 
 TEST_F(BagController, TransportErrorsAreTriedAgainFiveTimesOneAndAHalfSecondsApart) {
@@ -90,12 +78,16 @@ TEST_F(BagController, ItIsRefreshedFromTenMinutesBeforeItsExpiry) {
   EXPECT_EQ(device.counter("bag.expired"), 1);
 }
 
-TEST_F(BagController, AChangeOfLocaleOrCountryFetchesAndOneOfTimeZoneDoesNot) {
+TEST_F(BagController, AChangeOfLocaleOrCountryFetchesAndNothingElseDoes) {
   device.start();
   device.platform.localeInfo().changeTimeZone("Europe/Rome");
+  device.platform.accountStore().change({true, std::nullopt, "143444"});
+  device.platform.managedConfiguration().change({.mediaStoreAllowed = false});
+  auto values = device.platform.localeInfo().values;
+  values.measurementSystem = "Metric";
+  device.platform.localeInfo().change(values);
   device.advance(1s);
   EXPECT_EQ(device.sent("/bag"), 1u);
-  auto values = device.platform.localeInfo().values;
   values.localeIdentifier = "de_DE";
   device.platform.localeInfo().change(values);
   device.advance(1s);
@@ -146,13 +138,13 @@ TEST_F(BagController, TheFileServesTheNextStart) {
   EXPECT_GT(numberMember(*kept, "__expiration").value_or(0), 0);
   EXPECT_TRUE(stringMember(*kept, "__bagurl")->find("key=") == std::string::npos);
 
-  restart();
-  restarted->service.failNext(100, HTTPErrorCode::cannotConnect);
-  restarted->start();
-  EXPECT_EQ(restarted->assembly().bagController->currentBag()->version(), "1");
-  EXPECT_EQ(restarted->sent("/bag"), 0u) << "it is fresh";
-  EXPECT_TRUE(restarted->platform.notify().posted().empty()) << "a bag from disk announces nothing";
-  EXPECT_EQ(device.platform.notify().posted(), std::vector<std::string>{"com.kestrel.sable.enabled"});
+  device.killDaemon();
+  device.service.failNext(100, HTTPErrorCode::cannotConnect);
+  device.start();
+  EXPECT_EQ(version(), "1");
+  EXPECT_EQ(device.sent("/bag"), 1u) << "it is fresh";
+  EXPECT_EQ(device.platform.notify().posted(), std::vector<std::string>{"com.kestrel.sable.enabled"})
+      << "a bag from disk announces nothing";
 }
 
 TEST_F(BagController, ATornOrForeignFileIsReportedAndReplaced) {
@@ -161,14 +153,13 @@ TEST_F(BagController, ATornOrForeignFileIsReportedAndReplaced) {
   for (const std::string& bytes :
        {whole.substr(0, whole.size() / 2), std::string("{}"), std::string("bplist00"),
         *platform::encodePropertyList(Dictionary::array({1}))}) {
-    restart();
-    for (const auto& [path, old] : device.platform.fileManager().files()) {
-      (void)restarted->platform.fileManager().writeAtomically(path, bytes);
-    }
-    restarted->start();
-    EXPECT_EQ(restarted->log.count(platform::LogLevel::error, "Sable_Bag"), 1u) << bytes.size();
-    EXPECT_EQ(restarted->assembly().bagController->currentBag()->version(), "1");
-    EXPECT_EQ(platform::decodePropertyList(restarted->bagFile()).has_value(), true);
+    device.killDaemon();
+    ASSERT_TRUE(device.platform.fileManager().writeAtomically(kFile, bytes));
+    device.log.clear();
+    device.start();
+    EXPECT_EQ(device.log.count(platform::LogLevel::error, "Sable_Bag"), 1u) << bytes.size();
+    EXPECT_EQ(version(), "1");
+    EXPECT_TRUE(platform::decodePropertyList(device.bagFile()));
   }
 }
 
@@ -190,31 +181,11 @@ TEST_F(BagController, ABagThatIsNeverToBeRefreshedIsNot) {
 
 TEST_F(BagController, TheNewsClientsAvailabilityIsAnnouncedWhenItChanges) {
   device.start();
-  device.bag["version"] = "2";
-  controller().forceFetchBag({{"bag", 2}});
-  device.advance(1s);
-  device.bag["version"] = "3";
+  device.publishBag();
   device.bag["agents"] = {{"news", {{"enabled", false}}}};
-  controller().forceFetchBag({{"bag", 3}});
-  device.advance(1s);
+  device.publishBag();
   EXPECT_EQ(device.platform.notify().posted(),
             (std::vector<std::string>{"com.kestrel.sable.enabled", "com.kestrel.sable.disabled"}));
-}
-
-TEST(UserGUID, RollsEveryFifteenMinutesAndOnReset) {
-  VirtualDevice device;
-  device.start();
-  auto& guid = *device.assembly().guidController;
-  const UUID first = guid.currentUserGUID();
-  device.advance(899s);
-  EXPECT_EQ(guid.currentUserGUID(), first);
-  device.advance(2s);
-  const UUID second = guid.currentUserGUID();
-  EXPECT_NE(second, first);
-  guid.reset();
-  EXPECT_NE(guid.currentUserGUID(), second);
-  device.run();
-  EXPECT_EQ(device.counter("userguid"), 2);
 }
 
 }  // namespace

@@ -297,18 +297,5 @@ TEST_F(Context, ATemperatureUnitStaysUntilThereIsAnother) {
   EXPECT_EQ(sent("temp") + sent("units"), "FSI");
 }
 
-TEST_F(Context, WhatTheBagDoesNotDependOnHasItNotFetchedAgain) {
-  start(LocationAuthorization::always);
-  const std::size_t before = device.sent("/bag");
-  deliver();
-  device.platform.accountStore().change({true, std::nullopt, "143444"});
-  device.platform.managedConfiguration().change({.mediaStoreAllowed = false});
-  auto values = device.platform.localeInfo().values;
-  values.measurementSystem = "Metric";
-  device.platform.localeInfo().change(values);
-  device.advance(1s);
-  EXPECT_EQ(device.sent("/bag"), before);
-}
-
 }  // namespace
 }  // namespace sable::test
