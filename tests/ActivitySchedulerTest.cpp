@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <map>
 #include <memory>
 #include <optional>
 #include <set>
@@ -12,7 +13,6 @@
 #include "platform/simulated/SimulatedLog.h"
 #include "platform/simulated/SimulatedRuntime.h"
 #include "sabled/SableRelayActivity.h"
-#include "sabled/SableRelayCriteria.h"
 #include "tests/support/ManualReactor.h"
 #include "tests/support/TemporaryFolder.h"
 
@@ -160,19 +160,6 @@ TEST_F(ActivitySchedulerTest, ARunIsOpenUntilItIsDoneAndNeverTwiceAtOnce) {
   EXPECT_EQ(runs, (std::vector<Duration>{300s, 2h, 3h}));
 }
 
-TEST(ActivityCriteriaTest, IsPutTogetherInSeconds) {
-  auto criteria = SableRelayCriteria::createCriteria();
-  SableRelayCriteria::setDelay(300, criteria);
-  SableRelayCriteria::setRepeating(true, criteria);
-  SableRelayCriteria::setInterval(600, criteria);
-  SableRelayCriteria::setGracePeriod(0.5, criteria);
-  SableRelayCriteria::setAllowBatteryUsage(true, criteria);
-  EXPECT_EQ(criteria.delay, 300s);
-  EXPECT_EQ(criteria.interval, 600s);
-  EXPECT_EQ(criteria.gracePeriod, 500ms);
-  EXPECT_TRUE(criteria.repeating && criteria.allowBattery);
-}
-
 /// The host's files and facts, in virtual time.
 struct HostActivitySchedulerTest : testing::Test {
   TemporaryFolder folder;
@@ -186,8 +173,9 @@ struct HostActivitySchedulerTest : testing::Test {
   host::HostFacts facts{folders, sources, reactor, center};
   int runs = 0;
 
-  void supply(const char* name, const char* attribute, const char* value) {
-    writeFile(sources.root / "sys/class/power_supply" / name / attribute, value);
+  void supply(const char* name, const std::map<std::string, std::string>& attributes) {
+    for (const auto& [attribute, value] : attributes)
+      writeFile(sources.root / "sys/class/power_supply" / name / attribute, value + "\n");
   }
   /// A process that lives for so long.
   void live(Duration life, bool allowBattery) {
@@ -230,30 +218,24 @@ TEST_F(HostActivitySchedulerTest, ReadsOnlyTimesFromItsFile) {
 
 TEST_F(HostActivitySchedulerTest, KnowsItsBatteryByTheKernel) {
   EXPECT_FALSE(host::runsOnBattery(sources.root));
-  supply("BAT0", "type", "Battery\n");
-  supply("BAT0", "status", "Discharging\n");
+  supply("BAT0", {{"type", "Battery"}, {"status", "Discharging"}});
   EXPECT_TRUE(host::runsOnBattery(sources.root));
-  supply("AC", "type", "Mains\n");
-  supply("AC", "online", "1\n");
+  supply("AC", {{"type", "Mains"}, {"online", "1"}});
   EXPECT_FALSE(host::runsOnBattery(sources.root));
-  supply("AC", "online", "0\n");
-  supply("mouse", "type", "Battery\n");
-  supply("mouse", "scope", "Device\n");
-  supply("mouse", "status", "Discharging\n");
+  supply("AC", {{"online", "0"}});
+  supply("mouse", {{"type", "Battery"}, {"scope", "Device"}, {"status", "Discharging"}});
   EXPECT_TRUE(host::runsOnBattery(sources.root));
-  supply("BAT0", "status", "Not charging\n");
+  supply("BAT0", {{"status", "Not charging"}});
   EXPECT_FALSE(host::runsOnBattery(sources.root));
 }
 
 TEST_F(HostActivitySchedulerTest, WaitsForPowerThatTheKernelDoesNotAnnounceAndTheFactsDo) {
-  supply("BAT0", "type", "Battery\n");
-  supply("BAT0", "status", "Discharging\n");
+  supply("BAT0", {{"type", "Battery"}, {"status", "Discharging"}});
   host::HostActivityScheduler scheduler(runtime, center, facts, files, folders.activityRuns());
   scheduler.registerActivity(kName, {60s, 24h, {}, true, false}, [this](const auto&) { ++runs; });
   runtime.advance(1h);
   EXPECT_EQ(runs, 0);
-  supply("AC", "type", "Mains\n");
-  supply("AC", "online", "1\n");
+  supply("AC", {{"type", "Mains"}, {"online", "1"}});
   runtime.advance(kActivityRetryPause);
   EXPECT_EQ(runs, 1);
 

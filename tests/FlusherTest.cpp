@@ -336,11 +336,12 @@ TEST_F(Flusher, AMonthWithOutagesKeepsTheScheduleAndLosesNothing) {
       return answering(path == "/bag"sv ? device.bag.dump() : "[]");
     });
   }
+  device.platform.activityScheduler().setOnBattery(true);
   device.start();
   const auto& runs = device.platform.activityScheduler().record();
   const auto times = [&runs] { return runs.at("com.kestrel.sabled.flusher.background"); };
   const auto first = *times().nextRun - device.platform.runtime().now();
-  EXPECT_GE(first, 299s);
+  EXPECT_GT(first, 300s) << "somewhere in its time of grace";
   EXPECT_LE(first, 600s);
   device.advance(first);
 
