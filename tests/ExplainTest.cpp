@@ -17,22 +17,24 @@ using platform::HTTPRequest;
 
 class ExplainTest : public ::testing::Test {
  protected:
-  json explain(const SBLSearchRequest& request) {
-    json explanation;
-    client->connection().call(kSBLDiagnosticsRelay, SBLDiagnosticsRelay::explain,
-                              {std::string(SBLSearchRequest::kClassName), encodeRequest(request)}, 20s,
+  /// The answer of the diagnostics, or why there is none.
+  json diagnose(std::size_t method, platform::RelayArguments arguments) {
+    json answer;
+    client->connection().call(kSBLDiagnosticsRelay, method, std::move(arguments), 20s,
                               [&](Expected<platform::RelayArguments> result) {
-                                ASSERT_TRUE(result) << result.error().reason;
-                                explanation = json::parse(std::get<std::string>((*result)[0]));
+                                answer = result ? json::parse(std::get<std::string>((*result)[0]))
+                                                : json(result.error().reason);
                               });
     device.run();
-    return explanation;
+    return answer;
+  }
+  json explain(const SBLSearchRequest& request) {
+    return diagnose(SBLDiagnosticsRelay::explain,
+                    {std::string(SBLSearchRequest::kClassName), encodeRequest(request)});
   }
 
   static SBLSearchRequest searchFor(std::string text, std::uint64_t queryId = 1000) {
-    SBLSearchRequest request;
-    request.queryString = std::move(text);
-    request.queryId = queryId;
+    SBLSearchRequest request = test::searchFor(std::move(text), queryId);
     request.verboseReply = true;
     return request;
   }
@@ -133,12 +135,8 @@ TEST_F(ExplainTest, TellsTheRuleThatChoseOrDroppedEachCandidate) {
 
 TEST_F(ExplainTest, ExplainsSearchesOnly) {
   start();
-  std::string error;
-  client->connection().call(
-      kSBLDiagnosticsRelay, SBLDiagnosticsRelay::explain,
-      {std::string("SBLCardRequest"), platform::RelayRecord{}}, 20s,
-      [&](Expected<platform::RelayArguments> result) { error = result.error().reason; });
-  device.run();
+  const std::string error =
+      diagnose(SBLDiagnosticsRelay::explain, {std::string("SBLCardRequest"), platform::RelayRecord{}});
   EXPECT_NE(error.find("explains a SBLSearchRequest"), std::string::npos) << error;
   EXPECT_TRUE(client->isConnected());
 }
@@ -146,16 +144,7 @@ TEST_F(ExplainTest, ExplainsSearchesOnly) {
 /// Of what a request carried, that which a privacy report tells of requests of its kind: "name=value".
 class PrivacyTest : public ExplainTest {
  protected:
-  json privacy() {
-    json report;
-    client->connection().call(kSBLDiagnosticsRelay, SBLDiagnosticsRelay::privacy, {}, 20s,
-                              [&](Expected<platform::RelayArguments> result) {
-                                ASSERT_TRUE(result) << result.error().reason;
-                                report = json::parse(std::get<std::string>((*result)[0]));
-                              });
-    device.run();
-    return report;
-  }
+  json privacy() { return diagnose(SBLDiagnosticsRelay::privacy, {}); }
 
   static std::set<std::string> told(const json& report, std::string_view request) {
     std::set<std::string> values;
