@@ -294,26 +294,10 @@ TEST(FeedbackTranslation, IdentifiersLeaveAsNumbersAndWhatWasNeverUsedIsMissing)
   EXPECT_TRUE(helper.missingSuggestions().empty());
 }
 
-TEST(FeedbackTranslation, AMessageTellsWhatItsWayDependsOn) {
+TEST(FeedbackTranslation, ARankingIsOfTheQueryOfWhatItRanked) {
   const std::string ranked = R"({"sections": [{"results": [{"result": {"queryId": "9"}}]}]})";
   EXPECT_EQ(message("_SKSBLRankerFeedback", ranked)->clientQueryId(), 9u);
   EXPECT_EQ(message("RKRankingFeedback", R"({"sections": [{}]})")->clientQueryId(), 0u);
-  EXPECT_EQ(message("_SKStartLocalSearchFeedback", R"({"queryId": "4"})")->clientQueryId(), 4u);
-  EXPECT_EQ(message("_SKSkipSearchFeedback", "{}")->clientQueryId(), 0u);
-  const auto engagement =
-      message("RKResultEngagementFeedback", R"({"completedQuery": "q", "result": {"type": 1, "topHit": 2}})")
-          ->resultEngagement();
-  ASSERT_TRUE(engagement);
-  EXPECT_TRUE(engagement->topHit && engagement->resultType == 1 && engagement->completedQuery == "q");
-  const auto appearance =
-      message("_SKSearchViewAppearFeedback", R"({"viewAppearEvent": 24, "onLockScreen": true})")
-          ->searchViewAppearance();
-  ASSERT_TRUE(appearance);
-  EXPECT_TRUE(appearance->onLockScreen && appearance->viewAppearEvent == 24);
-  EXPECT_EQ(message("RKCustomFeedback", R"({"feedbackType": 2, "jsonFeedback": "{}"})")->customFeedbackType(),
-            2u);
-  const auto other = message("RKEndSearchFeedback", "{}");
-  EXPECT_FALSE(other->resultEngagement() || other->searchViewAppearance() || other->customFeedbackType());
 }
 
 TEST(FeedbackTranslation, TheDaemonReportsOfItself) {
