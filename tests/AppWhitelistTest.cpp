@@ -8,7 +8,6 @@
 #include "sabled/AppWhitelistController.h"
 #include "sabled/DownloadManager.h"
 #include "sabled/RunLengthCode.h"
-#include "sabled/SableBagController.h"
 #include "tests/support/VirtualDevice.h"
 
 namespace sable::test {
@@ -158,11 +157,10 @@ struct AppWhitelistControllerTest : testing::Test {
   /// The service offers this list, and the device downloads it.
   void publish(const std::string& list) {
     device.service.on("/resources", answering(list));
-    device.bag["version"] = std::to_string(++version_);
     device.bag["download_resources_list"] = {"installed_app_whitelist"};
     device.bag["installed_app_whitelist"] =
-        fmt::format("https://service.test/resources/apps?version={}", version_);
-    device.assembly().bagController->forceFetchBag({{"bag", version_}});
+        fmt::format("https://service.test/resources/apps?version={}", ++version_);
+    device.publishBag();
     device.advance(70s);
   }
   /// The signature that a request of `Request` carries now.
@@ -182,7 +180,7 @@ struct AppWhitelistControllerTest : testing::Test {
 
  private:
   std::uint64_t queryId_ = 0;
-  int version_ = 1;
+  int version_ = 0;
 };
 
 TEST_F(AppWhitelistControllerTest, AListThatArrivesMakesASignatureForRequests) {

@@ -7,7 +7,6 @@
 #include "sabled/ClientSessionManager.h"
 #include "sabled/FeedbackLedger.h"
 #include "sabled/FileContainer.h"
-#include "sabled/SableBagController.h"
 #include "sabled/SablePersistentStorage.h"
 #include "tests/support/Feedback.h"
 #include "tests/support/VirtualDevice.h"
@@ -106,9 +105,7 @@ TEST_F(FeedbackLedger, ARecordThatReachesNoFileSaysWhy) {
   expectEnded(unwritten, 2);
 
   device.bag["feedback_enabled"] = false;
-  device.bag["version"] = 2;
-  device.assembly().bagController->forceFetchBag({{"bag", 2}});
-  device.advance(1s);
+  device.publishBag();
   report(4);
   expectEnded(bagDisabled, 4);
 }
