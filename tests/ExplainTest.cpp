@@ -108,14 +108,6 @@ TEST_F(ExplainTest, TellsTheGateThatStopsASearch) {
   EXPECT_EQ(explain(searchFor("weather"))["outcome"], "nothing");
 }
 
-TEST_F(ExplainTest, WithoutABagASearchEndsInAnError) {
-  device.service.on("/bag", answering("", 500));
-  start();
-  const json explanation = explain(searchFor("weather"));
-  EXPECT_EQ(stoppedBy(explanation), "bag: none");
-  EXPECT_EQ(explanation["outcome"], "error");
-}
-
 TEST_F(ExplainTest, TellsTheRuleThatChoseOrDroppedEachCandidate) {
   start().search("wea");
   const json cached = explain(searchFor("weat"));
@@ -242,10 +234,12 @@ TEST_F(PrivacyTest, WhatIsNotAskedForSaysWhyAndTellsNothing) {
   EXPECT_TRUE(told(messages, "card").contains("geosrc=bagno.all"));
 }
 
-TEST_F(PrivacyTest, WithoutABagOnlyTheRequestForItIsThere) {
+TEST_F(PrivacyTest, WithoutABagASearchEndsInAnErrorAndOnlyTheRequestForTheBagIsThere) {
   device.service.on("/bag", answering("", 500));
   start();
-  const json report = privacy();
+  const json explanation = explain(searchFor("weather")), report = privacy();
+  EXPECT_EQ(stoppedBy(explanation), "bag: none");
+  EXPECT_EQ(explanation["outcome"], "error");
   EXPECT_TRUE(report["bag"].is_null());
   EXPECT_TRUE(told(report, "search").empty());
   EXPECT_EQ(told(report, "bag"), carried("/bag"));
