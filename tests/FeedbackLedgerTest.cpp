@@ -46,10 +46,6 @@ class FeedbackLedger : public testing::Test {
     handOver();
     before = counters();
   }
-  void restart() {
-    device.killDaemon();
-    startDaemon();
-  }
   SBLFeedbackLedger ledger() { return SBLFeedbackLedger(device.platform.tally().snapshot()); }
   using Counters = std::map<std::string, std::int64_t>;
   Counters counters() { return device.platform.tally().snapshot(); }
@@ -163,40 +159,6 @@ TEST_F(FeedbackLedger, AFileThatIsNotHandedOverSaysWhy) {
   EXPECT_EQ(ledger().stored(), 0);
 }
 
-TEST_F(FeedbackLedger, WhatIsUploadedIsCountedByTheServicesAnswer) {
-  device.bag["feedback_url"] = "https://service.test/feedback";
-  int status = 200;
-  device.service.on("/feedback", [&](const platform::HTTPRequest&) { return answering("", status); });
-  start();
-  const auto upload = [&] {
-    report(3);
-    device.assembly().clientSessionManager->flushSession(nullptr);
-    device.run();
-    device.assembly().backgroundFlusher->insertFlushActivity(0);
-    device.advance(1min);
-    EXPECT_EQ(ledger().sending(), 0);
-    EXPECT_EQ(ledger().stored(), 0);
-    EXPECT_EQ(ledger().waiting(), 0);
-  };
-  upload();
-  expectEnded(uploaded, 4);
-  status = 500;
-  upload();
-  expectEnded(refused, 4);
-  EXPECT_EQ(grown(taken), 8);
-
-  report(3);
-  device.assembly().clientSessionManager->flushSession(nullptr);
-  device.run();
-  device.service.setDefaultLatency(1h);
-  device.assembly().backgroundFlusher->insertFlushActivity(0);
-  device.advance(1s);
-  EXPECT_EQ(ledger().sending(), 4);
-  restart();
-  EXPECT_EQ(ledger().sending() + grown(refused) + grown(uploaded), 12) << "it is still under way";
-  EXPECT_EQ(grown(lostSending), 0);
-}
-
 TEST_F(FeedbackLedger, FilesThatComeAndGoWhileNoDaemonRunsAreNoticed) {
   start();
   report(3);
@@ -215,7 +177,8 @@ TEST_F(FeedbackLedger, FilesThatComeAndGoWhileNoDaemonRunsAreNoticed) {
   report(5);
   device.advance(72h);
   const auto old = ledger().stored();
-  restart();
+  device.killDaemon();
+  startDaemon();
   EXPECT_GE(old, 5);
   EXPECT_GE(grown(tooOld), 5);
   EXPECT_EQ(grown(fileCounterOf(tooOld)), device.counter("filetooold"));

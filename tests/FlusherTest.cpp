@@ -264,8 +264,10 @@ TEST_F(Flusher, CountsOfUploadsOutliveTheProcess) {
   device.killDaemon();
   device.service.on("/feedback", answering("{}"));
   device.start();
+  EXPECT_EQ(ledger().sending(), 3) << "it is still under way";
   device.advance(2h);
   EXPECT_EQ(device.counter("feedbacksent"), 3);
+  EXPECT_EQ(ledger()[SBLLedgerEntry::uploaded], 3);
   EXPECT_EQ(ledger().sending(), 0);
   EXPECT_EQ(ledger()[SBLLedgerEntry::lostSending], 0);
 }

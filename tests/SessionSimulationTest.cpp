@@ -322,28 +322,25 @@ class Week {
   Seen seen_;
 };
 
-class Simulation : public testing::Test {
- protected:
-  /// Several weeks, until one fails.
-  Seen simulate(Week::Setting setting, std::uint64_t seeds) {
-    Seen all;
-    for (setting.seed = 1; setting.seed <= seeds && !HasFailure(); ++setting.seed) {
-      SCOPED_TRACE("seed " + std::to_string(setting.seed));
-      const Seen week = Week(setting).run();
-      for (const auto& [reason, count] : week.ends) all.ends[reason] += count;
-      all.feedbacks += week.feedbacks;
-      all.truncated += week.truncated;
-      all.firstUses += week.firstUses;
-      all.unwanted += week.unwanted;
-      all.lost += week.lost;
-      all.kills += week.kills;
-      all.cut += week.cut;
-    }
-    return all;
+/// Several weeks, until one fails.
+Seen simulate(Week::Setting setting, std::uint64_t seeds) {
+  Seen all;
+  for (setting.seed = 1; setting.seed <= seeds && !testing::Test::HasFailure(); ++setting.seed) {
+    SCOPED_TRACE("seed " + std::to_string(setting.seed));
+    const Seen week = Week(setting).run();
+    for (const auto& [reason, count] : week.ends) all.ends[reason] += count;
+    all.feedbacks += week.feedbacks;
+    all.truncated += week.truncated;
+    all.firstUses += week.firstUses;
+    all.unwanted += week.unwanted;
+    all.lost += week.lost;
+    all.kills += week.kills;
+    all.cut += week.cut;
   }
-};
+  return all;
+}
 
-TEST_F(Simulation, OfClientsThatShareTheirSessions) {
+TEST(Simulation, OfClientsThatShareTheirSessions) {
   const Seen seen = simulate({.shared = true}, 4);
   for (const char* reason :
        {"external request", "session idle", "max session time passed", "guid changed", "engagement received"})
@@ -356,13 +353,13 @@ TEST_F(Simulation, OfClientsThatShareTheirSessions) {
   EXPECT_GT(seen.cut, 5);
 }
 
-TEST_F(Simulation, OfClientsWithSessionsOfTheirOwn) {
+TEST(Simulation, OfClientsWithSessionsOfTheirOwn) {
   const Seen seen = simulate({.shared = false}, 4);
   for (const char* reason : {"external request", "session idle", "max session time passed", "guid changed"})
     EXPECT_GT(seen.ends.find(reason) == seen.ends.end() ? 0 : seen.ends.at(reason), 5) << reason;
 }
 
-TEST_F(Simulation, OfFilesThatReachTheirLimit) {
+TEST(Simulation, OfFilesThatReachTheirLimit) {
   EXPECT_GT(simulate({.shared = true, .sizeLimit = 600}, 2).truncated, 20);
 }
 
