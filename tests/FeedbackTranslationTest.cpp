@@ -294,10 +294,11 @@ TEST(FeedbackTranslation, IdentifiersLeaveAsNumbersAndWhatWasNeverUsedIsMissing)
   EXPECT_TRUE(helper.missingSuggestions().empty());
 }
 
-TEST(FeedbackTranslation, ARankingIsOfTheQueryOfWhatItRanked) {
+TEST(FeedbackTranslation, AMessageTellsWhatItsWayDependsOn) {
   const std::string ranked = R"({"sections": [{"results": [{"result": {"queryId": "9"}}]}]})";
   EXPECT_EQ(message("_SKSBLRankerFeedback", ranked)->clientQueryId(), 9u);
   EXPECT_EQ(message("RKRankingFeedback", R"({"sections": [{}]})")->clientQueryId(), 0u);
+  EXPECT_FALSE(message("RKResultEngagementFeedback", "{}")->resultEngagement()->topHit);
 }
 
 TEST(FeedbackTranslation, TheDaemonReportsOfItself) {
