@@ -173,13 +173,21 @@ TEST_F(BagController, ABagThatIsNeverToBeRefreshedIsNot) {
   EXPECT_EQ(device.sent("/bag"), 1u);
 }
 
-TEST_F(BagController, TheNewsClientsAvailabilityIsAnnouncedWhenItChanges) {
+TEST_F(BagController, WhichClientsItServesIsInSettingsAndForNewsAnnouncedWhenItChanges) {
+  const auto visible = [&](const char* key) { return device.platform.userDefaults().boolean(key); };
   device.start();
   device.publishBag();
   device.bag["agents"] = {{"news", {{"enabled", false}}}};
   device.publishBag();
+  EXPECT_EQ(visible("SBLNewsVisible"), false);
+  EXPECT_EQ(visible("SBLHashtagImagesVisible"), true);
   EXPECT_EQ(device.platform.notify().posted(),
             (std::vector<std::string>{"com.kestrel.sable.enabled", "com.kestrel.sable.disabled"}));
+  EXPECT_EQ(device.platform.transactions().openCount(), 0u);
+  device.bag["agents"] = {{"messages", {{"enabled", false}}}};
+  device.publishBag();
+  EXPECT_EQ(visible("SBLNewsVisible"), true);
+  EXPECT_EQ(visible("SBLHashtagImagesVisible"), false);
 }
 
 }  // namespace

@@ -256,19 +256,6 @@ TEST_F(Location, DownloadsTellWhereTheLastSearchWas) {
 
 class Context : public Location {};
 
-TEST_F(Context, TheBagTellsWhichClientsItServesInSettings) {
-  device.bag["agents"] = {{"news", {{"enabled", false}}}};
-  device.start();
-  const auto visible = [&](const char* key) { return device.platform.userDefaults().boolean(key); };
-  EXPECT_EQ(visible("SBLNewsVisible"), false);
-  EXPECT_EQ(visible("SBLHashtagImagesVisible"), true);
-  EXPECT_EQ(device.platform.transactions().openCount(), 0u);
-  device.bag["agents"] = {{"messages", {{"enabled", false}}}};
-  device.publishBag();
-  EXPECT_EQ(visible("SBLNewsVisible"), true);
-  EXPECT_EQ(visible("SBLHashtagImagesVisible"), false);
-}
-
 TEST_F(Context, TheMapsSessionIsInHeaders) {
   device.platform.mapsService().sessions = {{"id-1", "entity-1"}, {"id-2", "entity-2"}};
   device.start();
