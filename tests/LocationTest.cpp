@@ -128,15 +128,12 @@ TEST_F(Location, EveryReasonForNoneIsOnTheWire) {
   deliver(1);
   EXPECT_EQ(searched(), "51.500000,-0.100000 gps");
   location.fail();
-  device.run();
   EXPECT_EQ(searched(), "- error.fail");
   location.deliver({91, 0, 1, device.platform.runtime().now()});
-  device.run();
   EXPECT_EQ(searched(), "- error.fail") << "no place on Earth";
   deliver(5);
   EXPECT_EQ(searched(), "51.500000,-0.100000 wifi");
   location.authorize(LocationAuthorization::denied);
-  device.run();
   EXPECT_EQ(searched(), "- userno") << "revoked: what was known is forgotten";
   location.authorize(LocationAuthorization::whenInUse);
   device.run();
@@ -145,7 +142,6 @@ TEST_F(Location, EveryReasonForNoneIsOnTheWire) {
   EXPECT_EQ(searched(), "51.500000,-0.100000 wifi");
   location.enabled = false;
   location.authorize(LocationAuthorization::whenInUse);
-  device.run();
   EXPECT_EQ(searched(), "- userno") << "location services are off";
 }
 
