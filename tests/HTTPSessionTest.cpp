@@ -1,7 +1,6 @@
 #include <gtest/gtest.h>
 #include <zlib.h>
 
-#include <filesystem>
 #include <functional>
 #include <nlohmann/json.hpp>
 
@@ -10,6 +9,7 @@
 #include "platform/host/HostHTTPSession.h"
 #include "platform/simulated/SimulatedPlatform.h"
 #include "tests/support/LoopbackServer.h"
+#include "tests/support/TemporaryFolder.h"
 
 namespace sable::platform {
 namespace {
@@ -18,6 +18,7 @@ using host::HostHTTPSessions;
 using host::HostRuntime;
 using tests::LoopbackServer;
 using Then = LoopbackServer::Reply::Then;
+using Fields = std::vector<std::pair<std::string, std::string>>;
 
 class HostSession : public ::testing::Test {
  protected:
@@ -43,9 +44,10 @@ class HostSession : public ::testing::Test {
     return result;
   }
 
-  HTTPRequest request(const std::string& path, std::string method = "GET") {
+  HTTPRequest request(const std::string& path, std::string method = "GET", const Fields& fields = {}) {
     HTTPRequest request = get(server_.url(path));
     request.method = std::move(method);
+    for (const auto& [name, value] : fields) request.headers.add(name, value);
     return request;
   }
 
@@ -66,7 +68,8 @@ class HostSession : public ::testing::Test {
   HostRuntime runtime_{2};
   LoopbackServer server_{runtime_};
   NotificationCenter center_;
-  HostHTTPSessions sessions_{runtime_, std::filesystem::path(), {center_, nullptr, {}}};
+  TemporaryFolder folder_;
+  HostHTTPSessions sessions_{runtime_, folder_.path(), {center_, nullptr, {}}};
 };
 
 TEST_F(HostSession, ResponsesArriveWhole) {
@@ -79,8 +82,7 @@ TEST_F(HostSession, ResponsesArriveWhole) {
   EXPECT_EQ(result.response->status, 200);
   EXPECT_EQ(result.response->url, server_.url("/ok"));
   EXPECT_FALSE(result.response->fromCache);
-  const std::vector<std::pair<std::string, std::string>> fields{
-      {"Set-X", "1"}, {"Set-X", "2"}, {"x-y", ""}, {"Content-Length", "100000"}};
+  const Fields fields{{"Set-X", "1"}, {"Set-X", "2"}, {"x-y", ""}, {"Content-Length", "100000"}};
   EXPECT_EQ(result.response->headers.fields(), fields);
   EXPECT_EQ(load(*session, request("/missing")).response->status, 404);
 }
@@ -91,7 +93,6 @@ TEST_F(HostSession, RequestsLeaveAsTheyWereMade) {
   const std::string host = "Host: 127.0.0.1:" + std::to_string(server_.port()) + "\r\n";
   const std::string encodings = "Accept-Encoding: deflate, gzip, br, zstd\r\n";
   const std::string usual = host + "Accept: */*\r\n" + encodings;
-  using Fields = std::vector<std::pair<std::string, std::string>>;
   const Fields odd{{"X-Empty", ""}, {"X-Blank", "  "}, {"User-Agent", "a b"}, {"X", "1"}, {"X", "2"}};
   const Fields json{{"Content-Type", "application/json"}};
   const struct {
@@ -111,8 +112,7 @@ TEST_F(HostSession, RequestsLeaveAsTheyWereMade) {
       {"HEAD", nullptr, {}, usual + "\r\n"},
   };
   for (const auto& row : rows) {
-    HTTPRequest request = this->request("/a/../r?q=%2b+;#f", row.method);
-    for (const auto& [name, value] : row.headers) request.headers.add(name, value);
+    HTTPRequest request = this->request("/a/../r?q=%2b+;#f", row.method, row.headers);
     request.body = row.body;
     const auto result = load(*session, std::move(request));
     ASSERT_FALSE(result.error) << result.error->description();
@@ -142,8 +142,7 @@ TEST_F(HostSession, InvalidRequestsEndBeforeAnythingIsSent) {
   };
   const auto session = this->session();
   for (const auto& row : rows) {
-    HTTPRequest request;
-    request.url = row.url;
+    HTTPRequest request = get(row.url);
     request.method = row.method;
     request.headers.add(row.name, row.value);
     EXPECT_EQ(codeOf(load(*session, std::move(request))), row.code) << row.url << row.method << row.value;
@@ -161,7 +160,6 @@ TEST_F(HostSession, WhatGoesWrongHasACodeAndKeepsWhatCame) {
   const std::string gzip = head + "Content-Encoding: gzip\r\nContent-Length: 4\r\n\r\nabcd";
   const std::string longHeaders = LoopbackServer::ok("", "X: " + std::string(2000, 'x') + "\r\n");
   const std::string endless = head + "\r\n" + std::string(100000, 'x'), allowed(1000, 'x');
-  const std::nullopt_t none = std::nullopt;
   const struct {
     std::string name;
     LoopbackServer::Reply reply;
@@ -170,21 +168,21 @@ TEST_F(HostSession, WhatGoesWrongHasACodeAndKeepsWhatCame) {
   } rows[] = {
       {"cut body", {cut, Then::close}, badResponse, "abc"},
       {"cut chunks", {chunked + "3\r\nabc\r\n", Then::close}, badResponse, "abc"},
-      {"no chunks", {chunked + "zz\r\n", Then::close}, badResponse, none},
-      {"cut headers", {head + "Content-Le", Then::close}, badResponse, none},
-      {"not HTTP", {"SSH-2.0-x\r\n", Then::close}, badResponse, none},
-      {"bad gzip", {gzip}, badResponse, none},
-      {"nothing", {"", Then::close}, connectionLost, none},
+      {"no chunks", {chunked + "zz\r\n", Then::close}, badResponse, {}},
+      {"cut headers", {head + "Content-Le", Then::close}, badResponse, {}},
+      {"not HTTP", {"SSH-2.0-x\r\n", Then::close}, badResponse, {}},
+      {"bad gzip", {gzip}, badResponse, {}},
+      {"nothing", {"", Then::close}, connectionLost, {}},
       {"reset", {cut, Then::reset}, connectionLost, "abc"},
-      {"stalled headers", {head, Then::stall}, timedOut, none},
+      {"stalled headers", {head, Then::stall}, timedOut, {}},
       {"stalled body", {cut, Then::stall}, timedOut, "abc"},
       {"long body", {LoopbackServer::ok(allowed + "x")}, responseTooLarge, allowed},
       {"endless body", {endless, Then::stall}, responseTooLarge, allowed},
-      {"long headers", {longHeaders}, responseTooLarge, none},
-      {"one huge header", {head + "X: " + std::string(200000, 'x'), Then::stall}, responseTooLarge, none},
-      {"redirect to ftp", redirect("ftp://h/"), notAllowed, none},
-      {"redirect to nowhere", redirect("http://"), badURL, none},
-      {"redirect loop", redirect("/fault"), tooManyRedirects, none},
+      {"long headers", {longHeaders}, responseTooLarge, {}},
+      {"one huge header", {head + "X: " + std::string(200000, 'x'), Then::stall}, responseTooLarge, {}},
+      {"redirect to ftp", redirect("ftp://h/"), notAllowed, {}},
+      {"redirect to nowhere", redirect("http://"), badURL, {}},
+      {"redirect loop", redirect("/fault"), tooManyRedirects, {}},
   };
   const auto session = this->session([](auto& to) {
     to.maximumResponseBytes = to.maximumHeaderBytes = 1000;
@@ -370,6 +368,64 @@ TEST_F(HostSession, IdleConnectionsAreClosedAndReplaced) {
   const auto patient = this->session();
   EXPECT_FALSE(load(*patient, request("/last")).error);
   EXPECT_EQ(*load(*patient, request("/ok")).data, "x");
+}
+
+TEST_F(HostSession, ACacheAsksTheServerOnlyForWhatItMust) {
+  const auto cached = [](auto& to) {
+    to.allowsCache = true;
+    to.cacheMemoryCapacity = to.cacheDiskCapacity = 1 << 20;
+  };
+  auto session = this->session(cached);
+  const auto load = [&](const std::string& path, const Fields& fields = {}, std::string method = "GET",
+                        HTTPCachePolicy policy = HTTPCachePolicy::useProtocol) {
+    HTTPRequest request = this->request(path, std::move(method), fields);
+    request.cachePolicy = policy;
+    auto result = HostSession::load(*session, std::move(request));
+    EXPECT_FALSE(result.error);
+    return result;
+  };
+  const auto asked = [&] { return server_.requests().size(); };
+
+  server_.on("/fresh", LoopbackServer::ok("fresh", "Cache-Control: max-age=600\r\nVary: X\r\n"));
+  EXPECT_FALSE(load("/fresh").response->fromCache);
+  const auto second = load("/fresh");
+  EXPECT_TRUE(second.response->fromCache);
+  EXPECT_EQ(*second.data, "fresh");
+  EXPECT_NE(second.response->headers.find("Age"), nullptr);
+  EXPECT_EQ(asked(), 1u);
+  EXPECT_FALSE(load("/fresh", {{"X", "other"}}).response->fromCache);
+  EXPECT_FALSE(load("/fresh", {}, "GET", HTTPCachePolicy::ignoreLocal).response->fromCache);
+  EXPECT_FALSE(load("/fresh", {{"Range", "bytes=0-1"}}).response->fromCache);
+  EXPECT_EQ(asked(), 4u);
+
+  session->purgeMemoryCache();
+  EXPECT_TRUE(load("/fresh").response->fromCache);
+  session = nullptr;
+  session = this->session(cached);
+  EXPECT_TRUE(load("/fresh").response->fromCache) << "the file outlives the session";
+  EXPECT_EQ(asked(), 4u);
+  load("/fresh", {}, "POST");
+  EXPECT_FALSE(load("/fresh").response->fromCache);
+
+  server_.on("/checked", [](const std::string& request) -> LoopbackServer::Reply {
+    if (request.find("If-None-Match: \"1\"\r\n") == std::string::npos)
+      return {LoopbackServer::ok("checked", "ETag: \"1\"\r\nX: old\r\n")};
+    return {"HTTP/1.1 304 Not Modified\r\nX: new\r\n\r\n"};
+  });
+  EXPECT_FALSE(load("/checked").response->fromCache);
+  const auto validated = load("/checked");
+  EXPECT_TRUE(validated.response->fromCache);
+  EXPECT_EQ(validated.response->status, 200);
+  EXPECT_EQ(*validated.response->headers.find("X"), "new");
+  EXPECT_EQ(*validated.data, "checked");
+  EXPECT_EQ(load("/checked", {{"If-None-Match", "\"1\""}}).response->status, 304)
+      << "the caller's own condition";
+
+  server_.on("/moved", "HTTP/1.1 302 F\r\nLocation: /fresh\r\nContent-Length: 0\r\n\r\n");
+  const auto before = asked();
+  load("/moved");
+  load("/moved");
+  EXPECT_EQ(asked(), before + 4) << "what a redirect led to is not kept under the first URL";
 }
 
 TEST(ScriptedSession, LimitsAndCancellingEndATaskOnce) {

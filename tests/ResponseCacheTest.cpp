@@ -4,11 +4,9 @@
 #include <fstream>
 
 #include "platform/host/CacheFile.h"
-#include "platform/host/HostHTTPSession.h"
 #include "platform/host/ResponseCache.h"
 #include "platform/simulated/SimulatedLog.h"
 #include "platform/simulated/SimulatedRuntime.h"
-#include "tests/support/LoopbackServer.h"
 #include "tests/support/TemporaryFolder.h"
 
 namespace sable::platform::host {
@@ -263,77 +261,6 @@ TEST_F(CacheInAFolder, WithoutAFileMemoryStillServes) {
   EXPECT_EQ(bodyOf(*cache, "a"), std::nullopt);
   runtime_.run();
   EXPECT_EQ(log.count(LogLevel::error), 1u);
-}
-
-TEST_F(CacheInAFolder, ASessionAsksTheServerOnlyForWhatItMust) {
-  HostRuntime runtime(2);
-  tests::LoopbackServer server(runtime);
-  NotificationCenter center;
-  HostHTTPSessions sessions(runtime, folder_.path(), {center, nullptr, {}});
-  HTTPSessionConfiguration configuration;
-  configuration.label = "cached";
-  configuration.allowsCache = true;
-  configuration.cacheMemoryCapacity = configuration.cacheDiskCapacity = 1 << 20;
-  auto session = sessions.session(configuration);
-  const auto load = [&](const std::string& path, const Fields& fields = {}, std::string method = "GET",
-                        HTTPCachePolicy policy = HTTPCachePolicy::useProtocol) {
-    HTTPRequest request = get(fields);
-    request.url = server.url(path);
-    request.method = std::move(method);
-    request.cachePolicy = policy;
-    HTTPResult result;
-    const auto done = runtime.semaphore(0);
-    const auto task = session->dataTask(std::move(request), [&](HTTPResult got) {
-      result = std::move(got);
-      done->signal();
-    });
-    task->resume();
-    EXPECT_TRUE(done->wait(MonotonicTime::max()));
-    EXPECT_FALSE(result.error);
-    return result;
-  };
-  const auto asked = [&] { return server.requests().size(); };
-
-  server.on("/fresh", tests::LoopbackServer::ok("fresh", "Cache-Control: max-age=600\r\nVary: X\r\n"));
-  EXPECT_FALSE(load("/fresh").response->fromCache);
-  const auto second = load("/fresh");
-  EXPECT_TRUE(second.response->fromCache);
-  EXPECT_EQ(*second.data, "fresh");
-  EXPECT_NE(second.response->headers.find("Age"), nullptr);
-  EXPECT_EQ(asked(), 1u);
-  EXPECT_FALSE(load("/fresh", {{"X", "other"}}).response->fromCache);
-  EXPECT_FALSE(load("/fresh", {}, "GET", HTTPCachePolicy::ignoreLocal).response->fromCache);
-  EXPECT_FALSE(load("/fresh", {{"Range", "bytes=0-1"}}).response->fromCache);
-  EXPECT_EQ(asked(), 4u);
-
-  session->purgeMemoryCache();
-  EXPECT_TRUE(load("/fresh").response->fromCache);
-  session = nullptr;
-  session = sessions.session(configuration);
-  EXPECT_TRUE(load("/fresh").response->fromCache) << "the file outlives the session";
-  EXPECT_EQ(asked(), 4u);
-  load("/fresh", {}, "POST");
-  EXPECT_FALSE(load("/fresh").response->fromCache);
-
-  server.on("/checked", [](const std::string& request) -> tests::LoopbackServer::Reply {
-    if (request.find("If-None-Match: \"1\"\r\n") == std::string::npos)
-      return {tests::LoopbackServer::ok("checked", "ETag: \"1\"\r\nX: old\r\n")};
-    return {"HTTP/1.1 304 Not Modified\r\nX: new\r\n\r\n"};
-  });
-  EXPECT_FALSE(load("/checked").response->fromCache);
-  const auto validated = load("/checked");
-  EXPECT_TRUE(validated.response->fromCache);
-  EXPECT_EQ(validated.response->status, 200);
-  EXPECT_EQ(*validated.response->headers.find("X"), "new");
-  EXPECT_EQ(*validated.data, "checked");
-  EXPECT_EQ(load("/checked", {{"If-None-Match", "\"1\""}}).response->status, 304)
-      << "the caller's own condition";
-
-  server.on("/moved", "HTTP/1.1 302 F\r\nLocation: /fresh\r\nContent-Length: 0\r\n\r\n");
-  const auto before = asked();
-  load("/moved");
-  load("/moved");
-  EXPECT_EQ(asked(), before + 4) << "what a redirect led to is not kept under the first URL";
 }
 
 }  // namespace
