@@ -64,18 +64,15 @@ class Images : public testing::Test {
   }
 
   Loaded load(const std::vector<SBLImageDescription>& descriptions, platform::Duration wait = 30s) {
-    const auto now = device.platform.runtime().ticks();
-    return loadUntil(descriptions, wait > 0s ? now + wait : platform::MonotonicTime());
-  }
-
-  Loaded loadUntil(const std::vector<SBLImageDescription>& descriptions, platform::MonotonicTime deadline) {
+    const auto deadline = device.platform.runtime().ticks() + wait;
     std::optional<Loaded> loaded;
     const auto client = application();
-    client->loadImages(descriptions, deadline, [&](Expected<SBLClient::Images> images) {
-      ASSERT_TRUE(images) << images.error().description();
-      loaded.emplace();
-      for (const auto& [name, image] : *images) loaded->emplace(name, *image);
-    });
+    client->loadImages(descriptions, wait > 0s ? deadline : platform::MonotonicTime(),
+                       [&](Expected<SBLClient::Images> images) {
+                         ASSERT_TRUE(images) << images.error().description();
+                         loaded.emplace();
+                         for (const auto& [name, image] : *images) loaded->emplace(name, *image);
+                       });
     EXPECT_TRUE(device.platform.runtime().runUntil([&] { return loaded.has_value(); }, 400s));
     client->disconnect();
     return loaded.value_or(Loaded());
@@ -169,14 +166,14 @@ TEST_F(Images, WithoutABagNothingIsLoaded) {
   EXPECT_EQ(device.sent("/1"), 0u);
 }
 
-TEST_F(Images, WhatIsLateIsLeftOutAndThereTheNextTime) {
+TEST_F(Images, WhatIsLateIsLeftOutAndThereTheNextTimeThoughAskedForOnce) {
   startVouchingFor({"img.test"});
   device.service.on("/slow", after(2s, answering("slow")));
-  const std::vector<SBLImageDescription> both{at("http://img.test/quick"), at("http://img.test/slow")};
-  EXPECT_THAT(load(both, 0s), IsEmpty()) << "without waiting there is nothing yet";
-  EXPECT_THAT(load(both, 1s), ElementsAre(Pair("http://img.test/quick", testing::_)));
-  device.advance(2s);
-  EXPECT_THAT(load(both, 0s), testing::SizeIs(2)) << "memory needs no waiting";
+  const SBLImageDescription quick = at("http://img.test/quick"), slow = at("http://img.test/slow");
+  EXPECT_THAT(load({quick, slow}, 0s), IsEmpty()) << "without waiting there is nothing yet";
+  EXPECT_THAT(load({quick, slow}, 1s), ElementsAre(Pair(*quick.url, testing::_)));
+  EXPECT_THAT(load({slow, slow}), ElementsAre(Pair(*slow.url, testing::_))) << "for all who want it";
+  EXPECT_THAT(load({quick, slow}, 0s), testing::SizeIs(2)) << "memory needs no waiting";
   EXPECT_EQ(device.service.requests("/").size(), 2u);
 }
 
@@ -188,27 +185,8 @@ TEST_F(Images, NoDeadlineOutlastsTheTimeoutOfARequest) {
   device.service.on("/step",
                     [](const HTTPRequest& request) { return after(4s, redirectingTo(request.url + "x")); });
   const auto start = device.platform.runtime().ticks();
-  EXPECT_THAT(
-      loadUntil({at("http://img.test/never"), at("http://img.test/step")}, platform::MonotonicTime::max()),
-      IsEmpty());
+  EXPECT_THAT(load({at("http://img.test/never"), at("http://img.test/step")}, 1h), IsEmpty());
   EXPECT_LE(device.platform.runtime().ticks() - start, 11s);
-}
-
-TEST_F(Images, OneURLIsAskedForOnceHoweverManyWantIt) {
-  startVouchingFor({"img.test"});
-  device.service.on("/shared", after(1s, answering("shared")));
-  std::vector<std::size_t> counts;
-  std::vector<std::shared_ptr<SBLClient>> clients;
-  const auto deadline = device.platform.runtime().ticks() + 5s;
-  for (int i = 0; i < 3; ++i) {
-    clients.push_back(application());
-    clients.back()->loadImages(
-        {at("http://img.test/shared"), at("http://img.test/shared")}, deadline,
-        [&](Expected<SBLClient::Images> images) { counts.push_back(images ? images->size() : 0); });
-  }
-  device.advance(6s);
-  EXPECT_THAT(counts, ElementsAre(1, 1, 1));
-  EXPECT_EQ(device.sent("/shared"), 1u);
 }
 
 TEST_F(Images, AreKeptForAnHourUnlessTheServiceForbidsIt) {
