@@ -5,29 +5,24 @@
 #include <cmath>
 
 #include "platform/TransferRetry.h"
-#include "platform/simulated/SimulatedPlatform.h"
 #include "tests/support/Fleet.h"
+#include "tests/support/VirtualDevice.h"
 
 namespace sable::platform {
 namespace {
 
 using namespace std::chrono_literals;
 using simulated::Scripted;
+using test::after;
+using test::answering;
+using test::failing;
 using ::testing::ElementsAre;
 
 constexpr const char* kURL = "https://service.test/feedback";
 
-Scripted answering(int status, const std::string& retryAfter = "", std::string body = "") {
-  Scripted answer;
-  answer.status = status;
-  answer.body = std::move(body);
-  if (!retryAfter.empty()) answer.headers.add("Retry-After", retryAfter);
-  return answer;
-}
-
-Scripted failing(HTTPErrorCode code) {
-  Scripted answer;
-  answer.error = code;
+Scripted askingForAPause(int status, std::string seconds) {
+  Scripted answer = answering("", status);
+  answer.headers.add("Retry-After", std::move(seconds));
   return answer;
 }
 
@@ -97,8 +92,8 @@ class VirtualTransfers : public ::testing::Test {
 };
 
 TEST_F(VirtualTransfers, AnEndIsToldOnceWhateverTheStatus) {
-  service_.on("/feedback", answering(500));
-  Scripted redirected = answering(200, "", "hints");
+  service_.on("/feedback", answering("", 500));
+  Scripted redirected = answering("hints");
   redirected.url = "https://cdn.test/resource?version=2";
   service_.on("/resource", redirected);
   upload("a");
@@ -125,7 +120,7 @@ TEST_F(VirtualTransfers, ErrorsAreRetriedWithPausesThatDoubleToAnHour) {
     EXPECT_GE(pause, bound / 2) << i;
     EXPECT_LE(pause, bound + 0.1) << i;
   }
-  service_.on("/feedback", answering(200));
+  service_.on("/feedback", answering(""));
   advance(1h);
   EXPECT_THAT(listener_.words, ElementsAre("sent 5 of 5", "a status 200", "all done"));
 }
@@ -146,9 +141,7 @@ TEST_F(VirtualTransfers, OnlyErrorsThatMayPassAreRetried) {
 TEST_F(VirtualTransfers, AResourceThatTakesTooLongEndsOnceWithATimeOut) {
   service_.on("/feedback", failing(HTTPErrorCode::connectionLost));
   upload("a");
-  Scripted never = answering(200);
-  never.latency = 10000h;
-  service_.on("/resource", never);
+  service_.on("/resource", after(10000h, answering("")));
   download("b");
   advance(7 * 24h - 1s);
   EXPECT_TRUE(listener_.words.empty());
@@ -162,20 +155,20 @@ TEST_F(VirtualTransfers, AResourceThatTakesTooLongEndsOnceWithATimeOut) {
 
 TEST_F(VirtualTransfers, AServiceThatAsksForAPauseGetsIt) {
   for (const auto& [status, pauses] : {std::pair(503, true), {429, true}, {500, false}, {408, false}}) {
-    service_.on("/feedback", answering(status, "7200"));
+    service_.on("/feedback", askingForAPause(status, "7200"));
     upload("a");
     advance(7199s);
     EXPECT_EQ(requests().size(), 1u);
     EXPECT_EQ(listener_.words.size(), pauses ? 1u : 3u) << status;
-    service_.on("/feedback", answering(200));
+    service_.on("/feedback", answering(""));
     advance(3700s);
     EXPECT_EQ(requests().size(), pauses ? 2u : 1u);
     service_.forgetRequests();
     listener_.words.clear();
   }
-  service_.on("/feedback", answering(503, "99999999999999999999"));
+  service_.on("/feedback", askingForAPause(503, "99999999999999999999"));
   upload("too late");
-  service_.on("/resource", answering(503));
+  service_.on("/resource", answering("", 503));
   download("no field");
   advance(1s);
   EXPECT_EQ(listener_.words.at(1), "too late status 503");
@@ -194,7 +187,7 @@ TEST_F(VirtualTransfers, TheNextProcessGoesOnWithWhatTheLastOneLeft) {
   EXPECT_TRUE(listener_.words.empty());
 
   platform_.runtime().jumpWallClock(-48h);
-  service_.on("/", answering(200));
+  service_.on("/", answering(""));
   launch();
   EXPECT_TRUE(session_->hasAccepted("token"));
   EXPECT_FALSE(session_->hasAccepted("other"));
@@ -214,7 +207,7 @@ TEST_F(VirtualTransfers, AfterALongSleepThereIsOneMoreAttempt) {
   advance(1h);
   session_ = nullptr;
   platform_.runtime().jumpWallClock(365 * 24h);
-  service_.on("/feedback", answering(200));
+  service_.on("/feedback", answering(""));
   launch();
   advance(1s);
   EXPECT_EQ(listener_.words.at(1), "a status 200");
@@ -225,7 +218,7 @@ TEST_F(VirtualTransfers, DiscretionaryOnesWaitForPowerAndAFreeNetwork) {
   configuration_.allowsExpensiveNetworkAccess = false;
   launch();
   auto& sessions = platform_.httpSessions();
-  service_.on("/", answering(200));
+  service_.on("/", answering(""));
   sessions.setConditions({true, false});
   upload("a");
   download("b", 24h);
@@ -243,7 +236,7 @@ TEST_F(VirtualTransfers, DiscretionaryOnesWaitForPowerAndAFreeNetwork) {
 }
 
 TEST_F(VirtualTransfers, CancelledAndRefusedOnesLoseNothingElse) {
-  service_.on("/", answering(200));
+  service_.on("/", answering(""));
   platform_.httpSessions().failAccepting(ENOSPC);
   HTTPRequest request;
   request.url = kURL;
