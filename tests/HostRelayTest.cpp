@@ -149,22 +149,15 @@ TEST_F(HostRelayTest, AnyClientOfDBusFindsItsWay) {
               std::string::npos);
   }
   EXPECT_EQ(ask(bus, path, "org.freedesktop.DBus.Properties", "GetAll", "s", "com.kestrel.Test"), "a{sv}");
-  struct Case {
-    std::string answer;
-    std::string error;
-  };
   const char* properties = "org.freedesktop.DBus.Properties";
-  for (const auto& [answer, error] : std::initializer_list<Case>{
+  for (const auto& [answer, error] : std::initializer_list<std::pair<std::string, const char*>>{
            {ask(bus, path, properties, "Get", "ss", "com.kestrel.Test", "P"), "UnknownProperty"},
            {ask(bus, path, properties, "Set", "ssv", "com.kestrel.Test", "P", "b", 1), "UnknownProperty"},
            {ask(bus, path, properties, "GetAll", "s", "com.kestrel.None"), "UnknownInterface"},
-           {ask(bus, path, "com.kestrel.None", "Echo", ""), "UnknownInterface"},
-           {ask(bus, path, "com.kestrel.Test", "None", ""), "UnknownMethod"},
            {ask(bus, path, nullptr, "None", ""), "UnknownMethod"},
            {ask(bus, "/com/kest", "com.kestrel.Test", "Echo", ""), "UnknownObject"},
-           {ask(bus, path, "com.kestrel.Test", "Echo", "s", "text"), "InvalidArgs"},
        }) {
-    EXPECT_EQ(answer, "org.freedesktop.DBus.Error." + error);
+    EXPECT_EQ(answer, std::string("org.freedesktop.DBus.Error.") + error);
   }
   sd_bus_flush_close_unref(bus);
 }

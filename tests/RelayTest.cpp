@@ -224,8 +224,9 @@ class RelayContract : public ::testing::TestWithParam<std::string> {
                      });
   }
 
-  std::shared_ptr<RelayConnection> connect() {
-    auto connection = relay().connect(listener_->endpoint());
+  std::shared_ptr<RelayConnection> connect() { return connect(listener_->endpoint()); }
+  std::shared_ptr<RelayConnection> connect(const RelayEndpoint& endpoint) {
+    auto connection = relay().connect(endpoint);
     EXPECT_TRUE(connection);
     (*connection)->exportObject(kClient, [](RelayCall call) {
       call.reply(std::get<std::string>(call.arguments[0]) + "!");
@@ -367,10 +368,8 @@ TEST_P(RelayContract, AnAnonymousListenerIsFoundByItsEndpointOnly) {
   serve(*listener);
   EXPECT_NE(listener->endpoint(), listener_->endpoint());
   const auto endpoint = listener->endpoint();
-  const auto connection = relay().connect(endpoint);
-  ASSERT_TRUE(connection);
-  (*connection)->resume();
-  call(**connection, kFail);
+  const auto connection = connect(endpoint);
+  call(*connection, kFail);
   EXPECT_EQ(client_->next(), Lines{"com.kestrel.Error.Test as asked"});
   listener.reset();
   EXPECT_FALSE(relay().connect(endpoint));
@@ -380,10 +379,7 @@ TEST_P(RelayContract, ARefusedConnectionEnds) {
   auto listener = relay().anonymousListener();
   listener->setAcceptHandler([](const std::shared_ptr<RelayConnection>&) { return false; });
   ASSERT_TRUE(listener->resume());
-  const auto connection = relay().connect(listener->endpoint());
-  ASSERT_TRUE(connection);
-  (*connection)->setInvalidationHandler([heard = client_] { heard->add("ended"); });
-  (*connection)->resume();
+  const auto connection = connect(listener->endpoint());
   EXPECT_EQ(client_->next(), Lines{"ended"});
 }
 
