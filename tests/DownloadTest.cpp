@@ -20,7 +20,6 @@ namespace sable::test {
 namespace {
 
 using platform::HTTPErrorCode;
-using platform::RelayArguments;
 using platform::simulated::RecordedRequest;
 using platform::simulated::Scripted;
 using ::testing::ElementsAre;
@@ -117,22 +116,14 @@ class Downloads : public testing::Test {
   }
   /// Why a client is handed no file.
   std::string refusal(const std::string& identifier) {
-    const auto answer =
-        call(kSBLDaemonRelay, SBLDaemonRelay::fileHandleAndAttributesForResource, {identifier});
-    const auto error = decodeError(std::get<platform::RelayRecord>(answer.at(2)));
+    const auto answer = device.client().call(
+        kSBLDaemonRelay, SBLDaemonRelay::fileHandleAndAttributesForResource, {identifier});
+    const auto error = decodeError(std::get<platform::RelayRecord>(answer->at(2)));
     return error ? error->reason : "";
   }
   json described() {
-    return json::parse(
-        std::get<std::string>(call(kSBLDiagnosticsRelay, SBLDiagnosticsRelay::resources, {}).at(0)));
-  }
-  RelayArguments call(const platform::RelayInterface& interface, std::size_t method,
-                      RelayArguments arguments) {
-    RelayArguments answer;
-    device.client().connection().call(interface, method, std::move(arguments), 10s,
-                                      [&](Expected<RelayArguments> result) { answer = *result; });
-    device.run();
-    return answer;
+    const auto answer = device.client().call(kSBLDiagnosticsRelay, SBLDiagnosticsRelay::resources);
+    return json::parse(std::get<std::string>(answer->at(0)));
   }
 
   VirtualDevice device;

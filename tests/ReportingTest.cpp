@@ -62,13 +62,9 @@ class Reporting : public testing::Test {
   }
   bool reportBytes(VirtualClient& client, const std::string& className, std::string bytes,
                    std::int64_t queryId) {
-    const auto acknowledged = std::make_shared<bool>(false);
-    client.connection().call(
-        kSBLDaemonRelay, SBLDaemonRelay::reportEvent,
-        {std::uint64_t{0}, queryId, className, std::make_shared<const std::string>(std::move(bytes))}, 5s,
-        [acknowledged](Expected<platform::RelayArguments> answer) { *acknowledged = answer.has_value(); });
-    device.run();
-    return *acknowledged;
+    const auto answer = client.call(kSBLDaemonRelay, SBLDaemonRelay::reportEvent,
+                                    {std::uint64_t{0}, queryId, className, makeData(std::move(bytes))});
+    return answer.has_value();
   }
 
   VirtualDevice device;
@@ -366,20 +362,15 @@ TEST_F(Reporting, TheFeedbackOfTheCurrentSessionIsShownWhereItIsKept) {
   device.start();
   device.assembly().testFeedbacks = true;
   VirtualClient& client = device.client();
-  std::vector<std::string> shown;
-  const auto show = [&] {
-    client.connection().call(kSBLDaemonRelay, SBLDaemonRelay::feedback, {}, 5s, [&](const auto& answer) {
-      shown = std::get<platform::RelayStrings>(answer->at(0));
-    });
-    device.run();
+  const auto shown = [&] {
+    const auto answer = client.call(kSBLDaemonRelay, SBLDaemonRelay::feedback);
+    return std::get<platform::RelayStrings>(answer->at(0));
   };
-  show();
-  EXPECT_THAT(shown, ElementsAre());
+  EXPECT_THAT(shown(), ElementsAre());
   report(client, "RKDidGoToSiteFeedback", R"({"timestamp": "1000000000", "input": "a"})");
   report(client, "RKDidGoToSiteFeedback", R"({"timestamp": "1250000000", "input": "b"})");
-  show();
-  EXPECT_THAT(shown, ElementsAre(R"({"input":"a","query_id":7,"type":"did_go_to_site","timestamp":0})",
-                                 R"({"input":"b","query_id":7,"type":"did_go_to_site","timestamp":250})"));
+  EXPECT_THAT(shown(), ElementsAre(R"({"input":"a","query_id":7,"type":"did_go_to_site","timestamp":0})",
+                                   R"({"input":"b","query_id":7,"type":"did_go_to_site","timestamp":250})"));
 }
 
 }  // namespace

@@ -105,6 +105,16 @@ Answer VirtualClient::ask(SBLAnyRequest request) {
   return **pending;
 }
 
+Expected<RelayArguments> VirtualClient::call(const platform::RelayInterface& interface, std::size_t method,
+                                             RelayArguments arguments) {
+  const auto answer = std::make_shared<std::optional<Expected<RelayArguments>>>();
+  connection_->call(interface, method, std::move(arguments), kPatience,
+                    [answer](Expected<RelayArguments> result) { *answer = std::move(result); });
+  device_.platform.runtime().runUntil([&] { return answer->has_value(); }, kPatience);
+  device_.run();
+  return answer->value();
+}
+
 Answer VirtualClient::search(std::string text) {
   return ask(searchFor(std::move(text), ++queryId_));
 }

@@ -49,6 +49,9 @@ class VirtualClient {
   /// Sends a search for `text` with the next query id and runs until it is answered.
   Answer search(std::string text);
   Answer ask(SBLAnyRequest request);
+  /// Calls a method and runs until it is answered.
+  Expected<platform::RelayArguments> call(const platform::RelayInterface& interface, std::size_t method,
+                                          platform::RelayArguments arguments = {});
 
   struct PushedBag {
     json raw;
