@@ -117,10 +117,6 @@ TEST_F(FactsTest, AFactOfTheWrongTypeIsReportedAndKeepsItsLastGoodValue) {
   EXPECT_TRUE(log.contains(folders.userFacts().native() + ":2:3: managed_account is not a boolean"));
   EXPECT_TRUE(log.contains(folders.userFacts().native() + ":3:1: screen_scale is not a number"));
   EXPECT_EQ(log.count(LogLevel::error), 2u);
-
-  EXPECT_TRUE(change("storefront = ").empty());
-  EXPECT_EQ(account.storeFrontIdentifier(), "2");
-  EXPECT_TRUE(log.contains(folders.userFacts().native() + ":1:14: "));
   change("");
   EXPECT_FALSE(account.primaryAccountIsManaged());
 }
