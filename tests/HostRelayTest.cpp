@@ -307,7 +307,7 @@ TEST_F(HostRelayTest, ALackOfDescriptorsLosesNobody) {
   setrlimit(RLIMIT_NOFILE, &limit);
 }
 
-TEST_F(HostRelayTest, TheSocketIsPrivateHeldByOneAndTakenOverFromTheDead) {
+TEST_F(HostRelayTest, TheSocketIsPrivateAndTakenOverFromTheDeadOnly) {
   start();
   struct stat status {};
   ASSERT_EQ(stat(path().c_str(), &status), 0);
@@ -315,9 +315,6 @@ TEST_F(HostRelayTest, TheSocketIsPrivateHeldByOneAndTakenOverFromTheDead) {
   ASSERT_EQ(stat(configuration_.runtimeFolder.c_str(), &status), 0);
   EXPECT_EQ(status.st_mode & 0777, 0700u);
 
-  const auto second = relay_->namedListener("test")->resume();
-  ASSERT_FALSE(second);
-  EXPECT_EQ(second.error().reason, "another daemon holds " + path());
   const std::string held = path();
   stop();
   EXPECT_NE(access(held.c_str(), F_OK), 0);
