@@ -1,11 +1,9 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
-#include <csignal>
 #include <memory>
 #include <vector>
 
@@ -29,20 +27,6 @@ mode_t modeOf(const std::filesystem::path& path) {
   return lstat(path.c_str(), &status) == 0 ? status.st_mode & 07777 : 0;
 }
 
-/// What `work` returns on a disk that has room for files of so many bytes only.
-auto withRoomFor(rlim_t bytes, const auto& work) {
-  const auto ignored = std::signal(SIGXFSZ, SIG_IGN);
-  rlimit old{};
-  getrlimit(RLIMIT_FSIZE, &old);
-  const rlimit small{bytes, old.rlim_max};
-  setrlimit(RLIMIT_FSIZE, &small);
-  auto result = work();
-  setrlimit(RLIMIT_FSIZE, &old);
-  std::signal(SIGXFSZ, ignored);
-  return result;
-}
-
-/// What every file manager promises.
 struct FileManagerContract : testing::TestWithParam<bool> {
   TemporaryFolder folder;
   simulated::SimulatedRuntime clock;
@@ -269,38 +253,25 @@ TEST_F(HostFileManagerTest, ReadersSeeOneOfTheTextsWholeWhileSeveralWrite) {
   EXPECT_FALSE(std::filesystem::exists(folder / ".file.new"));
 }
 
-/// A folder on another file system than the temporary one; empty where this host has no such.
-struct OtherFileSystem {
-  OtherFileSystem() {
-    std::string name = "/dev/shm/sabled-test.XXXXXX";
-    struct stat here {
-    }, there{};
-    if (stat(std::filesystem::temp_directory_path().c_str(), &here) != 0 || stat("/dev/shm", &there) != 0)
-      return;
-    if (here.st_dev != there.st_dev && mkdtemp(name.data()) != nullptr) path = name;
-  }
-  ~OtherFileSystem() {
-    if (!path.empty()) std::filesystem::remove_all(path);
-  }
-  std::filesystem::path path;
-};
-
 TEST_F(HostFileManagerTest, AFileFromAnotherFileSystemArrivesWholeOrNotAtAll) {
-  const OtherFileSystem other;
-  if (other.path.empty()) GTEST_SKIP() << "needs a second file system";
+  struct stat here {
+  }, there{};
+  if (stat(folder.path().c_str(), &here) != 0 || stat("/dev/shm", &there) != 0 || here.st_dev == there.st_dev)
+    GTEST_SKIP() << "needs a second file system";
+  const TemporaryFolder other("/dev/shm");
   const std::string bytes(200'000, 'n');
   writeFile(folder / "file", "old");
-  writeFile(other.path / "arrived", bytes);
+  writeFile(other / "arrived", bytes);
   const auto failed =
-      withRoomFor(100'000, [&] { return files.replaceItem(folder / "file", other.path / "arrived"); });
+      withRoomFor(100'000, [&] { return files.replaceItem(folder / "file", other / "arrived"); });
   EXPECT_EQ(errorOf(failed), EFBIG) << "the disk was full half-way";
   EXPECT_EQ(readFile(folder / "file"), "old");
   EXPECT_FALSE(std::filesystem::exists(folder / ".file.new"));
 
-  ASSERT_TRUE(files.replaceItem(folder / "file", other.path / "arrived"));
+  ASSERT_TRUE(files.replaceItem(folder / "file", other / "arrived"));
   EXPECT_EQ(readFile(folder / "file"), bytes);
   EXPECT_EQ(modeOf(folder / "file"), 0600u);
-  EXPECT_FALSE(std::filesystem::exists(other.path / "arrived"));
+  EXPECT_FALSE(std::filesystem::exists(other / "arrived"));
 }
 
 TEST(FoldersTest, TheFirstVariableThatIsSetDecides) {

@@ -1,11 +1,9 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sqlite3.h>
-#include <sys/resource.h>
 #include <sys/stat.h>
 
 #include <atomic>
-#include <csignal>
 #include <mutex>
 
 #include "platform/NotificationCenter.h"
@@ -210,14 +208,9 @@ TEST_F(HostTransfers, AFullDiskRefusesTheNewAndKeepsTheOld) {
   launch();
   ASSERT_TRUE(upload("/a", "first"));
   writeFile(folder_ / "large", std::string(200000, 'x'));
-  std::signal(SIGXFSZ, SIG_IGN);
-  rlimit unlimited{};
-  ASSERT_EQ(getrlimit(RLIMIT_FSIZE, &unlimited), 0);
   for (const rlim_t room : {100000, 1}) {  // the second is not enough for the database either
-    const rlimit full{room, unlimited.rlim_max};
-    ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &full), 0);
-    const auto refused = session_->uploadTask(request("/a"), folder_ / "large", "", "");
-    ASSERT_EQ(setrlimit(RLIMIT_FSIZE, &unlimited), 0);
+    const auto refused =
+        withRoomFor(room, [&] { return session_->uploadTask(request("/a"), folder_ / "large", "", ""); });
     EXPECT_FALSE(refused) << room;
   }
   EXPECT_THAT(files("transfers"), ElementsAre("1.upload"));

@@ -1,5 +1,8 @@
 #pragma once
 
+#include <sys/resource.h>
+
+#include <csignal>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -14,8 +17,8 @@ namespace sable {
 /// A folder of a test's own, gone with the test; its Folders lie below it.
 class TemporaryFolder {
  public:
-  TemporaryFolder() {
-    std::string name = (std::filesystem::temp_directory_path() / "sabled-test-XXXXXX").string();
+  explicit TemporaryFolder(const std::filesystem::path& parent = std::filesystem::temp_directory_path()) {
+    std::string name = (parent / "sabled-test-XXXXXX").string();
     path_ = mkdtemp(name.data());
   }
   ~TemporaryFolder() {
@@ -53,6 +56,19 @@ inline void writeFile(const std::filesystem::path& path, std::string_view text) 
 inline std::string readFile(const std::filesystem::path& path) {
   std::ifstream file(path, std::ios::binary);
   return {std::istreambuf_iterator<char>(file), {}};
+}
+
+/// What `work` returns on a disk that has room for files of so many bytes only.
+auto withRoomFor(rlim_t bytes, const auto& work) {
+  const auto ignored = std::signal(SIGXFSZ, SIG_IGN);
+  rlimit old{};
+  getrlimit(RLIMIT_FSIZE, &old);
+  const rlimit small{bytes, old.rlim_max};
+  setrlimit(RLIMIT_FSIZE, &small);
+  auto result = work();
+  setrlimit(RLIMIT_FSIZE, &old);
+  std::signal(SIGXFSZ, ignored);
+  return result;
 }
 
 }  // namespace sable
