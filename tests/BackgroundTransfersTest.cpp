@@ -26,7 +26,6 @@ Scripted askingForAPause(int status, std::string seconds) {
   return answer;
 }
 
-/// Notes what it hears as words.
 class Listener final : public HTTPBackgroundSessionDelegate {
  public:
   explicit Listener(FileManager& files) : files_(files) {}

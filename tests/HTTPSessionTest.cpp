@@ -20,6 +20,12 @@ using tests::LoopbackServer;
 using Then = LoopbackServer::Reply::Then;
 using Fields = std::vector<std::pair<std::string, std::string>>;
 
+HTTPRequest get(std::string url) {
+  HTTPRequest request;
+  request.url = std::move(url);
+  return request;
+}
+
 class HostSession : public ::testing::Test {
  protected:
   std::unique_ptr<HTTPSession> session(const std::function<void(HTTPSessionConfiguration&)>& configure =
@@ -48,12 +54,6 @@ class HostSession : public ::testing::Test {
     HTTPRequest request = get(server_.url(path));
     request.method = std::move(method);
     for (const auto& [name, value] : fields) request.headers.add(name, value);
-    return request;
-  }
-
-  static HTTPRequest get(std::string url) {
-    HTTPRequest request;
-    request.url = std::move(url);
     return request;
   }
 
@@ -440,8 +440,7 @@ TEST(ScriptedSession, LimitsAndCancellingEndATaskOnce) {
   const auto session = platform.httpSessions().session(configuration);
   std::vector<HTTPResult> results;
   const auto start = [&](const char* url) {
-    HTTPRequest request;
-    request.url = url;
+    HTTPRequest request = get(url);
     request.timeout = 10;
     auto task =
         session->dataTask(std::move(request), [&](HTTPResult got) { results.push_back(std::move(got)); });
@@ -467,11 +466,7 @@ TEST(ServiceProxy, AConfiguredOneCarriesTasks) {
   simulated::SimulatedPlatform platform;
   const auto session = platform.httpSessions().session({});
   ConfiguredServiceProxy proxies;
-  const auto task = [&] {
-    HTTPRequest request;
-    request.url = "http://h/";
-    return session->dataTask(proxies.brambleRequest(std::move(request)), nullptr);
-  };
+  const auto task = [&] { return session->dataTask(proxies.brambleRequest(get("http://h/")), nullptr); };
   const auto set = [&](std::string_view client, std::string_view json) {
     return proxies.setConfiguration(client, *parseJSON(json, 1000)).has_value();
   };

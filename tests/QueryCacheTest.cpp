@@ -21,7 +21,6 @@ std::string sets(std::initializer_list<json> list) {
 
 class QueryCaching : public testing::Test {
  protected:
-  /// What an entry is made of.
   struct Given {
     std::string input, query;
     double score = 0, maxAge = 0;

@@ -101,7 +101,6 @@ RelayArguments oneOfEach() {
           RelayFile()};
 }
 
-/// A runtime with its Relay.
 struct World {
   std::unique_ptr<Runtime> runtime;
   std::unique_ptr<Relay> relay;

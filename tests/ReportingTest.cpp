@@ -43,7 +43,6 @@ class Reporting : public testing::Test {
     }
     return found;
   }
-  /// All records of an agent.
   std::vector<json> records(const std::string& agent = kBeacon) {
     std::vector<json> all;
     for (const json& session : sessions(agent)) all.insert(all.end(), session.begin(), session.end());
