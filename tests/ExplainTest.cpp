@@ -19,14 +19,8 @@ class ExplainTest : public ::testing::Test {
  protected:
   /// The answer of the diagnostics, or why there is none.
   json diagnose(std::size_t method, platform::RelayArguments arguments) {
-    json answer;
-    client->connection().call(kSBLDiagnosticsRelay, method, std::move(arguments), 20s,
-                              [&](Expected<platform::RelayArguments> result) {
-                                answer = result ? json::parse(std::get<std::string>((*result)[0]))
-                                                : json(result.error().reason);
-                              });
-    device.run();
-    return answer;
+    const auto answer = client->call(kSBLDiagnosticsRelay, method, std::move(arguments));
+    return answer ? json::parse(std::get<std::string>(answer->at(0))) : json(answer.error().reason);
   }
   json explain(const SBLSearchRequest& request) {
     return diagnose(SBLDiagnosticsRelay::explain,
