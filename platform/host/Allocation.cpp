@@ -20,8 +20,9 @@ int releaseUnwritten(dl_phdr_info* object, std::size_t, void*) {
     if (segment.p_type != PT_LOAD || (segment.p_flags & PF_W) != 0) continue;
     const std::uintptr_t begin = object->dlpi_addr + segment.p_vaddr;
     const std::uintptr_t firstPage = begin & ~(page - 1);
+    auto* const start = reinterpret_cast<void*>(firstPage);  // NOLINT(*-int-to-ptr): the linker tells numbers
     // Where the kernel refuses, as for its own object, the pages just stay.
-    ::madvise(reinterpret_cast<void*>(firstPage), begin + segment.p_memsz - firstPage, MADV_DONTNEED);
+    ::madvise(start, begin + segment.p_memsz - firstPage, MADV_DONTNEED);
   }
   return 0;
 }
