@@ -63,6 +63,7 @@ class BackgroundTransfers::Core : public std::enable_shared_from_this<Core> {
   void begin(Entry& entry);
   void progressed(std::int64_t identifier, std::int64_t sent, std::int64_t expected);
   void finished(std::int64_t identifier, int attempts, HTTPResult result);
+  std::optional<Duration> pauseAskedFor(const Entry& entry);
   void again(Entry& entry, Duration pause, const std::string& why);
   void end(Entry& entry, std::optional<Error> error);
   void report(const BackgroundTransfer& transfer);
@@ -192,6 +193,7 @@ bool BackgroundTransfers::Core::isHeld(const Entry& entry, const TransferConditi
 
 void BackgroundTransfers::Core::expire(Entry& entry) {
   if (entry.attempt) entry.attempt->cancel();
+  entry.transfer.task.response.reset();  // of an attempt that broke off: it is no answer
   end(entry, httpError(HTTPErrorCode::timedOut, "not done within the time of the resource"));
 }
 
@@ -236,14 +238,24 @@ void BackgroundTransfers::Core::finished(std::int64_t identifier, int attempts, 
   entry.transfer.task.response = std::move(result.response);
   if (result.error) {
     if (!isWorthRetrying(*result.error)) return end(entry, std::move(result.error));
-    return again(entry, retryPause(attempts, chance()), result.error->description());
+    const Duration pause =
+        std::max(retryPause(attempts, chance()), pauseAskedFor(entry).value_or(Duration{}));
+    return again(entry, pause, result.error->description());
   }
   const HTTPResponse& response = *entry.transfer.task.response;
-  const auto asked = retryAfter(response, runtime_.now());
-  const Duration pause = asked ? retryPauseAsked(*asked, attempts, chance()) : Duration{};
+  const auto asked = pauseAskedFor(entry);
+  const Duration pause = asked.value_or(Duration{});
   // Who is told to come back when it is too late takes that for the answer.
   if (!asked || later(runtime_.ticks(), pause) >= entry.deadline) return end(entry, std::nullopt);
   again(entry, pause, "status " + std::to_string(response.status));
+}
+
+/// What the last answer asks for, also one that broke off.
+std::optional<Duration> BackgroundTransfers::Core::pauseAskedFor(const Entry& entry) {
+  const auto& response = entry.transfer.task.response;
+  const auto asked = response ? retryAfter(*response, runtime_.now()) : std::nullopt;
+  if (!asked) return std::nullopt;
+  return retryPauseAsked(*asked, entry.transfer.attempts, chance());
 }
 
 void BackgroundTransfers::Core::again(Entry& entry, Duration pause, const std::string& why) {

@@ -109,6 +109,8 @@ TEST(ContextProcess, EveryReasonForNoLocationIsOnTheWire) {
   } rows[] = {
       {"latitude = 51.5\nlongitude = 200\ntype = 1", "location: error.fail", "- error.fail"},
       {"latitude = 51.5\nlongitude = -0.1\ntype = 1", "location: gps", "51.500000,-0.100000 gps"},
+      {"type = 1", "location: error.fail", "- error.fail"},
+      {"latitude = 51.5\nlongitude = -0.1\ntype = 1", "location: gps", "51.500000,-0.100000 gps"},
       {"latitude = 51.5", "location: error.fail", "- error.fail"},
       {"latitude = 51.5\nlongitude = -0.1\ntype = 5", "location: bagno.wifi", "- bagno.wifi"},
       {"authorization = 2\nlatitude = 51.5\nlongitude = -0.1\ntype = 1", "location: userno", "- userno"},

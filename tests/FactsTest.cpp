@@ -178,6 +178,7 @@ TEST_F(FactsTest, WhatFollowsFromTheLocale) {
       {"es_PR", "gregorian", "Metric", "Fahrenheit", "h\u202Fa"},
       {"th_TH", "buddhist", "Metric", "Celsius", "HH"},
       {"fa_IR", "persian", "Metric", "Celsius", "H"},
+      {"ps_AF", "persian", "Metric", "Celsius", "H"},
       {"ja_JP@calendar=japanese", "japanese", "Metric", "Celsius", "H時"},
       {"en-US-u-ms-metric-mu-celsius-hc-h23-ca-buddhist", "buddhist", "Metric", "Celsius", "HH"},
       {"de_DE@mu=fahrenhe", "gregorian", "Metric", "Fahrenheit", "HH 'Uhr'"},

@@ -195,6 +195,22 @@ TEST_F(CacheInAFolder, ResponsesOutliveTheProcess) {
   EXPECT_EQ(bodyOf(*second, "b"), "3");
 }
 
+TEST_F(CacheInAFolder, WhatChangesWhileTheFileIsReadCounts) {
+  const auto cache = this->cache(1000, 10000);
+  for (const char* url : {"a", "b"}) cache->store(response(url, "old"));
+  runtime_.run();
+  cache->purgeMemory();
+  std::vector<std::string> found;
+  for (const char* url : {"a", "b"})
+    cache->find(url, [&](ResponseCache::Stored stored) { found.push_back(stored ? *stored->body : "-"); });
+  cache->store(response("a", "new"));
+  cache->remove("b");
+  runtime_.run();
+  EXPECT_EQ(found, (std::vector<std::string>{"new", "-"}));
+  EXPECT_EQ(bodyOf(*cache, "a"), "new");
+  EXPECT_EQ(bodyOf(*cache, "b"), std::nullopt);
+}
+
 TEST_F(CacheInAFolder, TheLeastRecentlyUsedGoFirst) {
   const auto memoryOnly = cache(1000, 0);
   const auto diskOnly = cache(0, 1000);

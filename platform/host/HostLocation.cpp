@@ -88,8 +88,13 @@ class Manager final : public LocationManager, public std::enable_shared_from_thi
     const auto table = facts_.table(kTable);
     if (table == nullptr || !isAuthorized(authorizationOf(*table))) return;
     const auto latitude = numberMember(*table, "latitude"), longitude = numberMember(*table, "longitude");
-    if (!latitude && !longitude) return;
+    if (!latitude && !longitude) {
+      // No fix yet, unless there was one: that must not be told any longer.
+      if (std::exchange(factsHaveFix_, false)) events_.failed("the facts have no coordinates any more");
+      return;
+    }
     if (!latitude || !longitude) return events_.failed("the facts have one coordinate only");
+    factsHaveFix_ = true;
     const auto timestamp = numberMember(*table, "timestamp");
     events_.fixArrived({*latitude, *longitude, intMember(*table, "type", 0),
                         timestamp ? wallTimeFromSecondsSince1970(*timestamp) : runtime_.now()});
@@ -141,6 +146,7 @@ class Manager final : public LocationManager, public std::enable_shared_from_thi
 
   // On queue_.
   LocationAuthorization lastStatus_;
+  bool factsHaveFix_ = false;
   std::shared_ptr<GeoClueSearch> search_;
   MonotonicTime notBefore_;
 };

@@ -161,12 +161,13 @@ std::string hourPatternOf(const std::string& localeIdentifier) {
   const icu::Locale locale(localeIdentifier.c_str());
   const char letter = hourLetterOf(locale);
   const char* skeleton = letter == 'h' || letter == 'K' ? "h" : "H";
+  // The other calendars have their formats in common.
+  const char* calendar = calendarOf(localeIdentifier) == "gregorian" ? "gregorian" : "generic";
   const std::string first = bundleOf(locale);
   for (std::string bundle = first; !bundle.empty(); bundle = parentOf(bundle)) {
     // As ICU's generator has it, root's "HH" is for locales without data; the others just write hours.
     if (bundle == "root" && first != "root" && *skeleton == 'H') break;
-    auto pattern =
-        Resource(bundle.c_str()).at({"calendar", "gregorian", "availableFormats", skeleton}).string();
+    auto pattern = Resource(bundle.c_str()).at({"calendar", calendar, "availableFormats", skeleton}).string();
     if (!pattern) continue;
     // "h" stands for both cycles of twelve hours in the data, "H" for both of 24.
     const auto begin = std::min(pattern->find_first_of("hHkK"), pattern->size());

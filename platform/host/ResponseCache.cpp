@@ -42,8 +42,7 @@ void ResponseCache::find(const std::string& url, Found found) {
         auto stored = read ? std::make_shared<const StoredResponse>(std::move(*read)) : nullptr;
         owner->async([weak, url, stored = std::move(stored), found = std::move(found)]() mutable {
           const auto self = weak.lock();
-          if (self && stored) self->remember(stored);
-          found(std::move(stored));
+          found(self ? self->readFromFile(url, std::move(stored)) : std::move(stored));
         });
       });
 }

@@ -1,12 +1,10 @@
 #include "platform/host/SQLiteStatement.h"
 
 #include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 #include <algorithm>
-#include <cerrno>
-#include <system_error>
+
+#include "platform/host/TrustedPath.h"
 
 namespace sable::platform::host {
 
@@ -15,13 +13,11 @@ bool isSQLiteDamage(int code) {
 }
 
 int createSQLiteFile(const std::filesystem::path& path) {
-  std::error_code error;
-  std::filesystem::create_directories(path.parent_path().parent_path(), error);
-  if (::mkdir(path.parent_path().c_str(), 0700) != 0 && errno != EEXIST) return SQLITE_CANTOPEN;
-  const int descriptor = ::open(path.c_str(), O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0600);
-  if (descriptor < 0) return SQLITE_CANTOPEN;
-  ::close(descriptor);
-  return SQLITE_OK;
+  const auto folder = openTrustedFolder(path.parent_path(), MissingFolders::create);
+  if (!folder) return SQLITE_CANTOPEN;
+  const Descriptor file(
+      ::openat(folder->number(), path.filename().c_str(), O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0600));
+  return file ? SQLITE_OK : SQLITE_CANTOPEN;
 }
 
 std::string headerLines(const HTTPHeaders& headers) {
