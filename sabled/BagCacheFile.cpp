@@ -67,7 +67,8 @@ void BagCacheFile::write(const Dictionary& dictionary) const {
     return;
   }
   if (const auto written = fileManager_.writeAtomically(*file, *bytes); !written) {
-    log().error("Could not write to {}: {}", file->string(), written.error().reason);
+    log().error("Could not write to {}", file->string());
+    log().error("{}", written.error().description());
   }
 }
 

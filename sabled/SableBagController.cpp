@@ -164,19 +164,20 @@ SableBagController::Bag SableBagController::cachedBagState() {
 void SableBagController::cacheBagState(const Bag& bag, bool fromDisk) {
   if (bag == nullptr) return;
   for (const std::string& problem : bag->problems()) log().error("{}", problem);
+  const unsigned newNewsStatus = newsStatus(bag.get());
+  unsigned oldNewsStatus = newNewsStatus;
   inMemoryBagCacheAccessQueue_->barrierSync([&] {
-    const unsigned oldNewsStatus = newsStatus(inMemoryBag_.get());
-    const unsigned newNewsStatus = newsStatus(bag.get());
+    oldNewsStatus = newsStatus(inMemoryBag_.get());
     inMemoryBag_ = bag;
-    // The first bag from the network always tells (the old status is "unknown"), one from disk
-    // never does: readers of the notification count on both.
-    if (newNewsStatus == oldNewsStatus || fromDisk) return;
-    log().standard("setting Sable News Available status to {}", newNewsStatus);
-    assembly_.platform.notify().post(newNewsStatus == 1 ? kSBLNotifyEnabled : kSBLNotifyDisabled);
   });
   // Outside the barrier: observers read the bag.
   assembly_.notificationCenter.post(
       {kSBLBagChangeNotification, nullptr, {{std::string(kSBLNotificationBagKey), std::any(bag)}}});
+  // The first bag from the network always tells (the old status is "unknown"), one from disk
+  // never does: readers of the notification count on both.
+  if (newNewsStatus == oldNewsStatus || fromDisk) return;
+  log().standard("setting Sable News Available status to {}", newNewsStatus);
+  assembly_.platform.notify().post(newNewsStatus == 1 ? kSBLNotifyEnabled : kSBLNotifyDisabled);
 }
 
 std::shared_ptr<const Dictionary> SableBagController::diskCachedBagDictionary() {
@@ -226,7 +227,8 @@ bool SableBagController::_isRefreshRequiredForCachedBag(const Dictionary& cached
 void SableBagController::_handleRefreshNotification() {
   log().standard("something significant changed (locale, geo). checking to see if bag needs update");
   const Bag bag = inMemoryBag();
-  if (bag != nullptr && _isRefreshRequiredForCachedBag(*bag->rawBag())) _fetchBagStateWithVersion("");
+  if (_isRefreshRequiredForCachedBag(bag == nullptr ? Dictionary::object() : *bag->rawBag()))
+    _fetchBagStateWithVersion("");
 }
 
 void SableBagController::_fetchBagStateWithVersion(const std::string& version) {
@@ -288,12 +290,9 @@ Expected<SableBagController::Bag> SableBagController::bagFromResult(const HTTPRe
     return tl::unexpected(networkError("statusCode " + std::to_string(status)));
   }
   auto parsed = parseJSON(*result.data, kMaximumBagBytes);
-  if (!parsed) {
-    log().error("error parsing bag json {}", parsed.error().description());
-    return tl::unexpected(networkError("not JSON object"));
-  }
-  if (!parsed->is_object()) {
+  if (!parsed || !parsed->is_object()) {
     log().error("Error fetching bag: returned data was not of the expected type.");
+    if (!parsed) log().error("error parsing bag json {}", parsed.error().description());
     return tl::unexpected(networkError("not JSON object"));
   }
   log().info("Got bag: {}", *result.data);

@@ -164,6 +164,17 @@ TEST_F(BagController, AnUnwritableFolderCostsOnlyTheCopy) {
   EXPECT_TRUE(device.log.contains("Couldn't get path to cache bag.  Error: "));
 }
 
+TEST_F(BagController, WithoutABagAChangeOfLocaleFetchesOne) {
+  device.service.on("/bag", answering("", 500));
+  device.start();
+  device.service.on("/bag", answering(device.bag.dump()));
+  auto values = device.platform.localeInfo().values;
+  values.localeIdentifier = "de_DE";
+  device.platform.localeInfo().change(values);
+  device.advance(1s);
+  EXPECT_EQ(version(), "1");
+}
+
 TEST_F(BagController, ABagThatIsNeverToBeRefreshedIsNot) {
   device.bag["__refresh_disabled"] = 1;
   device.start();
