@@ -224,12 +224,17 @@ void SBLNetworkRequestFactory::_addHttpRequestTopTopics(Builder& builder,
   if (!input.topics) return;
   // Written anew, so that a client's line breaks never reach a header.
   const auto topics = parseJSON(*input.topics, kMaximumTopicsBytes);
-  if (topics) builder.defaultHttpHeaderWithName("X-Kestrel-TopTopics", compactJSON(*topics));
+  if (!topics) {
+    SableLogForCategory(SableLoggingCategoryRequest)
+        .error("topics of {} bytes are left out: {}", input.topics->size(), topics.error().reason);
+    return;
+  }
+  builder.defaultHttpHeaderWithName("X-Kestrel-TopTopics", compactJSON(*topics));
 }
 
 void SBLNetworkRequestFactory::_addHttpFuzzedLocation(Builder& builder) {
   beginStep(builder, __func__);
-  context_.downloadPlace = context_.lookupPlace;
+  if (!builder.isTraced()) context_.downloadPlace = context_.lookupPlace;
   addHeaderIfPresent(builder, "X-Kestrel-FuzzedLatLong", _getLookupLatLng());
 }
 

@@ -4,6 +4,7 @@
 #include <limits>
 
 #include "sabled/CoarseLocation.h"
+#include "sabled/RequestTrace.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "tests/support/VirtualDevice.h"
 
@@ -248,6 +249,22 @@ TEST_F(Location, DownloadsTellWhereTheLastSearchWas) {
   location.authorize(LocationAuthorization::denied);
   device.run();
   EXPECT_EQ(fuzzedLocation(), "-");
+}
+
+TEST_F(Location, WhoOnlyAsksWhatADownloadWouldTellHasToldNoPlace) {
+  start(LocationAuthorization::always);
+  deliver();
+  searched();
+  RequestTrace trace;
+  device.assembly().requestFactory->fileDownloadRequest("https://service.test/file", "", true, &trace);
+  location.deliver({48.8566, 2.3522, 4, device.platform.runtime().now()});
+  device.run();
+  searched();
+  EXPECT_FALSE(device.log.contains("the device has moved far"));
+  fuzzedLocation();
+  deliver();
+  searched();
+  EXPECT_TRUE(device.log.contains("the device has moved far"));
 }
 
 class Context : public Location {};
