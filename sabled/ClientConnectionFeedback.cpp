@@ -28,7 +28,7 @@ constexpr std::uint32_t kTraceFeedback = 0x2b000024;
 constexpr std::uint32_t kSableResult = 1;  ///< a result of the service
 
 // Values of RKCustomFeedback's `feedback_type`.
-constexpr std::uint32_t kRoverAutofill = 1, kCrowdsourcing = 2, kBeaconResultFeatures = 3;
+constexpr std::uint32_t kRoverAutofill = 1, kBeaconResultFeatures = 3;
 
 const platform::LogHandle& log() {
   return SableLogForCategory(SableLoggingCategoryConnection);
@@ -107,7 +107,7 @@ void ClientConnection::handleCustomFeedback(std::unique_ptr<FeedbackMessage> mes
       inSessionOfItsOwn(std::move(message), queryId,
                         [](Assembly&, ClientSession& session) { session.sessionComplete(); });
       break;
-    case kCrowdsourcing:
+    case kCrowdsourcingFeedback:
       assembly_.tally.add("com.kestrel.sabled.dp.submit", 1);
       inSessionOfItsOwn(std::move(message), queryId, [](Assembly& assembly, ClientSession& session) {
         if (!session.storageHandle()) return;

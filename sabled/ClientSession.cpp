@@ -65,7 +65,10 @@ ClientSession::ClientSession(Assembly& assembly, const std::shared_ptr<SableFeed
     : ClientSession(assembly) {
   previousSessionEndReason_ = previousSessionEndReason;
   begin(feedback.get());
-  storageHandle_ = assembly_.persistentStorage->createFileContainerForWriting();
+  auto& storage = *assembly_.persistentStorage;
+  storageHandle_ = feedback && feedback->feedback().customFeedbackType() == kCrowdsourcingFeedback
+                       ? storage.createCrowdsourcingFileContainerForWriting()
+                       : storage.createFileContainerForWriting();
   if (storageHandle_) storageHandle_->writeSessionHeader(*this);
   if (feedback) addFeedback(feedback);
 }

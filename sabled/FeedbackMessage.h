@@ -33,6 +33,9 @@ struct SearchViewAppearance {
   std::uint32_t viewAppearEvent = 0;
 };
 
+/// The custom feedback type of what goes to the crowdsourcing address.
+inline constexpr std::uint32_t kCrowdsourcingFeedback = 2;
+
 /// A feedback message of one of the classes of SableKit/messages, of either family. What each class
 /// becomes is in docs/feedback.md. One thread at a time.
 class FeedbackMessage {
@@ -81,7 +84,7 @@ class FeedbackMessage {
   // What the way of a feedback depends on; nullopt for other kinds.
   virtual std::optional<ResultEngagement> resultEngagement() const = 0;
   virtual std::optional<SearchViewAppearance> searchViewAppearance() const = 0;
-  virtual std::optional<std::uint32_t> customFeedbackType() const = 0;
+  virtual std::optional<std::uint32_t> customFeedbackType() const = 0;  ///< kCrowdsourcingFeedback, ...
 
   /// The message itself, for whoever serialises it; parse() reads that back.
   virtual const google::protobuf::MessageLite& message() const = 0;

@@ -207,7 +207,10 @@ SableFeedbackFlusher::Outcome SableFeedbackFlusher::packAndUpload(ClientSession&
     }
     objects->push_back(*std::move(envelope));
   }
-  return serverEndpoint_ ? upload(session, file, *packed) : Outcome::dropped;
+  const Outcome outcome = serverEndpoint_ ? upload(session, file, *packed) : Outcome::dropped;
+  // It will be told of when it is sent.
+  if (outcome == Outcome::kept && objects != nullptr) objects->pop_back();
+  return outcome;
 }
 
 Expected<SableFeedbackFlusher::Packed> SableFeedbackFlusher::pack(ClientSession& session,

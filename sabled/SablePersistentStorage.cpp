@@ -39,7 +39,7 @@ std::optional<std::filesystem::path> sessionDirectory(platform::FileManager& fil
 
 /// Whether it may have passed when the same is tried later.
 bool isTroubleOfDisk(const Error& error) {
-  constexpr std::int64_t kPassing[] = {ENOSPC, EDQUOT, EIO, EROFS, EMFILE, ENFILE, ENOMEM};
+  constexpr std::int64_t kPassing[] = {ENOSPC, EDQUOT, EIO, EROFS, EMFILE, ENFILE, ENOMEM, EACCES, EPERM};
   return std::ranges::find(kPassing, error.code) != std::end(kPassing);
 }
 
@@ -60,7 +60,16 @@ SablePersistentStorage::SablePersistentStorage(Assembly& assembly)
 }
 
 std::shared_ptr<FileContainer> SablePersistentStorage::createFileContainerForWriting() {
-  const auto fileUrl = _newFileUrl();
+  return containerIn(_newFileUrl([this] { return fmt::format("{}{}", kFilePrefix, handleId_++); }));
+}
+
+std::shared_ptr<FileContainer> SablePersistentStorage::createCrowdsourcingFileContainerForWriting() {
+  return containerIn(
+      _newFileUrl([this] { return std::string(kCrowdsourcingPrefix) + assembly_.runtime.uuid().string(); }));
+}
+
+std::shared_ptr<FileContainer> SablePersistentStorage::containerIn(
+    const std::optional<std::filesystem::path>& fileUrl) {
   if (!fileUrl) {
     log().error("Could not get a file url");
     return nullptr;
@@ -75,11 +84,12 @@ std::shared_ptr<FileContainer> SablePersistentStorage::createFileContainerForWri
                                          maxFileSize_);
 }
 
-std::optional<std::filesystem::path> SablePersistentStorage::_newFileUrl() {
+std::optional<std::filesystem::path> SablePersistentStorage::_newFileUrl(
+    const std::function<std::string()>& nextName) {
   if (!cachesUrl_) return std::nullopt;
   (void)assembly_.fileManager.createDirectory(*cachesUrl_);  // where that fails, making the file does too
   for (;;) {
-    auto fileUrl = *cachesUrl_ / fmt::format("{}{}", kFilePrefix, handleId_++);
+    auto fileUrl = *cachesUrl_ / nextName();
     const auto created = assembly_.fileManager.createFile(fileUrl);
     if (created) return fileUrl;
     if (created.error().code == EEXIST) continue;
@@ -99,10 +109,7 @@ void SablePersistentStorage::closeCrowdsourcingSessionWithFileContainer(
     std::shared_ptr<FileContainer> container) {
   queue_->async([this, container = std::move(container)] {
     container->_closeFile();
-    // Without its own name it would be sent where all others go.
-    if (const auto held = container->_hold(kCrowdsourcingPrefix); !held)
-      log().error("{}", held.error().description());
-    listOf(*container).push_back(container);
+    crowdsourcingContainers_.push_back(container);
   });
 }
 

@@ -37,6 +37,8 @@ class SablePersistentStorage {
   /// A new file, open for writing; null when there can be none, which is logged. Waits for the disk
   /// as long as making a file takes.
   std::shared_ptr<FileContainer> createFileContainerForWriting();
+  /// The same for what goes to the crowdsourcing address, which the file's name tells from the start.
+  std::shared_ptr<FileContainer> createCrowdsourcingFileContainerForWriting();
 
   /// Closes the file, after what was written before, and makes it available. Does not wait.
   void closeSessionWithFileContainer(std::shared_ptr<FileContainer> container);
@@ -63,7 +65,8 @@ class SablePersistentStorage {
  private:
   using FileContainers = std::vector<std::shared_ptr<FileContainer>>;
 
-  std::optional<std::filesystem::path> _newFileUrl();
+  std::optional<std::filesystem::path> _newFileUrl(const std::function<std::string()>& nextName);
+  std::shared_ptr<FileContainer> containerIn(const std::optional<std::filesystem::path>& fileUrl);
   FileContainers& listOf(const FileContainer& container);
   FileContainers available(const FileContainers& list);
   void _scanCacheDirectory();

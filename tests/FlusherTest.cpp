@@ -223,15 +223,17 @@ TEST_F(Flusher, AFileThatCannotBeReadIsDroppedAndTheOthersGo) {
 TEST_F(Flusher, CrowdsourcingHasItsOwnFilesAndAddress) {
   start();
   ClientSession session(device.assembly(),
-                        feedbackFromJSON("RKStartSearchFeedback", R"({"input": "crowd"})"));
+                        feedbackFromJSON("RKCustomFeedback",
+                                         R"({"feedbackType": 2, "jsonFeedback": "{\"input\": \"crowd\"}"})"));
+  device.run();
+  EXPECT_THAT(files(), ElementsAre("crowdsourcing")) << "a kill leaves it for its own address";
   storage().closeCrowdsourcingSessionWithFileContainer(session.storageHandle());
   device.run();
-  EXPECT_THAT(files(), ElementsAre("crowdsourcing"));
   device.killDaemon();
   device.start();
   flush();
-  EXPECT_THAT(uploaded("/crowd"), ElementsAre("crowd"));
-  EXPECT_EQ(uploaded("/feedback"), std::vector<std::string>());
+  EXPECT_THAT(uploads("/crowd"), testing::SizeIs(1));
+  EXPECT_THAT(uploads("/feedback"), IsEmpty());
   EXPECT_THAT(files(), IsEmpty());
 }
 
