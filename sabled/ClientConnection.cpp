@@ -19,6 +19,7 @@
 #include "sabled/DownloadManager.h"
 #include "sabled/KeyboardLocale.h"
 #include "sabled/PrivacyReport.h"
+#include "sabled/QueryCache.h"
 #include "sabled/RequestReply.h"
 #include "sabled/SableBagController.h"
 #include "sabled/SableFlusherRelay.h"
@@ -54,7 +55,10 @@ ClientConnection::ClientConnection(Assembly& assembly, std::shared_ptr<platform:
       transaction_(assembly.platform.transactions().open("clientConnection")),
       lastCall_(assembly.runtime.ticks()) {}
 
-ClientConnection::~ClientConnection() = default;
+ClientConnection::~ClientConnection() {
+  // For the other connections of that client too: peers depend on it.
+  if (state_ != nullptr && state_->queryCache() != nullptr) state_->queryCache()->removeAllObjects();
+}
 
 void ClientConnection::start() {
   connection_->exportObject(kSBLDaemonRelay, [weak = weak_from_this()](platform::RelayCall call) {
@@ -110,18 +114,23 @@ void ClientConnection::handleInvocation(platform::RelayCall call) {
 }
 
 bool ClientConnection::_ensureState() {
+  return _ensureState(userAgent_);
+}
+
+bool ClientConnection::_ensureState(const std::string& userAgent) {
   if (!configuration_) {
     log().fault("configuration must not be nil");
     return false;
   }
-  if (!configuration_->identifier || userAgent_.empty()) {
+  if (!configuration_->identifier || userAgent.empty()) {
     log().fault("configuration requires identifier and agent");
     return false;
   }
-  if (userAgent_.size() > kMaximumNameBytes) {
+  if (userAgent.size() > kMaximumNameBytes) {
     log().fault("user agent is longer than {} bytes", kMaximumNameBytes);
     return false;
   }
+  userAgent_ = userAgent;
   if (state_ != nullptr) {
     if (state_->identifier() != *configuration_->identifier) log().fault("session identifier must match");
     return true;
@@ -134,8 +143,9 @@ bool ClientConnection::_ensureState() {
 void ClientConnection::configure(SBLSessionConfiguration configuration, platform::RelayReply reply) {
   log().standard("client configuration {}", configuration.description());
   configuration_ = std::move(configuration);
-  userAgent_ = composeUserAgent(configuration_->userAgent.value_or(""), assembly_.platform.deviceInfo());
-  if (!_ensureState()) {
+  const auto agent =
+      composeUserAgent(configuration_->userAgent.value_or(""), assembly_.platform.deviceInfo());
+  if (!_ensureState(agent)) {
     reply.forget();
     return failConfiguration();
   }
@@ -154,8 +164,19 @@ void ClientConnection::failConfiguration() {
   connection_->invalidate();
 }
 
-void ClientConnection::startServing(const std::shared_ptr<const SBLBag>& bag,
-                                    const std::optional<Error>& error) {
+void ClientConnection::startServing(std::shared_ptr<const SBLBag> bag, std::optional<Error> error) {
+  if (!bagObservation_) {
+    bagObservation_ = assembly_.notificationCenter.observe(
+        std::string(kSBLBagChangeNotification),
+        [weak = weak_from_this()](const platform::Notification& notification) {
+          if (const auto self = weak.lock()) self->bagChangeNotification(notification);
+        });
+    // What was announced before there was an observer is known to the state.
+    if (auto held = state_->heldBag()) {
+      bag = std::move(held);
+      error = std::nullopt;
+    }
+  }
   if (bag == nullptr || !bag->feedbackEnabled()) {
     log().standard("feedback collection disabled in bag for user agent {}", userAgent_);
   }
@@ -163,13 +184,6 @@ void ClientConnection::startServing(const std::shared_ptr<const SBLBag>& bag,
                  bag == nullptr ? "(null)" : bag->version(), configuration_->identifier.value_or("(null)"),
                  error ? error->description() : "(null)");
   pushBag(bag.get(), error);
-  if (!bagObservation_) {
-    bagObservation_ = assembly_.notificationCenter.observe(
-        std::string(kSBLBagChangeNotification),
-        [weak = weak_from_this()](const platform::Notification& notification) {
-          if (const auto self = weak.lock()) self->bagChangeNotification(notification);
-        });
-  }
   assembly_.clientStateManager->saveState();
 }
 

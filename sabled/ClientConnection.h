@@ -60,9 +60,10 @@ class ClientConnection : public std::enable_shared_from_this<ClientConnection> {
   void armIdleTimer(platform::Duration delay);
 
   bool _ensureState();
+  bool _ensureState(const std::string& userAgent);
   void configure(SBLSessionConfiguration configuration, platform::RelayReply reply);
   void failConfiguration();
-  void startServing(const std::shared_ptr<const SBLBag>& bag, const std::optional<Error>& error);
+  void startServing(std::shared_ptr<const SBLBag> bag, std::optional<Error> error);
   void bag(platform::RelayReply reply);
   void bagChangeNotification(const platform::Notification& notification);
   void pushBag(const SBLBag* bag, const std::optional<Error>& error);

@@ -114,7 +114,10 @@ bool ClientState::_ensureBag() {
   log().standard("Warming bag cache for agent: {}", userAgent().value_or(""));
   const auto current = assembly_.bagController->currentBag();
   if (current != nullptr) {
-    queue_->sync([&] { bag_ = std::make_shared<const SBLBag>(current->rawBag(), *userAgent_); });
+    queue_->sync([&] {
+      // A newer one may have been announced meanwhile.
+      if (bag_ == nullptr) bag_ = std::make_shared<const SBLBag>(current->rawBag(), *userAgent_);
+    });
     return true;
   }
   _markNetworkRequest();
@@ -141,8 +144,13 @@ void ClientState::warm() {
     request.standard("warm not required, bag fetch in process");
     return;
   }
-  const auto last = queue_->sync([this] { return lastNetworkRequest_; });
-  if (last && assembly_.runtime.ticks() - *last < kWarmFor) {
+  const bool isWarm = queue_->sync([this] {
+    const auto now = assembly_.runtime.ticks();
+    if (lastNetworkRequest_ && now - *lastNetworkRequest_ < kWarmFor) return true;
+    lastNetworkRequest_ = now;
+    return false;
+  });
+  if (isWarm) {
     request.standard("warm not required, connection still warm");
     return;
   }
@@ -159,7 +167,6 @@ void ClientState::warm() {
       });
   if (assembly_.useBramble()) enableProxy(*task);
   task->resume();
-  _markNetworkRequest();
 }
 
 void ClientState::enableProxy(platform::HTTPDataTask& task) const {

@@ -40,6 +40,7 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   const std::optional<std::string>& clientShortName() const { return clientShortName_; }
   /// Null when the setting "SBLNoQueryCache" turned it off.
   QueryCache* queryCache() const { return queryCache_.get(); }
+  std::shared_ptr<const SBLBag> heldBag() const;  ///< null: none yet
   /// Null when the daemon records no sessions.
   ClientSessionManager* sessionManager() const { return sessionManager_; }
 
@@ -81,7 +82,6 @@ class ClientState : public std::enable_shared_from_this<ClientState> {
   bool _ensureBag();
   void bagChangeNotification(const platform::Notification& notification);
   void _markNetworkRequest();
-  std::shared_ptr<const SBLBag> heldBag() const;
 
   /// What the gates say of a query.
   enum class Verdict { bagMissing, bagDisabled, inputTooShort, passes };

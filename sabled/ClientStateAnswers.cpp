@@ -99,7 +99,7 @@ void ClientState::answerFromCache(Query& query, const CachedResultSet& hit) {
 
 void ClientState::_cacheResponse(const SearchResponse& response, const Query& query, const Data& data,
                                  const UUID& uuid) {
-  if (queryCache_ == nullptr) return;
+  if (queryCache_ == nullptr || queryCache_->generation() != query.cacheGeneration) return;
   const platform::WallTime now = assembly_.runtime.now();
   for (const SearchResponse::ResultSet& set : response.resultSets) {
     if (set.status == "ERROR") continue;

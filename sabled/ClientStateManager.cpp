@@ -53,7 +53,6 @@ ClientStateManager::ClientStateManager(Assembly& assembly)
   if (const auto resumed = listener_->resume(); !resumed) {
     log().error("cannot open the endpoint: {}", resumed.error().description());
   }
-  loadState();
 }
 
 ClientStateManager::~ClientStateManager() = default;

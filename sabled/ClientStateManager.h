@@ -43,6 +43,8 @@ class ClientStateManager {
 
   /// Writes the known sessions to the settings, where the user asked for that.
   void saveState();
+  /// Makes the states of those sessions. Once, before the first client.
+  void loadState();
 
   struct Session {
     std::string identifier;
@@ -73,7 +75,6 @@ class ClientStateManager {
   std::set<std::string> validImageHosts() const;
 
  private:
-  void loadState();
   bool acceptEndpointConnection(const std::shared_ptr<platform::RelayConnection>& connection);
   void handleEndpointCall(platform::RelayCall call);
   std::vector<Session> sessionsOnQueue() const;

@@ -11,6 +11,7 @@
 #include "sabled/CachedResultSet.h"
 #include "sabled/ClientNames.h"
 #include "sabled/ClientStateQuery.h"
+#include "sabled/QueryCache.h"
 #include "sabled/SBLNetworkRequestFactory.h"
 #include "sabled/SBLRetryableNetworkRequest.h"
 #include "sabled/SableUserGUIDController.h"
@@ -92,6 +93,7 @@ void ClientState::search(const SBLSearchRequest& request, SBLReplyHandler reply)
   count("keystrokes");
   if (refuses(*query)) return;
   if (const auto hit = cachedAnswer(request, nullptr)) return answerFromCache(*query, *hit);
+  if (queryCache_ != nullptr) query->cacheGeneration = queryCache_->generation();
   dispatch(query, searchRequest(*query, request, nullptr));
   assembly_.tally.add(kSBLSearchCounterKey, 1);
   assembly_.requestFactory->setPerformedSearch();

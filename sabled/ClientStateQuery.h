@@ -66,7 +66,8 @@ struct ClientState::Query {
   std::optional<platform::WallTime> expire;
   std::optional<std::int64_t> lookupSelectionType;  ///< of lookups
   platform::HTTPRequest httpRequest;
-  UUID uuid;  ///< of the request, in its feedback and in what is cached of its answer
+  std::uint64_t cacheGeneration = 0;  ///< when it was asked
+  UUID uuid;                          ///< of the request, in its feedback and in what is cached of its answer
 };
 
 }  // namespace sable

@@ -2,6 +2,7 @@
 
 #include <fmt/format.h>
 
+#include <atomic>
 #include <utility>
 
 #include "platform/CountryConfiguration.h"
@@ -25,14 +26,17 @@ using Entry = std::shared_ptr<const CachedResultSet>;
 using Tree = CritbitTree<const CachedResultSet>;
 
 /// On each the service might answer otherwise than it did.
-constexpr std::string_view kClearingNotifications[] = {
-    kSBLUserGUIDChangeNotification,
-    kSBLSessionSoftLimitNotification,
-    kSBLSessionMaxLimitNotification,
-    platform::kCountryCodeDidChangeNotification,
-    platform::kSystemTimeZoneDidChangeNotification,
-    platform::kCurrentLocaleDidChangeNotification,
-    platform::kEffectiveSettingsDidChangeNotification,
+constexpr struct {
+  std::string_view name;
+  bool changesRequests;  ///< an answer that is on its way was asked for in vain
+} kClearingNotifications[] = {
+    {kSBLUserGUIDChangeNotification, false},
+    {kSBLSessionSoftLimitNotification, false},
+    {kSBLSessionMaxLimitNotification, false},
+    {platform::kCountryCodeDidChangeNotification, true},
+    {platform::kSystemTimeZoneDidChangeNotification, true},
+    {platform::kCurrentLocaleDidChangeNotification, true},
+    {platform::kEffectiveSettingsDidChangeNotification, true},
 };
 
 const platform::LogHandle& log() {
@@ -66,6 +70,7 @@ class QueryCache::Entries : public std::enable_shared_from_this<Entries> {
         memoryPressure_(assembly.platform.memoryPressure()) {}
 
   const std::shared_ptr<platform::SerialQueue> queue;
+  std::atomic<std::uint64_t> generation = 0;  ///< any thread's
 
   Entry find(const QueryCacheQuestion& question, QueryCacheDecision* decision);
   void set(const Entry& entry);
@@ -143,14 +148,16 @@ void QueryCache::Entries::_didBecomeEmpty() {
 
 QueryCache::QueryCache(Assembly& assembly)
     : assembly_(assembly), entries_(std::make_shared<Entries>(assembly)) {
-  const auto _cacheClearNotification = [weak = std::weak_ptr(entries_)](const platform::Notification&) {
-    const auto entries = weak.lock();
-    if (entries == nullptr) return;
-    entries->queue->async([weak] {
-      if (const auto alive = weak.lock()) alive->_clearCache();
-    });
-  };
-  for (const std::string_view name : kClearingNotifications) {
+  for (const auto& [name, changesRequests] : kClearingNotifications) {
+    const auto _cacheClearNotification = [weak = std::weak_ptr(entries_),
+                                          changesRequests = changesRequests](const platform::Notification&) {
+      const auto entries = weak.lock();
+      if (entries == nullptr) return;
+      if (changesRequests) ++entries->generation;
+      entries->queue->async([weak] {
+        if (const auto alive = weak.lock()) alive->_clearCache();
+      });
+    };
     observations_.push_back(assembly.notificationCenter.observe(std::string(name), _cacheClearNotification));
   }
 }
@@ -184,7 +191,12 @@ void QueryCache::set(Entry entry) {
   entries_->queue->async([entries = entries_, entry = std::move(entry)] { entries->set(entry); });
 }
 
+std::uint64_t QueryCache::generation() const {
+  return entries_->generation;
+}
+
 void QueryCache::removeAllObjects() {
+  ++entries_->generation;
   entries_->queue->sync([this] { entries_->_clearCache(); });
 }
 

@@ -78,6 +78,8 @@ void SableDaemon::createServices() {
   deepLinkIngester_ = std::make_unique<SableDPAppDeepLinkIngester>(assembly_);
   deepLinkIngester_->scheduleMaintenance();
   service_ = std::make_unique<SableService>(assembly_);
+  // Not before: states take part in the shared session, which the service has made.
+  assembly_.clientStateManager->loadState();
 }
 
 Expected<void> SableDaemon::openListener() {

@@ -111,6 +111,54 @@ TEST_F(Daemon, SeveralConnectionsOfOneProcessAreToldOfAndKept) {
   EXPECT_EQ(device.platform.transactions().openCount(), 0u) << "the daemon may be stopped";
 }
 
+TEST_F(Daemon, AFailedSecondConfigurationEndsTheSessionOfTheFirst) {
+  VirtualClient& client = device.startWithClient();
+  client.search("wea");
+  client.configure("com.kestrel.beacon", "");
+  device.run();
+  EXPECT_FALSE(client.isConnected());
+  EXPECT_EQ(device.counter("ledger.noagent"), 0) << "what tells of its end has an agent";
+}
+
+TEST_F(Daemon, TheEndOfAConnectionEmptiesTheCacheOfItsClient) {
+  VirtualClient& client = device.startWithClient();
+  VirtualClient& other = device.client();
+  client.search("wea");
+  client.search("weat");
+  EXPECT_EQ(device.sent("/search"), 1u);
+  other.disconnect();
+  device.run();
+  client.search("weath");
+  EXPECT_EQ(device.sent("/search"), 2u);
+}
+
+TEST_F(Daemon, AnAnswerThatWasAskedForInVainIsNotKept) {
+  VirtualClient& client = device.startWithClient();
+  device.service.setDefaultLatency(1s);
+  const PendingAnswer answer = client.send(searchFor("wea", 1));
+  device.advance(500ms);
+  auto values = device.platform.localeInfo().values;
+  values.localeIdentifier = "de_DE";
+  device.platform.localeInfo().change(values);
+  device.await(answer);
+  client.ask(searchFor("weat", 2));
+  EXPECT_EQ(device.sent("/search"), 2u) << "it was of another locale";
+  client.ask(searchFor("weat", 3));
+  EXPECT_EQ(device.sent("/search"), 2u);
+}
+
+TEST_F(Daemon, ClientsOfAnEarlierRunShareTheSessionToo) {
+  device.platform.userDefaults().setByUser("SBLPersistSessions", true);
+  device.start();
+  device.client("com.kestrel.rover", "Rover/1");
+  device.restart();
+  const auto guidOf = [&](const char* identifier, const char* agent) {
+    device.client(identifier, agent).search("wea");
+    return sentValue(device.service.requests("/search").back().request, "X-Kestrel-UserGuid");
+  };
+  EXPECT_EQ(guidOf("com.kestrel.rover", "Rover/1"), guidOf("com.kestrel.news", "News/1"));
+}
+
 TEST_F(Daemon, ConnectionsWithOneIdentifierShareAState) {
   device.platform.userDefaults().setByUser("SBLPersistSessions", true);
   device.start();

@@ -222,12 +222,10 @@ TEST(DebugParameters, ReplaceWhatARequestWouldHaveSaid) {
 
 TEST_F(Requests, AnAnswerTellsWhetherItCameFromTheServiceOrTheCache) {
   const json network = world_.sablectlJSON({"search", "weath"});
-  const json cache = world_.sablectlJSON({"search", "weathe"});
   ASSERT_FALSE(network["reply"]["data"].at(0)["query"].get<std::string>().empty());
   EXPECT_EQ(network["reply"]["source"], "network");
-  EXPECT_EQ(cache["reply"]["source"], "cache");
-  EXPECT_EQ(cache["reply"]["data"], network["reply"]["data"]);
-  EXPECT_TRUE(cache["reply"]["http_request"].is_null());
+  EXPECT_EQ(world_.sablectlJSON({"search", "weathe"})["reply"]["source"], "network")
+      << "the end of a connection empties the cache";
   EXPECT_TRUE(world_.sablectlJSON({"search", "weathe", "--no-verbose"})["reply"]["source"].is_null())
       << "who does not ask is not told";
   const std::string typed = world_.sablectl({"type", "weather"}).output;
