@@ -226,6 +226,8 @@ TEST_F(Requests, AnAnswerTellsWhetherItCameFromTheServiceOrTheCache) {
   EXPECT_EQ(network["reply"]["source"], "network");
   EXPECT_EQ(world_.sablectlJSON({"search", "weathe"})["reply"]["source"], "network")
       << "the end of a connection empties the cache";
+  EXPECT_EQ(world_.sablectlJSON({"explain", "weathe"})["outcome"], "network");
+  EXPECT_EQ(world_.sablectlJSON({"explain", "weathe", "--after", "weath"})["outcome"], "cache");
   EXPECT_TRUE(world_.sablectlJSON({"search", "weathe", "--no-verbose"})["reply"]["source"].is_null())
       << "who does not ask is not told";
   const std::string typed = world_.sablectl({"type", "weather"}).output;

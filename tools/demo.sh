@@ -73,7 +73,7 @@ write_settings
 start_daemon
 
 show type "weather"
-show explain "weath"
+show explain "weath" --after "wea"
 show type "image viewer"
 printf '\n$ sablectl bag      (its first lines)\n'
 sablectl bag | sed -n '1,12p'

@@ -77,9 +77,13 @@ void addSearches(CLI::App& app, Invocation& invocation) {
   addText(type, "TEXT", typed->queryString, "What to type");
 
   const auto explained = std::make_shared<SBLSearchRequest>();
-  CLI::App& explain = add(app, invocation, "explain", "Say what a search would do, and why",
-                          [explained](const Context& context) { return runExplain(context, *explained); });
+  const auto before = std::make_shared<std::string>();
+  CLI::App& explain =
+      add(app, invocation, "explain", "Say what a search would do, and why",
+          [explained, before](const Context& context) { return runExplain(context, *explained, *before); });
   addRequestOptions(explain, *explained);
+  explain.add_option("--after", *before, "Search this first, so that the cache has its answer")
+      ->type_name("TEXT");
   addText(explain, "TEXT", explained->queryString, "What would be searched");
 
   addRequest(app, invocation, "zkw", "Ask what to offer before anything is typed",

@@ -25,7 +25,8 @@ ExitCode runImages(const Context& context, const ImageOptions& options);
 
 // What the daemon tells.
 /// What a search would do, and why: nothing is asked of the service.
-ExitCode runExplain(const Context& context, const SBLSearchRequest& request);
+/// `before` is searched first, unless empty: the cache is its connection's.
+ExitCode runExplain(const Context& context, SBLSearchRequest request, const std::string& before);
 /// What requests would tell of this device now, and what changes that.
 ExitCode runPrivacy(const Context& context);
 ExitCode runBag(const Context& context);

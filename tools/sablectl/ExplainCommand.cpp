@@ -9,9 +9,15 @@
 
 namespace sable::sablectl {
 
-ExitCode runExplain(const Context& context, const SBLSearchRequest& request) {
+ExitCode runExplain(const Context& context, SBLSearchRequest request, const std::string& before) {
   constexpr std::size_t kMaximumBytes = 64u << 20;
   return withSession(context, [&](Session& session) {
+    if (!before.empty()) {
+      SBLSearchRequest first = request;
+      first.queryString = before;
+      if (const Answer answer = session.request(first); answer.error) return fail(context, *answer.error);
+      ++request.queryId;
+    }
     const auto result = session.call(kSBLDiagnosticsRelay, SBLDiagnosticsRelay::explain,
                                      {std::string(SBLSearchRequest::kClassName), encodeRequest(request)});
     if (!result) return fail(context, result.error());
