@@ -99,7 +99,9 @@ void ClientState::answerFromCache(Query& query, const CachedResultSet& hit) {
 
 void ClientState::_cacheResponse(const SearchResponse& response, const Query& query, const Data& data,
                                  const UUID& uuid) {
-  if (queryCache_ == nullptr || queryCache_->generation() != query.cacheGeneration) return;
+  if (queryCache_ == nullptr) return;
+  // What has changed meanwhile has emptied the cache of answers like this one.
+  if (queryCache_->generation() != query.cacheGeneration || userAgent() != query.userAgent) return;
   const platform::WallTime now = assembly_.runtime.now();
   for (const SearchResponse::ResultSet& set : response.resultSets) {
     if (set.status == "ERROR") continue;

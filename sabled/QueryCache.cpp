@@ -196,7 +196,6 @@ std::uint64_t QueryCache::generation() const {
 }
 
 void QueryCache::removeAllObjects() {
-  ++entries_->generation;
   entries_->queue->sync([this] { entries_->_clearCache(); });
 }
 

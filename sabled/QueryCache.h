@@ -46,8 +46,8 @@ class QueryCache {
   /// that they would fill the budget alone.
   void set(std::shared_ptr<const CachedResultSet> entry);
 
-  /// Another one when what was asked for before is not worth keeping: the agent, locale, country, time zone
-  /// or restrictions have changed since, or the cache was emptied.
+  /// Another one when what was asked for before is not worth keeping: locale, country, time zone or
+  /// restrictions have changed since.
   std::uint64_t generation() const;
 
   void removeAllObjects();

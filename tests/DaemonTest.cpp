@@ -145,6 +145,13 @@ TEST_F(Daemon, AnAnswerThatWasAskedForInVainIsNotKept) {
   EXPECT_EQ(device.sent("/search"), 2u) << "it was of another locale";
   client.ask(searchFor("weat", 3));
   EXPECT_EQ(device.sent("/search"), 2u);
+
+  const PendingAnswer other = client.send(searchFor("pizz", 4));
+  device.advance(500ms);
+  device.client("com.kestrel.beacon", "Beacon/2");
+  device.await(other);
+  client.ask(searchFor("pizz", 5));
+  EXPECT_EQ(device.sent("/search"), 4u) << "it was of another agent";
 }
 
 TEST_F(Daemon, ClientsOfAnEarlierRunShareTheSessionToo) {
