@@ -63,7 +63,6 @@ class BackgroundTransfers::Core : public std::enable_shared_from_this<Core> {
   void begin(Entry& entry);
   void progressed(std::int64_t identifier, std::int64_t sent, std::int64_t expected);
   void finished(std::int64_t identifier, int attempts, HTTPResult result);
-  std::optional<Duration> pauseAskedFor(const Entry& entry);
   void again(Entry& entry, Duration pause, const std::string& why);
   void end(Entry& entry, std::optional<Error> error);
   void report(const BackgroundTransfer& transfer);
@@ -235,27 +234,16 @@ void BackgroundTransfers::Core::finished(std::int64_t identifier, int attempts, 
   entry.attempt = nullptr;
   entry.transfer.running = false;
   if (result.response) entry.transfer.task.currentURL = result.response->url;
-  entry.transfer.task.response = std::move(result.response);
+  const auto& response = entry.transfer.task.response = std::move(result.response);
+  const auto asked = response ? retryAfter(*response, runtime_.now()) : std::nullopt;
+  const Duration pause = asked ? retryPauseAsked(*asked, attempts, chance()) : Duration{};
   if (result.error) {
     if (!isWorthRetrying(*result.error)) return end(entry, std::move(result.error));
-    const Duration pause =
-        std::max(retryPause(attempts, chance()), pauseAskedFor(entry).value_or(Duration{}));
-    return again(entry, pause, result.error->description());
+    return again(entry, std::max(pause, retryPause(attempts, chance())), result.error->description());
   }
-  const HTTPResponse& response = *entry.transfer.task.response;
-  const auto asked = pauseAskedFor(entry);
-  const Duration pause = asked.value_or(Duration{});
   // Who is told to come back when it is too late takes that for the answer.
   if (!asked || later(runtime_.ticks(), pause) >= entry.deadline) return end(entry, std::nullopt);
-  again(entry, pause, "status " + std::to_string(response.status));
-}
-
-/// What the last answer asks for, also one that broke off.
-std::optional<Duration> BackgroundTransfers::Core::pauseAskedFor(const Entry& entry) {
-  const auto& response = entry.transfer.task.response;
-  const auto asked = response ? retryAfter(*response, runtime_.now()) : std::nullopt;
-  if (!asked) return std::nullopt;
-  return retryPauseAsked(*asked, entry.transfer.attempts, chance());
+  again(entry, pause, "status " + std::to_string(response->status));
 }
 
 void BackgroundTransfers::Core::again(Entry& entry, Duration pause, const std::string& why) {
